@@ -1,0 +1,32 @@
+// Who is at the other end of a local socket.
+#pragma once
+
+#include <sys/types.h>
+
+#include <cstdint>
+#include <optional>
+
+#include "platform/linux/UniqueDescriptor.hpp"
+
+namespace platform::linux_ {
+
+struct PeerIdentity {
+  pid_t pid = 0;
+  uid_t uid = static_cast<uid_t>(-1);
+  gid_t gid = static_cast<gid_t>(-1);
+
+  // The executable's place, or absent where it could not be established: such a peer has no entitlements.
+  struct Executable {
+    std::uint64_t device = 0;
+    std::uint64_t inode = 0;
+    friend bool operator==(const Executable&, const Executable&) = default;
+  };
+  std::optional<Executable> executable;
+  // A pidfd of that very process: readable once it has ended.
+  UniqueDescriptor process;
+};
+
+// From the socket itself. Each system call that fails leaves its part absent; a line in the log says why.
+PeerIdentity establishPeer(int socket);
+
+}  // namespace platform::linux_
