@@ -30,8 +30,8 @@ class Clock {
 class SystemControl {
  public:
   virtual ~SystemControl() = default;
-  // Fills `buffer` with the value of `name`, its terminating zero byte included, and sets `length` to what was
-  // filled. 0, or -1 with errno set.
+  // Fills `buffer` with the value of `name`, its terminating zero byte included, and sets `length` to what
+  // was filled. 0, or -1 with errno set.
   virtual int sysctlbyname(const char* name, void* buffer, std::size_t* length) = 0;
 };
 

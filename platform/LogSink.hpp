@@ -34,7 +34,10 @@ class LogSink {
 // Fills `arguments` into `format`; texts as "<private>" when `hideText`.
 std::string formatLogMessage(std::string_view format, std::span<const LogArgument> arguments, bool hideText);
 
+// The current platform's, else the installed one, else one that drops everything.
 LogSink& currentLogSink();
+// For programs without a Platform: once, before the first thread; the sink stays for the life of the process.
+void installLogSink(LogSink& sink);
 
 namespace detail {
 template <class T>
@@ -56,8 +59,8 @@ LogArgument logArgument(T&& value) {
 }
 }  // namespace detail
 
-// One channel. An argument that costs something to make is passed as a callable, which runs only if the line is
-// written. Any thread.
+// One channel. An argument that costs something to make is passed as a callable, which runs only if the line
+// is written. Any thread.
 class Logger {
  public:
   explicit Logger(LogChannel channel_) : channel(std::move(channel_)) {}
@@ -89,8 +92,8 @@ class Logger {
   const LogChannel channel;
 };
 
-// The channel of the platform's own pieces, subsystem "com.kestrel.hearth", with arguments in clear: for example
-// hearthLog("files").error("%s: %s", path, reason).
+// The channel of the platform's own pieces, subsystem "com.kestrel.hearth", with arguments in clear: for
+// example hearthLog("files").error("%s: %s", path, reason).
 Logger hearthLog(std::string_view category);
 
 }  // namespace platform

@@ -19,8 +19,8 @@ class NamedNotifications {
 
   virtual void post(std::string_view name) = 0;
 
-  // Runs `handler` on `queue`, with the token, after each post of `name`; posts that were not yet handled merge.
-  // `token` is written before the first call. 0, or a non-zero status, and `token` is then -1.
+  // Runs `handler` on `queue`, with the token, after each post of `name`; posts that were not yet handled
+  // merge. `token` is written before the first call. 0, or a non-zero status, and `token` is then -1.
   using Handler = std::function<void(std::int32_t token)>;
   virtual std::uint32_t registerHandler(std::string_view name, std::int32_t& token,
                                         std::shared_ptr<WorkQueue> queue, Handler handler) = 0;
@@ -28,12 +28,14 @@ class NamedNotifications {
   virtual void cancel(std::int32_t token) = 0;
 };
 
-// The same notifications, observed by object. Callbacks run on the main queue. The one service that may be absent.
+// The same notifications, observed by object. Callbacks run on the main queue. The one service that may be
+// absent.
 class NamedNotificationCentre {
  public:
   virtual ~NamedNotificationCentre() = default;
 
-  // What the callback gets is the observer, held for the call, and the name; a centre may fail to give either.
+  // What the callback gets is the observer, held for the call, and the name; a centre may fail to give
+  // either.
   using Callback = void (*)(const std::shared_ptr<void>& observer, const std::optional<std::string>& name);
 
   // The observer is held weakly, and is not called once it has died.

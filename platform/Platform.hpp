@@ -82,7 +82,10 @@ class Platform {
   std::array<Slot, 16> slots;
 };
 
-// The platform whose work this thread runs: the innermost PlatformScope's, else the installed one.
+// The platform whose work this thread runs: the innermost PlatformScope's, else the installed one; null if
+// neither.
+Platform* currentOrNull();
+// The same, where there must be one.
 Platform& current();
 // Once, by a program's main. The platform stays for the life of the process.
 void install(Platform& platform);

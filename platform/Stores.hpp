@@ -35,16 +35,17 @@ class KeyValueStore {
   virtual void removeObserver(const KeyObserver* observer, std::string_view key) = 0;
 };
 
-// The process's own preferences. An own write calls the key's observers on the writer's thread before it returns;
-// a write from elsewhere calls them on the delivery thread.
+// The process's own preferences. An own write calls the key's observers on the writer's thread before it
+// returns; a write from elsewhere calls them on the delivery thread.
 class UserPreferences : public KeyValueStore {};
 
-// Shared by the user's devices. It fires no key observation: each change would otherwise also be taken for one of
-// the user preferences. A change made outside the process posts `externalChangeNotification` on the in-process
-// centre, from the delivery thread, with the store itself as sender.
+// Shared by the user's devices. It fires no key observation: each change would otherwise also be taken for
+// one of the user preferences. A change made outside the process posts `externalChangeNotification` on the
+// in-process centre, from the delivery thread, with the store itself as sender.
 class CloudStore : public KeyValueStore {
  public:
-  static constexpr std::string_view externalChangeNotification = "com.kestrel.hearth.cloudStore.externalChange";
+  static constexpr std::string_view externalChangeNotification =
+      "com.kestrel.hearth.cloudStore.externalChange";
   // Entries of the user information.
   static constexpr std::string_view changeReasonKey = "ChangeReason";
   static constexpr std::string_view changedKeysKey = "ChangedKeys";

@@ -12,8 +12,8 @@
 
 namespace platform {
 
-// A moment as the daemon computes with it: seconds since 1970-01-01 00:00:00 UTC, fraction included. A double,
-// since integral ticks overflow at what a store may hold.
+// A moment as the daemon computes with it: seconds since 1970-01-01 00:00:00 UTC, fraction included. A
+// double, since integral ticks overflow at what a store may hold.
 using Time = std::chrono::duration<double>;
 
 // A moment as a property value: nanoseconds since 1970-01-01 00:00:00 UTC, as alarm descriptors count.
@@ -28,7 +28,8 @@ using Dictionary = std::map<std::string, Value, std::less<>>;
 
 // Null is a value of its own (root preferences store it); absence is std::optional's.
 struct Value {
-  using Storage = std::variant<std::nullptr_t, bool, std::int64_t, double, std::string, Date, List, Dictionary>;
+  using Storage =
+      std::variant<std::nullptr_t, bool, std::int64_t, double, std::string, Date, List, Dictionary>;
 
   Value(std::nullptr_t = nullptr) : storage(nullptr) {}
   Value(bool value) : storage(value) {}
@@ -44,7 +45,9 @@ struct Value {
 
   // The alternative itself, or nullptr: no conversion.
   template <class T>
-  const T* as() const { return std::get_if<T>(&storage); }
+  const T* as() const {
+    return std::get_if<T>(&storage);
+  }
 
   friend bool operator==(const Value&, const Value&);
 
@@ -60,8 +63,9 @@ std::optional<std::string> toText(const Value& value);
 // A list of texts only; anything else in it makes the whole absent.
 std::optional<std::vector<std::string>> toTexts(const Value& value);
 
-// As log lines print values: booleans as words, doubles as the shortest decimal that reads back with a fraction
-// and an exponent from 1e16 on, text bare but quoted inside a container, `null`, [a, b], [k: v] by key, [:].
+// As log lines print values: booleans as words, doubles as the shortest decimal that reads back with a
+// fraction and an exponent from 1e16 on, text bare but quoted inside a container, `null`, [a, b], [k: v] by
+// key, [:].
 std::string describe(const Value& value);
 std::string describe(const Dictionary& dictionary);
 std::string describe(double value);

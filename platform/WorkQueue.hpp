@@ -19,7 +19,8 @@ class WorkQueue {
   virtual void async(Work work) = 0;
 };
 
-// `sync` goes only from a queue of lower rank to one of higher rank, so no two queues can wait for each other.
+// `sync` goes only from a queue of lower rank to one of higher rank, so no two queues can wait for each
+// other.
 enum class QueueRank {
   delivery,  // where others are called: key-value deliveries, admissions
   state,     // where one object's state lives
@@ -27,8 +28,8 @@ enum class QueueRank {
 };
 
 // A label and a first-in-first-out list of work, drained by at most one thread at a time: normally one of the
-// pool's, during `sync` the caller's. So `sync` never needs a free pool thread, items may run on any stack, and
-// what they may rely on is the queue alone, never a thread's identity.
+// pool's, during `sync` the caller's. So `sync` never needs a free pool thread, items may run on any stack,
+// and what they may rely on is the queue alone, never a thread's identity.
 class PW_CAPABILITY("queue") SerialQueue : public WorkQueue,
                                            public std::enable_shared_from_this<SerialQueue> {
  public:
@@ -39,8 +40,9 @@ class PW_CAPABILITY("queue") SerialQueue : public WorkQueue,
   const std::string& label() const { return _label; }
 
   void async(Work work) override;
-  // Runs `work` on the calling thread, in queue order, and returns when it has run. Waiting for a queue that is
-  // on the caller's own stack, or for one of a rank not higher than the caller's innermost, stops the process.
+  // Runs `work` on the calling thread, in queue order, and returns when it has run. Waiting for a queue that
+  // is on the caller's own stack, or for one of a rank not higher than the caller's innermost, stops the
+  // process.
   void sync(const Work& work) PW_EXCLUDES(this);
 
   // Whether the innermost work item of this thread is one of this queue.
@@ -50,6 +52,9 @@ class PW_CAPABILITY("queue") SerialQueue : public WorkQueue,
 
  private:
   struct State;
+  void submit();
+  void drainAndHandOn(const void* own);  // `own`: the caller's item of `sync`, or null in the pool
+
   const std::string _label;
   const QueueRank rank;
   WorkQueue& pool;
@@ -58,8 +63,8 @@ class PW_CAPABILITY("queue") SerialQueue : public WorkQueue,
 
 enum class QualityOfService { default_, utility };
 
-// The maker of queues, over one pool that outlives them all. The global queues and the worker pool are the pool
-// itself: it has one class of service.
+// The maker of queues, over one pool that outlives them all. The global queues and the worker pool are the
+// pool itself: it has one class of service.
 class Queues {
  public:
   explicit Queues(std::shared_ptr<WorkQueue> pool_) : pool(std::move(pool_)) {}

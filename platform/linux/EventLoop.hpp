@@ -62,6 +62,7 @@ class EventLoop {
 
  private:
   void runHandedOver();
+  EventSource addTimer(int clock, std::uint64_t microseconds, std::function<void()> handler);
 
   sd_event* event = nullptr;
   UniqueDescriptor wakeUp;
