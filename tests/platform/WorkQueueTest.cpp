@@ -1,0 +1,159 @@
+#include "platform/WorkQueue.hpp"
+
+#include <gtest/gtest.h>
+
+#include <atomic>
+#include <chrono>
+#include <deque>
+#include <future>
+#include <memory>
+#include <stdexcept>
+#include <string>
+#include <thread>
+#include <vector>
+
+#include "platform/linux/ThreadPool.hpp"
+
+namespace platform {
+namespace {
+
+using linux_::ThreadPool;
+
+class HeldPool : public WorkQueue {
+ public:
+  void async(Work work) override { jobs.push_back(std::move(work)); }
+  void runOne() {
+    Work job = std::move(jobs.front());
+    jobs.pop_front();
+    job();
+  }
+  std::deque<Work> jobs;
+};
+
+TEST(SerialQueueTest, SyncNeedsNoPoolThread) {
+  auto pool = std::make_shared<HeldPool>();
+  const auto queue = Queues(pool).serial("q", QueueRank::state);
+  std::string order;
+  queue->async([&] { order += 'a'; });
+  queue->sync([&] {
+    EXPECT_TRUE(queue->isCurrent());
+    order += 'b';
+    queue->async([&] { order += 'c'; });
+  });
+  EXPECT_EQ(order, "ab");
+  while (!pool->jobs.empty()) pool->runOne();
+  EXPECT_EQ(order, "abc");
+  EXPECT_FALSE(queue->isCurrent());
+}
+
+TEST(SerialQueueTest, APoolThreadIsReturnedAfterItsTurn) {
+  auto pool = std::make_shared<HeldPool>();
+  const auto queue = Queues(pool).serial("q", QueueRank::state);
+  int ran = 0;
+  for (int i = 0; i < 100; ++i) queue->async([&] { ++ran; });
+  ASSERT_EQ(pool->jobs.size(), 1u);
+  pool->runOne();
+  EXPECT_EQ(ran, 64);
+  ASSERT_EQ(pool->jobs.size(), 1u);
+  pool->runOne();
+  EXPECT_EQ(ran, 100);
+}
+
+// A pool of one whose thread drains the queue: the caller is given the queue when its turn comes, and what
+// came after it waits for the pool.
+TEST(SerialQueueTest, ACallerThatWaitsIsGivenTheQueueInItsTurn) {
+  auto pool = std::make_shared<ThreadPool>(1);
+  const auto queue = Queues(pool).serial("q", QueueRank::state);
+  std::promise<void> inside, go;
+  std::string order;
+  queue->async([&] {
+    inside.set_value();
+    go.get_future().wait();
+    order += 'a';
+  });
+  inside.get_future().wait();
+  std::thread caller([&] {
+    queue->async([&] { order += 'b'; });
+    go.set_value();
+    queue->sync([&, caller = std::this_thread::get_id()] {
+      EXPECT_EQ(caller, std::this_thread::get_id());
+      order += 'c';
+    });
+    queue->async([&] { order += 'd'; });
+  });
+  caller.join();
+  queue->sync([&] { EXPECT_EQ(order, "abcd"); });
+}
+
+TEST(SerialQueueTest, TheLastReferenceMayGoInsideAnItem) {
+  auto pool = std::make_shared<HeldPool>();
+  auto queue = Queues(pool).serial("q", QueueRank::state);
+  const std::weak_ptr<SerialQueue> weak = queue;
+  queue->async([held = std::move(queue)] { EXPECT_TRUE(held->isCurrent()); });
+  pool->runOne();
+  EXPECT_TRUE(weak.expired());
+}
+
+using SerialQueueDeathTest = testing::Test;
+
+TEST(SerialQueueDeathTest, StopsWhereItWouldDeadlock) {
+  testing::FLAGS_gtest_death_test_style = "threadsafe";
+  Queues queues(std::make_shared<HeldPool>());
+  const auto low = queues.serial("low", QueueRank::delivery);
+  const auto high = queues.serial("high", QueueRank::state);
+  const auto peer = queues.serial("peer", QueueRank::state);
+  EXPECT_DEATH(low->sync([&] { low->sync([] {}); }), "sync on low from itself");
+  EXPECT_DEATH(low->sync([&] { high->sync([&] { low->sync([] {}); }); }), "sync on low from itself");
+  EXPECT_DEATH(high->sync([&] { peer->sync([] {}); }), "sync on peer from high: a queue of no lower rank");
+  EXPECT_DEATH(low->sync([] { throw std::runtime_error("an escaped text"); }), "an escaped text");
+  EXPECT_DEATH(high->assertCurrent(), "not on high");
+}
+
+// Writers, readers and nested hops at once; what each caller did stays in its own order, and nothing is lost.
+class SerialQueueStress : public testing::TestWithParam<int> {};
+
+TEST_P(SerialQueueStress, KeepsOrderAndLosesNothing) {
+  constexpr int callers = 4, rounds = 3000;
+  std::vector<int> last(callers, -1);
+  long total = 0, inner = 0;
+  std::atomic<int> nested = 0;
+  {
+    auto pool = std::make_shared<ThreadPool>(static_cast<std::size_t>(GetParam()));
+    Queues queues(pool);
+    const auto outer = queues.serial("outer", QueueRank::delivery);
+    const auto state = queues.serial("state", QueueRank::state);
+    const auto leaf = queues.serial("leaf", QueueRank::list);
+    std::vector<std::thread> threads;
+    for (int caller = 0; caller < callers; ++caller) {
+      threads.emplace_back([&, caller] {
+        for (int round = 0; round < rounds; ++round) {
+          state->async([&, caller, round] {
+            if (last[static_cast<std::size_t>(caller)] != round - 1) ADD_FAILURE() << "out of order";
+            last[static_cast<std::size_t>(caller)] = round;
+            ++total;
+            leaf->sync([&] { ++inner; });
+          });
+          if (round % 3 == 0) {
+            state->sync([&, caller, round] { EXPECT_EQ(last[static_cast<std::size_t>(caller)], round); });
+          }
+          if (round % 5 == 0) {
+            outer->async([&] { state->sync([&] { leaf->sync([&] { ++nested; }); }); });
+          }
+          // Readers that live in the pool itself, as client operations do.
+          if (round % 7 == 0) queues.workers()->async([&] { state->sync([&] { ++nested; }); });
+        }
+      });
+    }
+    for (auto& thread : threads) thread.join();
+    // The pool alone ends the queues: its destructor runs what is left.
+    EXPECT_TRUE(pool->waitUntilIdle(std::chrono::steady_clock::now() + std::chrono::seconds(60)));
+  }
+  EXPECT_EQ(total, callers * rounds);
+  EXPECT_EQ(inner, callers * rounds);
+  EXPECT_EQ(nested, callers * ((rounds + 4) / 5 + (rounds + 6) / 7));
+}
+
+INSTANTIATE_TEST_SUITE_P(Pools, SerialQueueStress, testing::Values(1, 2, 8));
+
+}  // namespace
+}  // namespace platform
