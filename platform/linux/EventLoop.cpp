@@ -8,6 +8,7 @@
 #include <cerrno>
 #include <cmath>
 #include <cstring>
+#include <exception>
 #include <string>
 #include <utility>
 
@@ -17,7 +18,7 @@ namespace platform::linux_ {
 namespace {
 
 void require(int result, const char* what) {
-  if (result < 0) stop(std::string("event loop: ") + what + ": " + std::strerror(-result));
+  if (result < 0) platform::stop(std::string("event loop: ") + what + ": " + std::strerror(-result));
 }
 
 // Timers are armed with this accuracy: sd-event's default of 250 ms is too coarse for alarms.
@@ -82,7 +83,11 @@ void EventLoop::runHandedOver() {
     batch.swap(handedOver);
   }
   for (Work& work : batch) {
-    work();
+    try {
+      work();
+    } catch (const std::exception& error) {
+      platform::stop(error.what());
+    }
     work = nullptr;  // a closure dies before the next one runs
   }
 }

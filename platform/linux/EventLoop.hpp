@@ -36,10 +36,10 @@ class EventSource {
 // Registrations, and everything that they call, belong to the thread that runs the loop (before run(): to the
 // thread that will). A failure to register, which only exhaustion can cause, stops the process. When nothing
 // happens, nothing wakes.
-class EventLoop {
+class EventLoop : public WorkQueue {
  public:
   EventLoop();
-  ~EventLoop();
+  ~EventLoop() override;
   EventLoop(const EventLoop&) = delete;
   EventLoop& operator=(const EventLoop&) = delete;
 
@@ -48,7 +48,7 @@ class EventLoop {
   // Any thread.
   void stop();
   // Any thread. Work runs in order.
-  void async(Work work);
+  void async(Work work) override;
 
   // `events` are epoll's; `handler` gets those that are ready.
   [[nodiscard]] EventSource watchDescriptor(int descriptor, std::uint32_t events,
