@@ -1,0 +1,59 @@
+#include "hearthd/AlarmFile.hpp"
+
+#include <system_error>
+
+#include "platform/LogSink.hpp"
+#include "platform/linux/Json.hpp"
+
+namespace hearth {
+namespace {
+
+constexpr std::size_t fileLimit = 64 << 20;
+
+const platform::Logger& log() {
+  static const platform::Logger logger = platform::hearthLog("hearthd");
+  return logger;
+}
+
+}  // namespace
+
+AlarmFile::AlarmFile(platform::linux_::FileSystem& files_, const std::string& folder)
+    : files(files_), path(folder + "/alarms.json") {
+  if (const auto made = files.makeFolder(folder); !made) {
+    log().error("%s: %s", folder, made.error().message());
+  }
+}
+
+Alarms AlarmFile::load() {
+  const auto bytes = platform::linux_::readFile(files, path, fileLimit);
+  if (!bytes) {
+    if (bytes.error() != std::errc::no_such_file_or_directory) moveAside(bytes.error().message());
+    return {};
+  }
+  std::string problem;
+  const auto value = platform::linux_::parseJson(*bytes, problem);
+  if (value) {
+    if (auto alarms = Alarms::fromValue(*value)) return std::move(*alarms);
+    problem = "is not a list of alarms";
+  }
+  moveAside(problem);
+  return {};
+}
+
+platform::Result<void> AlarmFile::save(const Alarms& alarms) {
+  const auto text = platform::linux_::printJson(alarms.toValue(), platform::linux_::JsonStyle::indented);
+  if (!text) return text.error();
+  const auto saved = platform::linux_::replaceFile(files, path, *text);
+  if (!saved) log().error("%s: %s", path, saved.error().message());
+  return saved;
+}
+
+void AlarmFile::moveAside(const std::string& problem) {
+  int number = 1;
+  const auto aside = [&] { return path + ".damaged-" + std::to_string(number); };
+  while (files.identity(aside())) ++number;
+  const auto moved = files.rename(path, aside());
+  log().error("%s: %s; moved to %s%s", path, problem, aside(), moved ? "" : ", which failed");
+}
+
+}  // namespace hearth

@@ -1,0 +1,29 @@
+// The alarms on disk.
+#pragma once
+
+#include <string>
+
+#include "hearthd/core/Alarms.hpp"
+#include "platform/Result.hpp"
+#include "platform/linux/FileSystem.hpp"
+
+namespace hearth {
+
+class AlarmFile {
+ public:
+  // `folder` is made if need be.
+  AlarmFile(platform::linux_::FileSystem& files, const std::string& folder);
+
+  // A file that cannot be read is moved aside, with a line in the log: no registration may overwrite it.
+  Alarms load();
+  // Durable once it has returned without an error; after one the file is as it was.
+  platform::Result<void> save(const Alarms& alarms);
+
+ private:
+  void moveAside(const std::string& problem);
+
+  platform::linux_::FileSystem& files;
+  const std::string path;
+};
+
+}  // namespace hearth

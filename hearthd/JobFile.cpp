@@ -1,0 +1,144 @@
+#include "hearthd/JobFile.hpp"
+
+#include <set>
+#include <string_view>
+#include <utility>
+
+#include "platform/LogSink.hpp"
+#include "platform/linux/Json.hpp"
+
+namespace hearth {
+namespace {
+
+constexpr std::size_t fileLimit = 1 << 20;
+
+// Reads the fields of one file; the first fault is kept.
+class Reader {
+ public:
+  explicit Reader(const platform::Dictionary& fields_) : fields(fields_) {}
+
+  std::string text(std::string_view key) {
+    const platform::Value* value = find(key);
+    if (!value) return fail(key, "is missing"), "";
+    const auto text = platform::toText(*value);
+    if (!text || text->empty()) return fail(key, "is not a text"), "";
+    return *text;
+  }
+
+  // Part of a file name below run/.
+  std::string fileName(std::string_view key, std::string name) {
+    if (name.find('/') != std::string::npos || name.rfind('.', 0) == 0) fail(key, "cannot be a file's name");
+    return name;
+  }
+
+  std::vector<std::string> texts(std::string_view key) {
+    const platform::Value* value = find(key);
+    if (!value) return {};
+    auto texts = platform::toTexts(*value);
+    if (!texts) return fail(key, "is not a list of texts"), std::vector<std::string>();
+    return std::move(*texts);
+  }
+
+  std::map<std::string, std::string> environment(std::string_view key) {
+    std::map<std::string, std::string> variables;
+    const platform::Value* value = find(key);
+    if (!value) return variables;
+    const auto* entries = value->as<platform::Dictionary>();
+    if (!entries) return fail(key, "is not a dictionary of texts"), variables;
+    for (const auto& [name, entry] : *entries) {
+      const auto text = platform::toText(entry);
+      if (!text) fail(key, "is not a dictionary of texts");
+      if (text) variables[name] = *text;
+    }
+    return variables;
+  }
+
+  bool boolean(std::string_view key, bool otherwise) {
+    const platform::Value* value = find(key);
+    if (!value) return otherwise;
+    const auto boolean = platform::toBool(*value);
+    if (!boolean) fail(key, "is not a boolean");
+    return boolean.value_or(otherwise);
+  }
+
+  const std::string& problem() const { return _problem; }
+
+ private:
+  const platform::Value* find(std::string_view key) const {
+    const auto found = fields.find(key);
+    return found == fields.end() ? nullptr : &found->second;
+  }
+  void fail(std::string_view key, std::string_view what) {
+    if (_problem.empty()) _problem = '"' + std::string(key) + "\" " + std::string(what);
+  }
+
+  const platform::Dictionary& fields;
+  std::string _problem;
+};
+
+JobDescription readJob(const std::string& bytes, const std::string& root, std::string& problem) {
+  JobDescription job;
+  const auto value = platform::linux_::parseJson(bytes, problem);
+  if (!value) return job;
+  const auto* fields = value->as<platform::Dictionary>();
+  if (!fields) {
+    problem = "is not a dictionary";
+    return job;
+  }
+  Reader reader(*fields);
+  job.name = reader.fileName("name", reader.text("name"));
+  job.program = reader.text("program");
+  if (job.program.rfind('/', 0) != 0) job.program = root + "/" + job.program;
+  job.environment = reader.environment("environment");
+  for (std::string& service : reader.texts("services")) {
+    job.services.push_back(reader.fileName("services", std::move(service)));
+  }
+  job.streams = reader.texts("streams");
+  job.matching = reader.texts("matching");
+  job.restart = reader.boolean("restart", true);
+  problem = reader.problem();
+  return job;
+}
+
+bool endsWith(std::string_view text, std::string_view end) {
+  return text.size() >= end.size() && text.substr(text.size() - end.size()) == end;
+}
+
+}  // namespace
+
+std::vector<JobDescription> readJobs(platform::linux_::FileSystem& files, const std::string& folder,
+                                     const std::string& root) {
+  std::vector<JobDescription> jobs;
+  const auto log = platform::hearthLog("hearthd");
+  const auto names = files.list(folder);
+  if (!names) {
+    log.error("%s: %s", folder, names.error().message());
+    return jobs;
+  }
+  std::set<std::string> taken;
+  for (const std::string& name : *names) {
+    if (!endsWith(name, ".json")) continue;
+    const std::string path = folder + "/" + name;
+    const auto bytes = platform::linux_::readFile(files, path, fileLimit);
+    std::string problem;
+    JobDescription job;
+    if (bytes) {
+      job = readJob(*bytes, root, problem);
+    } else {
+      problem = bytes.error().message();
+    }
+    if (problem.empty() && !taken.insert("job " + job.name).second) problem = "a second job " + job.name;
+    for (const std::string& service : job.services) {
+      if (problem.empty() && !taken.insert("service " + service).second)
+        problem = "a second service " + service;
+    }
+    if (problem.empty()) {
+      jobs.push_back(std::move(job));
+    } else {
+      log.error("%s: %s; the file is skipped", path, problem);
+    }
+  }
+  return jobs;
+}
+
+}  // namespace hearth

@@ -1,0 +1,267 @@
+#include "hearthd/ServiceManager.hpp"
+
+#include <sys/epoll.h>
+#include <unistd.h>
+
+#include <algorithm>
+#include <cstdlib>
+#include <utility>
+
+#include "hearthd/Connection.hpp"
+#include "hearthd/ListeningSocket.hpp"
+#include "platform/LogSink.hpp"
+#include "platform/linux/HearthInterface.hpp"
+
+namespace hearth {
+namespace {
+
+using platform::linux_::HearthSignal;
+using platform::linux_::PeerIdentity;
+using platform::linux_::UniqueDescriptor;
+
+constexpr const char* matchingStream = "com.kestrel.tidingsd.matching";
+
+const platform::Logger& log() {
+  static const platform::Logger logger = platform::hearthLog("hearthd");
+  return logger;
+}
+
+Moment now() {
+  return {std::chrono::system_clock::now().time_since_epoch(),
+          std::chrono::steady_clock::now().time_since_epoch()};
+}
+
+bool contains(const std::vector<std::string>& list, const std::string& text) {
+  return std::find(list.begin(), list.end(), text) != list.end();
+}
+
+// What a job's contract asks for, and nothing else of ours.
+std::map<std::string, std::string> environmentOf(const JobDescription& job, const std::string& root) {
+  auto environment = job.environment;
+  if (!job.services.empty()) environment["CONDUIT_SERVICE_NAME"] = job.services.front();
+  if (!root.empty()) environment["HEARTH_ROOT"] = root;
+  for (const char* name : {"HEARTH_LOG_PRIVATE", "HEARTH_LOG_LEVEL"}) {
+    if (const char* value = std::getenv(name)) environment[name] = value;
+  }
+  return environment;
+}
+
+}  // namespace
+
+ServiceManager::ServiceManager(platform::linux_::EventLoop& loop_, platform::linux_::FileSystem& files_,
+                               platform::linux_::Paths paths_)
+    : loop(loop_),
+      paths(std::move(paths_)),
+      files(files_),
+      alarmFile(files_, paths.hearthd()),
+      alarms(alarmFile.load()),
+      server(platform::linux_::hearthInterface()) {}
+
+platform::Result<void> ServiceManager::start(std::function<void()> ready) {
+  if (const auto listening = listen(); !listening) return listening;
+  whenReady = std::move(ready);
+  for (JobDescription& description : readJobs(files, paths.jobs(), paths.root))
+    addJob(std::move(description));
+  for (const auto& job : allJobs) job->start();
+  startedAll = true;
+  jobChanged();
+  return {};
+}
+
+void ServiceManager::stop(std::function<void()> stopped) {
+  server.stopListening();
+  whenReady = nullptr;
+  whenStopped = std::move(stopped);
+  for (const auto& job : allJobs) job->stop();
+  jobChanged();
+}
+
+platform::Result<void> ServiceManager::listen() {
+  auto socket = listenAt(paths.hearthdSocket());
+  if (!socket) return socket.error();
+  server.listen(std::move(*socket), [this](PeerIdentity peer, platform::linux_::BusServer::Decide decide) {
+    const Watcher watcher = ++lastWatcher;
+    const bool privileged = peer.uid == 0 || peer.uid == ::geteuid();
+    decide({std::make_shared<Connection>(*this, watcher, Connection::Rights{privileged, ""}),
+            [this, watcher](auto connection) { connected(watcher, std::move(connection)); }});
+  });
+  serverWatch =
+      loop.watchDescriptor(server.descriptor(), EPOLLIN, [this](std::uint32_t) { server.dispatch(); });
+  return {};
+}
+
+void ServiceManager::addJob(JobDescription description) {
+  Job::Surroundings surroundings;
+  const std::string name = description.name;
+  surroundings.lifeLock = paths.run + "/" + name + ".life";
+  surroundings.environment = environmentOf(description, paths.root);
+  surroundings.started = [this, name](UniqueDescriptor link, pid_t pid) {
+    adoptLink(name, std::move(link), pid);
+  };
+  surroundings.ended = [this, name] { jobEnded(name); };
+  surroundings.changed = [this] { jobChanged(); };
+  if (const auto added = addServices(description, surroundings); !added) return;
+  broker.listMatching(name, description.matching);
+  allJobs.push_back(std::make_unique<Job>(loop, std::move(description), std::move(surroundings)));
+}
+
+// The sockets are bound once, and stay while the job restarts: its clients wait meanwhile.
+platform::Result<void> ServiceManager::addServices(const JobDescription& description,
+                                                   Job::Surroundings& surroundings) {
+  for (const std::string& service : description.services) {
+    auto socket = listenAt(paths.serviceSocket(service));
+    if (!socket) {
+      log().error("%s: %s: %s; the job is skipped", description.name, paths.serviceSocket(service),
+                  socket.error().message());
+      return socket.error();
+    }
+    surroundings.services.push_back({service, socket->get()});
+    serviceSockets.push_back(std::move(*socket));
+  }
+  return {};
+}
+
+void ServiceManager::adoptLink(const std::string& job, UniqueDescriptor link, pid_t pid) {
+  const Watcher watcher = ++lastWatcher;
+  PeerIdentity peer;
+  peer.pid = pid;
+  peer.uid = ::geteuid();
+  peer.gid = ::getegid();
+  links[job] = watcher;
+  connected(watcher,
+            server.adopt(std::move(link), std::move(peer),
+                         std::make_shared<Connection>(*this, watcher, Connection::Rights{false, job})));
+}
+
+// Its connection stays: what the job sent last, a post perhaps, may still be unread. It ends by itself.
+void ServiceManager::jobEnded(const std::string& job) {
+  links.erase(job);
+  alarms.jobEnded(job);
+  pendingEvents.jobEnded(job);
+  deliverDue();
+}
+
+void ServiceManager::jobChanged() {
+  const auto any = [this](auto test) {
+    return std::any_of(allJobs.begin(), allJobs.end(), [&](const auto& job) { return test(job->state()); });
+  };
+  if (whenReady && startedAll && !any([](Job::State state) { return state == Job::State::clearing; })) {
+    std::exchange(whenReady, nullptr)();
+  }
+  if (whenStopped && !any([](Job::State state) { return state != Job::State::stopped; })) {
+    std::exchange(whenStopped, nullptr)();
+  }
+}
+
+void ServiceManager::connected(Watcher watcher, std::shared_ptr<platform::linux_::BusConnection> connection) {
+  connections[watcher] = std::move(connection);
+}
+
+void ServiceManager::disconnected(Watcher watcher) {
+  broker.remove(watcher);
+  connections.erase(watcher);
+}
+
+void ServiceManager::post(const std::string& name) {
+  for (const Watcher watcher : broker.watchers(name)) {
+    const auto found = connections.find(watcher);
+    if (found == connections.end()) continue;
+    const auto connection = found->second;  // writing may find it dead
+    connection->emit(static_cast<std::size_t>(HearthSignal::notification), {name}, "notification:" + name);
+  }
+  for (const std::string& job : broker.matchingJobs(name)) deliver({job, matchingStream, name});
+}
+
+std::vector<std::string> ServiceManager::consumers(const std::string& stream) const {
+  std::vector<std::string> names;
+  for (const auto& job : allJobs) {
+    const std::string& name = job->description().name;
+    if (owns(name, stream) || pendingEvents.hasHandler(name, stream)) names.push_back(name);
+  }
+  return names;
+}
+
+bool ServiceManager::owns(const std::string& job, const std::string& stream) const {
+  return std::any_of(allJobs.begin(), allJobs.end(), [&](const auto& candidate) {
+    return candidate->description().name == job && contains(candidate->description().streams, stream);
+  });
+}
+
+template <class Change>
+auto ServiceManager::changeAlarms(Change change)
+    -> platform::Result<decltype(change(std::declval<Alarms&>()))> {
+  Alarms changed = alarms;
+  const auto answer = change(changed);
+  if (const auto saved = alarmFile.save(changed); !saved) return saved.error();
+  alarms = std::move(changed);
+  deliverDue();
+  return answer;
+}
+
+platform::Result<std::int64_t> ServiceManager::setAlarm(const EventKey& key, platform::Date date) {
+  return changeAlarms([&](Alarms& changed) { return changed.set(key, date); });
+}
+
+platform::Result<std::int64_t> ServiceManager::clearAlarm(const EventKey& key) {
+  if (!alarms.contains(key)) return alarms.clear(key);  // nothing for the disk
+  return changeAlarms([&](Alarms& changed) { return changed.clear(key); });
+}
+
+platform::Result<std::size_t> ServiceManager::clearAlarms(const std::string& name) {
+  return changeAlarms([&](Alarms& changed) { return changed.clearNamed(name); });
+}
+
+void ServiceManager::installHandler(Watcher watcher, const std::string& job, const std::string& stream) {
+  const auto link = links.find(job);
+  if (link == links.end() || link->second != watcher) return;  // read after the job has ended
+  alarms.handlerInstalled(job, stream, now());
+  for (const std::string& name : pendingEvents.handlerInstalled(job, stream))
+    emitEvent({job, stream, name}, 0);
+  deliverDue();
+}
+
+void ServiceManager::taken(const EventKey& key, std::int64_t generation) {
+  Alarms changed = alarms;
+  if (!changed.taken(key, generation)) return;
+  // Gone from memory even where the disk refuses: this run does not deliver it again, the next one may.
+  alarms = std::move(changed);
+  if (!alarmFile.save(alarms)) log().error("alarm %s may come again after a restart", key.name);
+}
+
+void ServiceManager::deliver(const EventKey& key) {
+  if (pendingEvents.add(key.job, key.stream, key.name)) emitEvent(key, 0);
+}
+
+void ServiceManager::deliverDue() {
+  for (const Alarm& alarm : alarms.takeDue(now())) emitEvent(alarm.key, alarm.generation);
+  const Moment moment = now();
+  const Alarms::Next next = alarms.next(moment);
+  wallTimer = {};
+  steadyTimer = {};
+  if (next.wall) wallTimer = loop.callAt(*next.wall, [this] { deliverDue(); });
+  if (next.steady) {
+    steadyTimer = loop.callAfter(std::chrono::ceil<std::chrono::microseconds>(*next.steady - moment.steady),
+                                 [this] { deliverDue(); });
+  }
+}
+
+void ServiceManager::emitEvent(const EventKey& key, std::int64_t generation) {
+  const auto link = links.find(key.job);
+  if (link == links.end()) return;
+  const auto found = connections.find(link->second);
+  if (found == connections.end()) return;
+  const auto connection = found->second;
+  // An event by hand must not take the place of an alarm's, whose generation the job has to give back.
+  const std::string kind = generation == 0 ? "event:" : "alarm:";
+  connection->emit(static_cast<std::size_t>(HearthSignal::event), {key.stream, key.name, generation},
+                   kind + key.stream + ":" + key.name);
+}
+
+Job* ServiceManager::findJob(const std::string& name) {
+  for (const auto& job : allJobs) {
+    if (job->description().name == name) return job.get();
+  }
+  return nullptr;
+}
+
+}  // namespace hearth

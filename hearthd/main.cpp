@@ -1,0 +1,114 @@
+// hearthd [--root DIR]: the service manager, in the foreground.
+#include <signal.h>
+#include <sys/resource.h>
+#include <sys/stat.h>
+#include <systemd/sd-daemon.h>
+
+#include <cstdio>
+#include <cstdlib>
+#include <filesystem>
+#include <optional>
+#include <string>
+#include <string_view>
+#include <system_error>
+
+#include "hearthd/LifeLock.hpp"
+#include "hearthd/ServiceManager.hpp"
+#include "platform/LogSink.hpp"
+#include "platform/linux/EventLoop.hpp"
+#include "platform/linux/Paths.hpp"
+#include "platform/linux/UnifiedLog.hpp"
+
+namespace {
+
+using platform::linux_::UniqueDescriptor;
+
+constexpr int failed = 1;
+constexpr int wrongUsage = 2;
+
+// Absolute, since jobs have another working folder; empty for the system's folders.
+std::optional<std::string> rootFromArguments(int count, char** arguments) {
+  std::string root;
+  if (const char* variable = std::getenv("HEARTH_ROOT")) root = variable;
+  for (int index = 1; index < count; ++index) {
+    const std::string_view argument = arguments[index];
+    if (argument == "--root" && index + 1 < count) {
+      root = arguments[++index];
+    } else if (argument.rfind("--root=", 0) == 0) {
+      root = argument.substr(7);
+    } else {
+      return std::nullopt;
+    }
+  }
+  if (root.empty()) return root;
+  auto path = std::filesystem::absolute(root).lexically_normal().string();
+  if (path.size() > 1 && path.back() == '/') path.pop_back();
+  return path;
+}
+
+void prepareProcess() {
+  ::umask(022);
+  ::signal(SIGPIPE, SIG_IGN);
+  sigset_t watched;
+  sigemptyset(&watched);
+  for (const int signal : {SIGTERM, SIGINT}) sigaddset(&watched, signal);
+  ::sigprocmask(SIG_BLOCK, &watched, nullptr);
+  // A client costs a descriptor, and the usual limit is lower than the clients that are let in.
+  rlimit files{};
+  if (::getrlimit(RLIMIT_NOFILE, &files) == 0) {
+    files.rlim_cur = files.rlim_max;
+    ::setrlimit(RLIMIT_NOFILE, &files);
+  }
+}
+
+// The lock that says that a hearthd lives on this root.
+std::optional<UniqueDescriptor> takeRoot(const platform::linux_::Paths& paths) {
+  std::error_code error;
+  std::filesystem::create_directories(paths.run, error);
+  const std::string path = paths.run + "/hearthd.lock";
+  auto lock = hearth::takeLock(path);
+  if (!lock) {
+    std::fprintf(stderr, "hearthd: %s: %s\n", path.c_str(), lock.error().message().c_str());
+    return std::nullopt;
+  }
+  if (!*lock) {
+    std::fputs("hearthd: already running\n", stderr);
+    return std::nullopt;
+  }
+  return std::move(*lock);
+}
+
+void announceReady() {
+  std::fputs("hearthd: ready\n", stderr);
+  sd_notify(0, "READY=1");
+}
+
+}  // namespace
+
+int main(int count, char** arguments) {
+  const auto root = rootFromArguments(count, arguments);
+  if (!root) {
+    std::fputs("usage: hearthd [--root DIR]\n", stderr);
+    return wrongUsage;
+  }
+  prepareProcess();
+  platform::linux_::UnifiedLog log(!root->empty());
+  platform::installLogSink(log);
+  const auto paths = platform::linux_::Paths::under(*root);
+  const auto alive = takeRoot(paths);
+  if (!alive) return failed;
+
+  platform::linux_::EventLoop loop;
+  platform::linux_::LinuxFileSystem files;
+  hearth::ServiceManager manager(loop, files, paths);
+  const auto stop = [&] { manager.stop([&] { loop.stop(); }); };
+  const auto terminated = loop.watchSignal(SIGTERM, stop);
+  const auto interrupted = loop.watchSignal(SIGINT, stop);
+  if (const auto started = manager.start(announceReady); !started) {
+    std::fprintf(stderr, "hearthd: %s: %s\n", paths.hearthdSocket().c_str(),
+                 started.error().message().c_str());
+    return failed;
+  }
+  loop.run();
+  return 0;
+}

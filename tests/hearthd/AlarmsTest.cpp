@@ -1,0 +1,210 @@
+// What the alarms decide, by a clock that the tests set.
+#include "hearthd/core/Alarms.hpp"
+
+#include <gmock/gmock.h>
+#include <gtest/gtest.h>
+
+#include <algorithm>
+#include <cmath>
+#include <string>
+#include <vector>
+
+#include "hearthd/core/Broker.hpp"
+#include "hearthd/core/PendingEvents.hpp"
+#include "hearthd/core/Restarts.hpp"
+
+namespace hearth {
+namespace {
+
+using platform::Date;
+using platform::Time;
+using testing::ElementsAre;
+using testing::IsEmpty;
+
+constexpr const char* stream = "com.kestrel.alarm";
+
+Date at(double seconds) { return {static_cast<std::int64_t>(seconds * 1e9)}; }
+EventKey key(const std::string& name, const std::string& job = "job") { return {job, stream, name}; }
+
+// Wall clock and steady clock move together, but for setWall().
+class AlarmsTest : public testing::Test {
+ protected:
+  void advance(double seconds) {
+    now.wall += Time(seconds);
+    now.steady += Time(seconds);
+  }
+  void setWall(double seconds) { now.wall = Time(seconds); }
+  std::vector<std::string> due() {
+    std::vector<std::string> names;
+    for (const Alarm& alarm : alarms.takeDue(now)) {
+      names.push_back(alarm.key.name + "/" + std::to_string(alarm.generation));
+    }
+    return names;
+  }
+  // How long until takeDue() is to be asked again, or -1.
+  double wait() {
+    const Alarms::Next next = alarms.next(now);
+    double least = INFINITY;
+    if (next.wall) least = std::min(least, (*next.wall - now.wall).count());
+    if (next.steady) least = std::min(least, (*next.steady - now.steady).count());
+    return std::isinf(least) ? -1 : std::max(least, 0.0);
+  }
+
+  Alarms alarms;
+  Moment now{Time(1000), Time(5)};
+};
+
+TEST_F(AlarmsTest, ComesOnceWhenDueAndAgainToTheNextRunUntilTaken) {
+  alarms.set(key("a"), at(1010));
+  EXPECT_EQ(wait(), -1) << "nobody to deliver to";
+  alarms.handlerInstalled("job", stream, now);
+  EXPECT_EQ(wait(), 10);
+  advance(9.5);
+  EXPECT_THAT(due(), IsEmpty());
+  advance(0.5);
+  EXPECT_THAT(due(), ElementsAre("a/1"));
+  EXPECT_THAT(due(), IsEmpty());
+  EXPECT_EQ(wait(), -1);
+
+  alarms.jobEnded("job");
+  alarms.handlerInstalled("job", stream, now);
+  EXPECT_EQ(wait(), 1);
+  advance(1);
+  EXPECT_THAT(due(), ElementsAre("a/1"));
+  EXPECT_TRUE(alarms.taken(key("a"), 1));
+  alarms.jobEnded("job");
+  alarms.handlerInstalled("job", stream, now);
+  advance(5);
+  EXPECT_THAT(due(), IsEmpty());
+}
+
+TEST_F(AlarmsTest, OverdueAtInstallWaitsASecondAndWhatTheStartRegistersCounts) {
+  for (const char* name : {"kept", "cleared", "replaced"}) alarms.set(key(name), at(990));
+  alarms.set(key("soon"), at(1000.25));
+  alarms.set(key("other", "otherJob"), at(990));
+  alarms.handlerInstalled("job", stream, now);
+  EXPECT_THAT(due(), IsEmpty());
+  alarms.clear(key("cleared"));
+  alarms.set(key("replaced"), at(1060));
+  advance(0.25);
+  EXPECT_THAT(due(), ElementsAre("soon/4")) << "was not overdue, so it does not wait";
+  advance(0.5);
+  EXPECT_THAT(due(), IsEmpty());
+  EXPECT_EQ(wait(), 0.25);
+  advance(0.25);
+  EXPECT_THAT(due(), ElementsAre("kept/1"));
+  advance(100);
+  EXPECT_THAT(due(), ElementsAre("replaced/7"));
+}
+
+TEST_F(AlarmsTest, LateTakenRemovesOnlyItsOwnGeneration) {
+  alarms.handlerInstalled("job", stream, now);
+  const auto first = alarms.set(key("a"), at(999));
+  EXPECT_THAT(due(), ElementsAre("a/1"));
+  const auto second = alarms.set(key("a"), at(1001));
+  EXPECT_FALSE(alarms.taken(key("a"), first));
+  advance(1);
+  EXPECT_THAT(due(), ElementsAre("a/2"));
+  EXPECT_GT(alarms.clear(key("a")), second) << "what is under way is stale";
+  EXPECT_FALSE(alarms.taken(key("a"), second));
+  EXPECT_GT(alarms.set(key("a"), at(2000)), second);
+}
+
+TEST_F(AlarmsTest, FollowsTheClockWhenItIsSet) {
+  alarms.set(key("a"), at(1100));
+  alarms.handlerInstalled("job", stream, now);
+  setWall(500);
+  EXPECT_EQ(wait(), 600);
+  setWall(1200);
+  EXPECT_EQ(wait(), 0);
+  EXPECT_THAT(due(), ElementsAre("a/1"));
+
+  // The wait of an overdue one is no wall-clock time: setting the clock back does not stretch it.
+  alarms.set(key("b"), at(100));
+  alarms.jobEnded("job");
+  alarms.handlerInstalled("job", stream, now);
+  setWall(600);
+  EXPECT_EQ(wait(), 1);
+  advance(1);
+  EXPECT_THAT(due(), ElementsAre("b/2"));
+}
+
+TEST_F(AlarmsTest, ReadsBackWhatItWroteWithGenerationsGoingOn) {
+  alarms.set(key("a"), at(1));
+  alarms.set(key("b", "otherJob"), {INT64_MIN});
+  alarms.set(key("c"), {INT64_MAX});
+  alarms.clear(key("c"));
+  auto back = Alarms::fromValue(alarms.toValue());
+  ASSERT_TRUE(back);
+  EXPECT_EQ(back->toValue(), alarms.toValue());
+  EXPECT_EQ(back->set(key("d"), at(1)), 5);
+
+  const platform::Value good = alarms.toValue();
+  const auto& whole = *good.as<platform::Dictionary>();
+  const auto with = [&](const char* name, platform::Value value) {
+    auto copy = whole;
+    copy[name] = std::move(value);
+    return platform::Value(copy);
+  };
+  auto entry = *(*whole.at("alarms").as<platform::List>())[0].as<platform::Dictionary>();
+  entry["date"] = "soon";
+  for (const platform::Value& bad :
+       {platform::Value(), with("lastGeneration", "x"), with("lastGeneration", 0), with("alarms", 1),
+        with("alarms", platform::List{platform::List()}), with("alarms", platform::List{entry})}) {
+    EXPECT_FALSE(Alarms::fromValue(bad)) << platform::describe(bad);
+  }
+}
+
+TEST_F(AlarmsTest, CancellingByNameReachesEveryJob) {
+  alarms.set(key("a"), at(1));
+  alarms.set(key("a", "otherJob"), at(1));
+  alarms.set(key("b"), at(1));
+  EXPECT_EQ(alarms.clearNamed("a"), 2u);
+  ASSERT_EQ(alarms.list().size(), 1u);
+  EXPECT_EQ(alarms.list()[0].key.name, "b");
+}
+
+TEST(Broker, KnowsWhoWatchesUntilTheyLeave) {
+  Broker broker;
+  EXPECT_TRUE(broker.watch(1, "a"));
+  EXPECT_TRUE(broker.watch(1, "a"));
+  EXPECT_TRUE(broker.watch(2, "a"));
+  EXPECT_TRUE(broker.watch(1, "b"));
+  EXPECT_THAT(broker.watchers("a"), ElementsAre(1, 2));
+  EXPECT_THAT(broker.watchers("A"), IsEmpty());
+  broker.unwatch(1, "a");
+  EXPECT_THAT(broker.watchers("a"), ElementsAre(2));
+  broker.remove(1);
+  EXPECT_THAT(broker.watchers("b"), IsEmpty());
+
+  std::size_t most = 0;
+  while (most <= Broker::namesPerWatcher && broker.watch(3, std::to_string(most))) ++most;
+  EXPECT_EQ(most, Broker::namesPerWatcher);
+  EXPECT_TRUE(broker.watch(3, "0")) << "watched already";
+  EXPECT_TRUE(broker.watch(2, "another"));
+}
+
+TEST(PendingEvents, WaitMergedForTheHandlerAndAgainForThatOfTheNextRun) {
+  PendingEvents events;
+  EXPECT_FALSE(events.add("job", stream, "a"));
+  EXPECT_FALSE(events.add("job", stream, "a"));
+  EXPECT_FALSE(events.add("job", "other", "b"));
+  EXPECT_THAT(events.handlerInstalled("job", stream), ElementsAre("a"));
+  EXPECT_TRUE(events.add("job", stream, "c"));
+  events.jobEnded("job");
+  EXPECT_FALSE(events.add("job", stream, "d"));
+  EXPECT_THAT(events.handlerInstalled("job", stream), ElementsAre("d"));
+}
+
+TEST(Restarts, DelayGrowsToItsLimitUntilARunWasSound) {
+  using std::chrono::milliseconds;
+  Restarts restarts;
+  std::vector<milliseconds::rep> delays;
+  for (int count = 0; count < 12; ++count) delays.push_back(restarts.delayAfter(milliseconds(5)).count());
+  EXPECT_THAT(delays, ElementsAre(100, 200, 400, 800, 1600, 3200, 6400, 12800, 25600, 51200, 60000, 60000));
+  EXPECT_EQ(restarts.delayAfter(Restarts::soundRun).count(), 100);
+  EXPECT_EQ(restarts.delayAfter({}).count(), 200);
+}
+
+}  // namespace
+}  // namespace hearth
