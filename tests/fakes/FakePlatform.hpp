@@ -1,0 +1,102 @@
+// One device made of fakes, moved by hand.
+#pragma once
+
+#include <cstdint>
+#include <functional>
+#include <memory>
+#include <optional>
+#include <random>
+#include <string>
+#include <string_view>
+#include <vector>
+
+#include "platform/Platform.hpp"
+#include "tests/fakes/Effects.hpp"
+#include "tests/fakes/FakeEnvironment.hpp"
+#include "tests/fakes/FakeNotifications.hpp"
+#include "tests/fakes/FakeService.hpp"
+#include "tests/fakes/FakeStores.hpp"
+#include "tests/fakes/ManualPool.hpp"
+
+namespace fakes {
+
+// Thrown in place of the process's stop. No std::exception, or a work queue would take it for a fault.
+struct Stopped {
+  std::string text;
+};
+
+// Everything runs on the thread of the test. Any number may live in one process; each is current while its
+// own work runs.
+class FakePlatform : public platform::Platform {
+ public:
+  FakePlatform();
+  ~FakePlatform() override;
+
+  // Draws the order of the pool's work, and whose turn it is, from `value`, which is printed.
+  void seed(std::uint64_t value);
+  // One item of the pool, the main queue or the delivery thread. False if there is none.
+  bool runOne();
+  // Everything that is queued and what that queues. Fails the test if that does not end.
+  void runAll();
+  // Lets time pass, with a stop at every date on the way at which an alarm comes due.
+  void advance(platform::Time duration);
+
+  // Run by teardown() when the handlers are gone: lists that hold their members strongly are emptied here.
+  std::vector<std::function<void()>> cutSubscriptions;
+  // Handlers, subscriptions, queued work, slots, while the platform is current; the destructor does it too.
+  void teardown();
+
+  platform::RunLoop& runLoop() override { return loop; }
+  platform::Queues& queues() override { return queueMaker; }
+  platform::LogSink& logSink() override { return log; }
+  platform::ProcessEnvironment& environment() override { return variables; }
+  platform::Clock& clock() override { return manualClock; }
+  platform::SystemControl& systemControl() override { return kernel; }
+  platform::DeviceProperties& deviceProperties() override { return device; }
+  platform::NamedNotifications& namedNotifications() override { return named; }
+  platform::NamedNotificationCentre* namedNotificationCentre() override {
+    return hasNamedCentre ? &namedCentre : nullptr;
+  }
+  platform::NotificationCentre& notificationCentre() override { return centre; }
+  std::shared_ptr<platform::UserPreferences> userPreferences() override { return user; }
+  std::shared_ptr<platform::CloudStore> makeCloudStore(std::string_view identifier, int typeCode) override;
+  platform::RadixController& radixController() override { return radix; }
+  platform::EventStreams& eventStreams() override { return streams; }
+  std::shared_ptr<platform::ServiceListener> makeServiceListener(std::string_view serviceName) override;
+  void willStop(std::string_view text) override { throw Stopped{std::string(text)}; }
+
+  Effects effects;
+  const std::shared_ptr<ManualPool> pool = std::make_shared<ManualPool>(*this);
+  const std::shared_ptr<ManualPool> delivery = std::make_shared<ManualPool>(*this);
+  ManualRunLoop loop{*this};
+  platform::Queues queueMaker{pool};
+  FakeLogSink log{effects};
+  FakeEnvironment variables;
+  ManualClock manualClock;
+  FakeSystemControl kernel;
+  FakeDeviceProperties device;
+  FakeNamedNotificationCentre namedCentre{loop.queue};
+  bool hasNamedCentre = true;
+  FakeNamedNotifications named{effects, namedCentre};
+  platform::NotificationCentre centre;
+  const std::shared_ptr<FakeUserPreferences> user = std::make_shared<FakeUserPreferences>(effects, delivery);
+  const std::shared_ptr<FakeCloudStore> cloud = std::make_shared<FakeCloudStore>(effects, delivery, centre);
+  std::vector<std::string> cloudStoresMade;  // "identifier typeCode"
+  FakeRadixController radix{effects};
+  FakeEventStreams streams{effects};
+  std::vector<std::shared_ptr<FakeServiceListener>> listeners;
+
+ private:
+  // Records the one post that the in-process centre carries besides the cloud store's own.
+  struct PostRecorder {
+    Effects& effects;
+    void record(const platform::Notification& notification) {
+      effects.record(Effects::post, "post " + Effects::shortName(notification.name).substr(9));
+    }
+  };
+
+  const std::shared_ptr<PostRecorder> postRecorder = std::make_shared<PostRecorder>(PostRecorder{effects});
+  std::optional<std::mt19937_64> random;
+};
+
+}  // namespace fakes
