@@ -56,7 +56,8 @@ class PairwellDaemon : public Daemon, public std::enable_shared_from_this<Pairwe
 // CONDUIT_SERVICE_NAME, read once, on first use. Any thread.
 const std::optional<std::string>& serviceName();
 
-// The daemon of this process.
+// The daemon of this process. Whoever takes a platform down resets it first: its end still uses the cloud
+// store handle and the log.
 std::shared_ptr<Daemon>& daemon();
 
 // Launches the daemon on the current platform and runs the main thread's loop. The process's exit code.

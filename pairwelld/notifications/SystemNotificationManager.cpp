@@ -60,18 +60,19 @@ void SystemNotificationManager::cancelAlarm(std::string_view name) {
 }
 
 Subscription<SystemNotificationManagerSubscribing> SystemNotificationManager::subscribe(
-    std::shared_ptr<Subscriber> subscriber) {
-  const Subscription<Subscriber> subscription(
-      std::move(subscriber),
-      [weak = weak_from_this()](const Subscription<Subscriber>& handle) -> platform::Result<void> {
-        if (auto self = weak.lock()) self->unsubscribe(handle);
-        return {};
-      });
+    const std::shared_ptr<Subscriber>& subscriber) {
+  std::optional<Subscription<Subscriber>> subscription;
   subscriptionQueue->sync([&] {
     subscriptionQueue->assertCurrent();
-    subscriptions.push_back(subscription);
+    subscription.emplace(
+        subscriber,
+        [weak = weak_from_this()](const Subscription<Subscriber>& handle) -> platform::Result<void> {
+          if (auto self = weak.lock()) self->unsubscribe(handle);
+          return {};
+        });
+    subscriptions.push_back(*subscription);
   });
-  return subscription;
+  return *subscription;
 }
 
 void SystemNotificationManager::unsubscribe(const Subscription<Subscriber>& subscription) {

@@ -45,7 +45,7 @@ class SystemNotificationManager : public std::enable_shared_from_this<SystemNoti
   virtual void cancelAlarm(std::string_view name);
 
   // Any thread; waits for subscriptionQueue.
-  Subscription<Subscriber> subscribe(std::shared_ptr<Subscriber> subscriber);
+  Subscription<Subscriber> subscribe(const std::shared_ptr<Subscriber>& subscriber);
 
   // Absent for what is not finite or, in whole seconds, lies outside -9223372036…9223372036, some 292 years
   // around 1970.

@@ -53,7 +53,7 @@ class KeyValueStoreManager : public std::enable_shared_from_this<KeyValueStoreMa
   virtual void setValue(const std::vector<KeyValueSource>& sources,
                         const std::optional<platform::Value>& value, Defaults key);
   // Any thread; waits for subscriptionQueue.
-  virtual Subscription<Subscriber> subscribe(std::shared_ptr<Subscriber> subscriber);
+  virtual Subscription<Subscriber> subscribe(const std::shared_ptr<Subscriber>& subscriber);
   virtual void unsubscribe(const Subscription<Subscriber>& subscription);
   // Any thread: schedules and posts, and calls no subscriber itself.
   virtual void handleStoreChange(KeyValueSource source, const std::vector<std::string>& keys);
