@@ -51,9 +51,9 @@ void Daemon::recordLaunch(const std::optional<SystemVersionNumber>& testLastVers
   if (!current) return;
   const auto previous = isTest ? testLastVersion : recordedVersion();
   if (previous && !(*previous == *current)) migrate(*previous, *current);
-  // The printed form, which is what earlier versions left here and what a later one reads back. For a build
-  // such as 19A5007 it differs from the raw text, so each launch on it reports a migration from 19A57: a line
-  // in the log, since migrating does nothing else.
+  // The printed form, for every build alike. Where it differs from the raw text (19A5007 prints as 19A57)
+  // each launch reports a migration, which is a line in the log and nothing else: migrate() converts no data.
+  // One that does must not take two unequal texts for two builds.
   if (!isTest) platform::current().userPreferences()->setValue(current->description(), lastVersionKey);
   recordBootSession();
 }
