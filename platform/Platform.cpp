@@ -46,7 +46,8 @@ LogSink& currentLogSink() {
 void installLogSink(LogSink& sink) { installedLogSink.store(&sink, std::memory_order_release); }
 
 void Platform::clearSlots() {
-  for (Slot& slot : slots) slot.object.reset();
+  // Later ones stand on earlier ones: a manager's end still logs.
+  for (auto slot = slots.rbegin(); slot != slots.rend(); ++slot) slot->object.reset();
 }
 
 PlatformScope::PlatformScope(Platform& platform) : previous(std::exchange(scoped, &platform)) {}

@@ -22,8 +22,8 @@ UUID UUID::random() {
   thread_local std::random_device device;
   UUID uuid;
   for (auto& byte : uuid.bytes) byte = static_cast<std::uint8_t>(device());
-  uuid.bytes[6] = static_cast<std::uint8_t>((uuid.bytes[6] & 0x0f) | 0x40);
-  uuid.bytes[8] = static_cast<std::uint8_t>((uuid.bytes[8] & 0x3f) | 0x80);
+  uuid.bytes[6] = static_cast<std::uint8_t>((uuid.bytes[6] & 0x0fu) | 0x40u);
+  uuid.bytes[8] = static_cast<std::uint8_t>((uuid.bytes[8] & 0x3fu) | 0x80u);
   return uuid;
 }
 
@@ -39,7 +39,7 @@ std::optional<UUID> UUID::parse(std::string_view text) {
     const auto digit = hexDigit(text[place]);
     if (!digit) return std::nullopt;
     auto& byte = uuid.bytes[digits / 2];
-    byte = static_cast<std::uint8_t>((byte << 4) | *digit);
+    byte = static_cast<std::uint8_t>(unsigned{byte} << 4 | *digit);
     ++digits;
   }
   return uuid;

@@ -84,7 +84,7 @@ struct SerialQueue::State {
 
   // Runs items up to and including that of `own`, or, without one, until the queue is empty, another caller's
   // item comes or the turn is over. The caller owns the queue and gives it up afterwards.
-  void drain(const SerialQueue* queue, QueueRank rank, const Waiter* own) {
+  void drain(const SerialQueue* serving, QueueRank ofRank, const Waiter* own) {
     for (int count = 0; own || count < itemsPerTurn; ++count) {
       Item item;
       {
@@ -93,7 +93,7 @@ struct SerialQueue::State {
         item = std::move(items.front());
         items.pop_front();
       }
-      const FrameScope scope(queue, rank);
+      const FrameScope scope(serving, ofRank);
       runItem(item.waiter ? item.waiter->work : item.work);
       if (item.waiter) return;
       item.work = nullptr;  // a closure dies while its queue is held and no lock is

@@ -1,1 +1,43 @@
 #include "platform/linux/FileSystem.hpp"
+
+namespace platform::linux_ {
+namespace {
+
+std::string folderOf(const std::string& path) {
+  const auto slash = path.rfind('/');
+  if (slash == std::string::npos) return ".";
+  return slash == 0 ? "/" : path.substr(0, slash);
+}
+
+Result<void> writeNew(FileSystem& files, const std::string& path, std::string_view bytes) {
+  auto file = files.create(path);
+  if (!file && file.error() == std::errc::file_exists) {
+    // Left by a writer that was cut off: the caller's lock says that nobody writes it now.
+    if (const auto removed = files.remove(path); !removed) return removed;
+    file = files.create(path);
+  }
+  if (!file) return file.error();
+  if (const auto written = (*file)->writeAll(bytes); !written) return written;
+  return (*file)->sync();
+}
+
+}  // namespace
+
+Result<std::string> readFile(FileSystem& files, const std::string& path, std::size_t limit) {
+  const auto file = files.openToRead(path);
+  if (!file) return file.error();
+  return (*file)->readAll(limit);
+}
+
+Result<void> replaceFile(FileSystem& files, const std::string& path, std::string_view bytes) {
+  const std::string temporary = path + ".new";
+  auto result = writeNew(files, temporary, bytes);
+  if (result) result = files.rename(temporary, path);
+  if (!result) {
+    static_cast<void>(files.remove(temporary));  // the first failure is the one to tell
+    return result;
+  }
+  return files.syncFolder(folderOf(path));
+}
+
+}  // namespace platform::linux_
