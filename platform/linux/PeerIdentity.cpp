@@ -1,1 +1,76 @@
 #include "platform/linux/PeerIdentity.hpp"
+
+#include <fcntl.h>
+#include <poll.h>
+#include <sys/socket.h>
+#include <sys/stat.h>
+#include <sys/syscall.h>
+
+#include <atomic>
+#include <cerrno>
+#include <cstring>
+#include <string>
+
+#include "platform/LogSink.hpp"
+
+namespace platform::linux_ {
+namespace {
+
+constexpr int peerPidfdOption = 77;  // SO_PEERPIDFD: Linux 6.5 knows it, older headers do not name it
+
+void warn(const char* step, int error) {
+  hearthLog("peer").error("%s: %s", std::string(step), std::string(std::strerror(error)));
+}
+
+UniqueDescriptor openProcess(int socket, pid_t pid) {
+  int descriptor = -1;
+  socklen_t size = sizeof descriptor;
+  if (::getsockopt(socket, SOL_SOCKET, peerPidfdOption, &descriptor, &size) == 0)
+    return UniqueDescriptor(descriptor);
+  if (errno != ENOPROTOOPT) return UniqueDescriptor();
+  static std::atomic<bool> said{false};
+  if (!said.exchange(true)) warn("peers are told by pid alone, the kernel gives no handle", ENOPROTOOPT);
+  return UniqueDescriptor(static_cast<int>(::syscall(SYS_pidfd_open, pid, 0)));
+}
+
+std::optional<PeerIdentity::Executable> executableOf(pid_t pid) {
+  const std::string path = "/proc/" + std::to_string(pid);
+  const UniqueDescriptor folder(::open(path.c_str(), O_PATH | O_DIRECTORY | O_CLOEXEC));
+  if (!folder) return std::nullopt;
+  const UniqueDescriptor file(::openat(folder.get(), "exe", O_PATH | O_CLOEXEC));
+  struct stat place {};
+  if (!file || ::fstat(file.get(), &place) != 0) return std::nullopt;
+  return PeerIdentity::Executable{place.st_dev, place.st_ino};
+}
+
+bool isAlive(int process) {
+  pollfd entry{process, POLLIN, 0};
+  return ::poll(&entry, 1, 0) == 0;
+}
+
+}  // namespace
+
+PeerIdentity establishPeer(int socket) {
+  PeerIdentity peer;
+  ucred credentials{};
+  socklen_t size = sizeof credentials;
+  if (::getsockopt(socket, SOL_SOCKET, SO_PEERCRED, &credentials, &size) != 0) {
+    warn("SO_PEERCRED", errno);
+    return peer;
+  }
+  peer.pid = credentials.pid;
+  peer.uid = credentials.uid;
+  peer.gid = credentials.gid;
+  peer.process = openProcess(socket, peer.pid);
+  if (!peer.process) {
+    warn("no handle on the peer's process", errno);
+    return peer;
+  }
+  const auto executable = executableOf(peer.pid);
+  if (!executable) warn("the peer's executable", errno);
+  // Last: only a process that still lives makes what /proc said under its pid its own.
+  if (isAlive(peer.process.get())) peer.executable = executable;
+  return peer;
+}
+
+}  // namespace platform::linux_
