@@ -1,0 +1,78 @@
+// Everything outside the object under test: one device of fakes, current for the length of a test.
+#pragma once
+
+#include <gmock/gmock.h>
+#include <gtest/gtest.h>
+
+#include <memory>
+#include <string>
+#include <utility>
+#include <vector>
+
+#include "pairwelld/PairwellDaemon.hpp"
+#include "pairwelld/debug/DebugManager.hpp"
+#include "pairwelld/notifications/SystemNotificationManager.hpp"
+#include "pairwelld/settings/KeyValueStoreManager.hpp"
+#include "platform/RawValue.hpp"
+#include "tests/fakes/FakePlatform.hpp"
+
+namespace pairwell {
+
+using fakes::Effects;
+using platform::Value;
+using testing::ElementsAre;
+using testing::IsEmpty;
+
+inline constexpr const char* flagKey = "VelaLogCloudCollectionEnabled";
+inline constexpr const char* endKey = "VelaLogCloudCollectionEnabledExpiration";
+inline constexpr const char* overrideKey = "VelaLogCloudCollectionExpirationIntervalOverride";
+
+// Runs `work` on `queue`, in the test's thread.
+template <class Work>
+void on(const std::shared_ptr<platform::SerialQueue>& queue, Work work) {
+  queue->sync([&] { work(); });
+}
+
+// Publisher and subscriber hold each other; this cuts it.
+template <class Publisher>
+void dropSubscriptions(Publisher& publisher) PW_NO_ANALYSIS {
+  auto dropped = std::exchange(publisher.subscriptions, {});
+}
+
+class World : public testing::Test {
+ protected:
+  World() { platform.variables.variables["CONDUIT_SERVICE_NAME"] = "com.kestrel.pairwell.conduit"; }
+
+  std::vector<std::string> effects(unsigned kinds) const { return platform.effects.sinceMark(kinds); }
+  std::vector<std::string> log() const { return effects(Effects::log); }
+  void mark() { platform.effects.mark(); }
+  void run() { platform.runAll(); }
+  double now() { return platform.manualClock.time.count(); }
+
+  std::shared_ptr<KeyValueStoreManager> makeManager() {
+    auto kvs = KeyValueStoreManager::create();
+    platform.cutSubscriptions.push_back([kvs] { dropSubscriptions(*kvs); });
+    return kvs;
+  }
+  // Nothing has run on its queue yet.
+  std::shared_ptr<DebugManager> makeDebugManager() {
+    auto kvs = makeManager();
+    kvs->activate();
+    return activated(DebugManager::create(kvs));
+  }
+  std::shared_ptr<DebugManager> activated(std::shared_ptr<DebugManager> manager) {
+    manager->activate();
+    platform.cutSubscriptions.push_back([manager] { letGo(*manager); });
+    return manager;
+  }
+  static void letGo(DebugManager& manager) {
+    dropSubscriptions(*SystemNotificationManager::shared());
+    manager.kvsSubscription.reset();
+    manager.systemNotificationSubscription.reset();
+  }
+
+  fakes::FakePlatform platform;
+  const platform::PlatformScope scope{platform};
+};
+
+}  // namespace pairwell
