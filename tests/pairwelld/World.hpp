@@ -4,8 +4,10 @@
 #include <gmock/gmock.h>
 #include <gtest/gtest.h>
 
+#include <functional>
 #include <memory>
 #include <string>
+#include <string_view>
 #include <utility>
 #include <vector>
 
@@ -18,6 +20,7 @@
 
 namespace pairwell {
 
+using Calls = std::vector<std::string>;
 using fakes::Effects;
 using platform::Value;
 using testing::ElementsAre;
@@ -39,16 +42,38 @@ void dropSubscriptions(Publisher& publisher) PW_NO_ANALYSIS {
   auto dropped = std::exchange(publisher.subscriptions, {});
 }
 
+// Of either publisher: says who was called with what.
+struct Subscriber : KeyValueStoreManagerSubscribing, SystemNotificationManagerSubscribing {
+  Subscriber(std::string label_, Calls& calls_) : label(std::move(label_)), calls(calls_) {}
+  void keyValueChanged(KeyValueSource source, const std::vector<std::string>& keys) override {
+    called(platform::rawValue(source), keys.empty() ? "-" : keys.size() > 1 ? "many" : keys.front());
+  }
+  void didReceiveNotification(SystemNotificationSource source, std::string_view name) override {
+    called(platform::rawValue(source), name);
+  }
+  void called(std::string_view source, std::string_view what) {
+    calls.push_back(label + " " + std::string(source) + " " + Effects::shortKey(what));
+    if (onCall) onCall();
+  }
+
+  const std::string label;
+  Calls& calls;
+  std::function<void()> onCall;
+};
+
 class World : public testing::Test {
  protected:
   World() { platform.variables.variables["CONDUIT_SERVICE_NAME"] = "com.kestrel.pairwell.conduit"; }
 
-  std::vector<std::string> effects(unsigned kinds) const { return platform.effects.sinceMark(kinds); }
-  std::vector<std::string> log() const { return effects(Effects::log); }
+  Calls effects(unsigned kinds) const { return platform.effects.sinceMark(kinds); }
+  Calls log() const { return effects(Effects::log); }
   void mark() { platform.effects.mark(); }
   void run() { platform.runAll(); }
   double now() { return platform.manualClock.time.count(); }
 
+  std::shared_ptr<Subscriber> makeSubscriber(const char* label) {
+    return std::make_shared<Subscriber>(label, calls);
+  }
   std::shared_ptr<KeyValueStoreManager> makeManager() {
     auto kvs = KeyValueStoreManager::create();
     platform.cutSubscriptions.push_back([kvs] { dropSubscriptions(*kvs); });
@@ -71,6 +96,7 @@ class World : public testing::Test {
     manager.systemNotificationSubscription.reset();
   }
 
+  Calls calls;
   fakes::FakePlatform platform;
   const platform::PlatformScope scope{platform};
 };
