@@ -53,7 +53,7 @@ struct Subscriber : KeyValueStoreManagerSubscribing, SystemNotificationManagerSu
   }
   void called(std::string_view source, std::string_view what) {
     calls.push_back(label + " " + std::string(source) + " " + Effects::shortKey(what));
-    if (onCall) onCall();
+    if (const auto call = onCall) call();  // it may replace itself
   }
 
   const std::string label;
