@@ -1,0 +1,254 @@
+#include "platform/linux/SettingsFile.hpp"
+
+#include <filesystem>
+#include <utility>
+#include <vector>
+
+#include "platform/LogSink.hpp"
+#include "platform/linux/SettingsDocument.hpp"
+
+namespace platform::linux_ {
+namespace {
+
+const Logger& log() {
+  static const Logger logger = hearthLog("files");
+  return logger;
+}
+
+bool isMissing(std::error_code error) { return error == std::errc::no_such_file_or_directory; }
+
+std::string parentOf(const std::string& path) {
+  const auto parent = std::filesystem::path(path).parent_path().string();
+  return parent.empty() ? "." : parent;
+}
+
+// With what a power cut would take of it: the entry of each new folder in its parent.
+Result<void> makeFolderDurably(FileSystem& files, const std::string& folder) {
+  std::vector<std::string> parents;
+  for (std::string path = folder; path != parentOf(path); path = parentOf(path)) {
+    const auto there = files.identity(path);
+    if (there || !isMissing(there.error())) break;
+    parents.push_back(parentOf(path));
+  }
+  if (const auto made = files.makeFolder(folder); !made) return made;
+  for (const std::string& parent : parents) {
+    if (const auto synced = files.syncFolder(parent); !synced) return synced;
+  }
+  return {};
+}
+
+}  // namespace
+
+std::shared_ptr<SettingsFile> SettingsFile::create(FileSystem& files, std::string path) {
+  return std::shared_ptr<SettingsFile>(new SettingsFile(files, std::move(path)));
+}
+
+SettingsFile::SettingsFile(FileSystem& files_, std::string path_)
+    : files(files_), path(std::move(path_)), document(std::make_shared<const Dictionary>()) {}
+
+Result<SettingsFile::Document> SettingsFile::read() {
+  {
+    std::lock_guard lock(mutex);
+    if (const auto fresh = refresh(); !fresh) return fresh.error();
+    if (damage.empty() || damageStays) return document;
+  }
+  clearDamage();
+  std::lock_guard lock(mutex);
+  return document;
+}
+
+SettingsFile::Document SettingsFile::contents() {
+  const auto current = read();
+  std::lock_guard lock(mutex);
+  const auto previous = std::exchange(failure, current ? std::error_code() : current.error());
+  if (failure && failure != previous) log().error("%s: cannot be read: %s", path, failure.message());
+  return current ? *current : document;
+}
+
+Result<void> SettingsFile::refresh() {
+  const auto current = files.identity(path);
+  if (current && held && *current == heldIdentity) return {};
+  const auto loaded = current ? load() : Result<void>(current.error());
+  if (loaded || !isMissing(loaded.error())) return loaded;
+  held.reset();
+  // Whoever moved it aside: this process has seen that it was damaged.
+  if (!std::exchange(damage, "").empty()) lastGoodInForce = true;
+  if (!lastGoodInForce && !document->empty()) document = std::make_shared<const Dictionary>();
+  return {};
+}
+
+Result<void> SettingsFile::load() {
+  auto file = files.openToRead(path);
+  if (!file) return file.error();
+  const auto identity = (*file)->identity();
+  if (!identity) return identity.error();
+  const auto text = (*file)->readAll(sizeLimit);
+  if (!text && text.error() != Outcome::tooLarge) return text.error();
+  std::string problem = "larger than " + std::to_string(sizeLimit) + " bytes";
+  auto decoded = text ? decodeSettings(*text, problem) : Result<Dictionary>(text.error());
+  held = std::move(*file);
+  heldIdentity = *identity;
+  damageStays = false;
+  damage = decoded ? "" : problem;
+  if (decoded) {
+    document = std::make_shared<const Dictionary>(std::move(*decoded));
+    lastGoodInForce = false;
+  }
+  return {};
+}
+
+// Only under the file's lock, and after another look: between the two a writer may have put a good file
+// there.
+void SettingsFile::clearDamage() {
+  const auto fileLock = lockForWriting();
+  std::lock_guard lock(mutex);
+  if (!fileLock) {
+    log().error("%s: %s; cannot be moved aside: %s", path, damage, fileLock.error().message());
+    damageStays = true;
+  } else if (refresh() && !damage.empty()) {
+    moveAside();
+  }
+}
+
+void SettingsFile::moveAside() {
+  int number = 0;
+  std::string aside;
+  std::error_code taken;
+  do {
+    aside = path + ".damaged-" + std::to_string(++number);
+    const auto there = files.identity(aside);
+    taken = there ? std::error_code() : there.error();
+  } while (!taken);
+  const auto moved = isMissing(taken) ? files.rename(path, aside) : Result<void>(taken);
+  damageStays = !moved;
+  if (!moved) {
+    log().error("%s: %s; cannot be moved aside: %s", path, damage, moved.error().message());
+    return;
+  }
+  log().error("%s: %s; moved to %s. To use it, mend it, remove its checksum line, and move it back", path,
+              damage, aside);
+  damage.clear();
+  held.reset();
+  lastGoodInForce = true;
+}
+
+Result<std::unique_ptr<FileLock>> SettingsFile::lockForWriting() {
+  const std::string name = path + ".lock";
+  auto lock = files.lock(name);
+  if (lock || !isMissing(lock.error())) return lock;
+  if (const auto made = makeFolderDurably(files, parentOf(path)); !made) return made.error();
+  return files.lock(name);
+}
+
+Result<void> SettingsFile::update(const std::function<bool(Dictionary& document)>& change) {
+  const auto fileLock = lockForWriting();
+  if (!fileLock) return fileLock.error();
+  Document before;
+  bool again;
+  {
+    std::lock_guard lock(mutex);
+    if (const auto fresh = refresh(); !fresh) return fresh;
+    if (!damage.empty()) moveAside();
+    if (!damage.empty()) return Outcome::malformedFile;
+    before = document;
+    again = unsynced;
+    writing = true;
+  }
+  Dictionary next = *before;
+  Result<void> written;
+  if (change(next) || again) written = write(next);
+  finishWrite(*before, next, written.has_value());
+  return written;
+}
+
+Result<void> SettingsFile::write(const Dictionary& next) {
+  const auto text = encodeSettings(next);
+  if (!text) return text.error();
+  // What could not be read back is not written: keys, say, that are one after invalid UTF-8 has been
+  // replaced.
+  std::string problem;
+  if (text->size() > sizeLimit) return Outcome::tooLarge;
+  if (const auto back = decodeSettings(*text, problem); !back) return back.error();
+  return replaceFile(files, path, *text);
+}
+
+void SettingsFile::finishWrite(const Dictionary& before, const Dictionary& next, bool written) {
+  bool outsideChange;
+  {
+    std::lock_guard lock(mutex);
+    writing = false;
+    unsynced = !written;
+    static_cast<void>(refresh());  // a failure is the next reader's to meet
+    outsideChange = reported && recordOwnChange(before, next, written);
+  }
+  if (!outsideChange) return;
+  delivery->async([weak = weak_from_this()] {
+    if (const auto self = weak.lock()) self->look();
+  });
+}
+
+// Whether what is stored now differs by more than the own change from what was reported. A write that failed
+// after its rename has changed the file, too.
+bool SettingsFile::recordOwnChange(const Dictionary& before, const Dictionary& next, bool written) {
+  if (written || sameValue(*document, next)) {
+    Dictionary known = *reported;
+    Dictionary values = settingsValues(std::as_const(known));
+    carryOver(settingsValues(before), settingsValues(next), values);
+    carryOver(before, next, known);
+    settingsValues(known) = std::move(values);
+    reported = std::make_shared<const Dictionary>(std::move(known));
+  }
+  return std::exchange(lookAfterwards, false) || !sameValue(*reported, *document);
+}
+
+Result<void> SettingsFile::setValue(std::string_view key, const std::optional<Value>& value) {
+  return update([&](Dictionary& whole) {
+    Dictionary& values = settingsValues(whole);
+    const auto found = values.find(key);
+    if (found == values.end() ? !value : value && sameValue(found->second, *value)) return false;
+    if (value) {
+      values.insert_or_assign(std::string(key), *value);
+    } else {
+      values.erase(found);
+    }
+    return true;
+  });
+}
+
+void SettingsFile::startWatching(WorkQueue& delivery_, Changed changed_) {
+  delivery = &delivery_;
+  changed = std::move(changed_);
+  const std::string folder = parentOf(path);
+  const auto made = makeFolderDurably(files, folder);
+  auto begun = made ? files.watch(folder,
+                                  [weak = weak_from_this()](const std::string&) {
+                                    if (const auto self = weak.lock()) self->look();
+                                  })
+                    : Result<std::unique_ptr<FolderWatch>>(made.error());
+  if (!begun) {
+    log().error("%s: changes by others will not be noticed: %s", folder, begun.error().message());
+    return;
+  }
+  watch = std::move(*begun);
+  // After the watch has begun, so that no change falls between the two.
+  const Document first = contents();
+  std::lock_guard lock(mutex);
+  reported = first;
+}
+
+// Compares instead of trusting events: they merge, overflow, and come for own writes, too.
+void SettingsFile::look() {
+  static_cast<void>(contents());
+  Document before, after;
+  {
+    std::lock_guard lock(mutex);
+    // The file may hold an own change that is not recorded yet; its writer looks when it is.
+    lookAfterwards = writing;
+    if (writing || !reported) return;
+    before = std::exchange(reported, document);
+    after = document;
+  }
+  if (!sameValue(*before, *after)) changed(*before, *after);
+}
+
+}  // namespace platform::linux_

@@ -1,0 +1,88 @@
+// One store in one JSON file, which several processes read and write.
+#pragma once
+
+#include <functional>
+#include <memory>
+#include <mutex>
+#include <optional>
+#include <string>
+#include <string_view>
+#include <system_error>
+
+#include "platform/Result.hpp"
+#include "platform/Value.hpp"
+#include "platform/WorkQueue.hpp"
+#include "platform/linux/FileSystem.hpp"
+
+namespace platform::linux_ {
+
+// Any thread; one a file and process. A missing file is an empty one; its folder is made when it is needed.
+//
+// What does not parse or does not match its checksum is moved aside, never overwritten; the last good
+// contents then stay in force while the process lives, and the next write is made on top of them.
+class SettingsFile : public std::enable_shared_from_this<SettingsFile> {
+ public:
+  // A file's contents without the checksum; never null.
+  using Document = std::shared_ptr<const Dictionary>;
+  // On the delivery thread, no lock held.
+  using Changed = std::function<void(const Dictionary& before, const Dictionary& after)>;
+
+  static constexpr std::size_t sizeLimit = 1 << 20;  // a thousand times what a store holds
+
+  // `files` outlives the object.
+  static std::shared_ptr<SettingsFile> create(FileSystem& files, std::string path);
+
+  // What is stored at this moment. Takes no lock of the file's; an error only where it cannot be read at all.
+  Result<Document> read();
+  // The same, but a failure is logged (once, until it is another) and the last good contents answer.
+  Document contents();
+
+  // Runs `change` on what is stored, and makes the outcome durable unless it answers false; no other process
+  // writes in between. On failure the old contents are whole.
+  Result<void> update(const std::function<bool(Dictionary& document)>& change);
+  // An update of one key of "values"; no value removes it.
+  Result<void> setValue(std::string_view key, const std::optional<Value>& value);
+
+  // Once. From now on `changed` hears of what others wrote, once, and of nothing that this object wrote.
+  // `delivery`, on whose thread the file system reports, outlives the object. A failure is logged; reports
+  // then stay away.
+  void startWatching(WorkQueue& delivery, Changed changed);
+
+ private:
+  SettingsFile(FileSystem& files, std::string path);
+  Result<std::unique_ptr<FileLock>> lockForWriting();
+  Result<void> write(const Dictionary& next);
+  void finishWrite(const Dictionary& before, const Dictionary& next, bool written);
+  void clearDamage();
+  void look();
+  // `mutex` held:
+  Result<void> refresh();
+  Result<void> load();
+  void moveAside();
+  bool recordOwnChange(const Dictionary& before, const Dictionary& next, bool written);
+
+  FileSystem& files;
+  const std::string path;
+  WorkQueue* delivery = nullptr;  // these two are set before the watch begins
+  Changed changed;
+
+  // Guards the rest. The file's lock is taken first, if both are needed: a reader, who needs only this one,
+  // must not wait for a writer in another process.
+  std::mutex mutex;
+  Document document;
+  std::unique_ptr<File>
+      held;  // the file that `document`, or `damage`, came from; its inode is not reused meanwhile
+  FileIdentity heldIdentity;
+  std::string damage;            // what is wrong with the held file
+  bool damageStays = false;      // it could not be moved
+  bool lastGoodInForce = false;  // the file is missing because it was damaged
+  std::error_code failure;       // of the last read
+  bool writing = false;
+  bool lookAfterwards = false;  // an event came while writing
+  bool unsynced = false;        // the last write failed, perhaps after its rename
+  Document reported;            // what `changed` has heard of, own writes included; null without a watch
+
+  std::unique_ptr<FolderWatch> watch;  // ends first
+};
+
+}  // namespace platform::linux_
