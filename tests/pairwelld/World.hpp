@@ -61,8 +61,10 @@ struct Subscriber : KeyValueStoreManagerSubscribing, SystemNotificationManagerSu
   std::function<void()> onCall;
 };
 
+// Also a device of its own within a test.
 class World : public testing::Test {
- protected:
+ public:
+  void TestBody() override {}
   World() { platform.variables.variables["CONDUIT_SERVICE_NAME"] = "com.kestrel.pairwell.conduit"; }
 
   Calls effects(unsigned kinds) const { return platform.effects.sinceMark(kinds); }
