@@ -15,8 +15,8 @@ namespace platform::linux_ {
 
 class BusClient {
  public:
-  // Connects to the socket at `path` and authenticates. Outcome::notPermitted when refused, Outcome::notConnected
-  // when nobody serves it, Outcome::timedOut.
+  // Connects to the socket at `path` and authenticates. Outcome::notPermitted when refused,
+  // Outcome::notConnected when nobody serves it, Outcome::timedOut.
   static Result<std::unique_ptr<BusClient>> connect(const std::string& path,
                                                     std::chrono::milliseconds timeout);
   ~BusClient();

@@ -1,1 +1,399 @@
 #include "platform/linux/BusServer.hpp"
+
+#include <fcntl.h>
+#include <sys/epoll.h>
+#include <sys/eventfd.h>
+#include <sys/socket.h>
+#include <sys/timerfd.h>
+#include <systemd/sd-bus.h>
+
+#include <algorithm>
+#include <cerrno>
+#include <cstring>
+#include <map>
+#include <mutex>
+#include <set>
+
+#include "platform/LogSink.hpp"
+#include "platform/Platform.hpp"
+#include "platform/linux/BusLimits.hpp"
+#include "platform/linux/BusSession.hpp"
+
+namespace platform::linux_ {
+namespace {
+
+using Clock = std::chrono::steady_clock;
+
+const Logger& log() {
+  static const Logger logger = hearthLog("bus");
+  return logger;
+}
+
+// Whom an epoll event is for. Sessions have two tags each, numbers that no other session ever gets.
+enum Tag : std::uint64_t { wakeUpTag, timerTag, listenerTag, firstSession };
+std::uint64_t socketTag(std::uint64_t session) { return session * 2; }
+std::uint64_t processTag(std::uint64_t session) { return session * 2 + 1; }
+
+}  // namespace
+
+class BusServer::State : public BusSessionHost, public std::enable_shared_from_this<State> {
+ public:
+  explicit State(BusInterface interface)
+      : epoll(::epoll_create1(EPOLL_CLOEXEC)),
+        _service(std::move(interface)),
+        wakeUp(::eventfd(0, EFD_CLOEXEC | EFD_NONBLOCK)),
+        timer(::timerfd_create(CLOCK_MONOTONIC, TFD_CLOEXEC | TFD_NONBLOCK)) {
+    if (!epoll || !wakeUp || !timer) platform::stop(std::string("bus server: ") + std::strerror(errno));
+    control(EPOLL_CTL_ADD, wakeUp.get(), EPOLLIN, wakeUpTag);
+    control(EPOLL_CTL_ADD, timer.get(), EPOLLIN, timerTag);
+  }
+
+  void dispatch() {
+    const State* const outer = std::exchange(dispatching, this);
+    runHandedOver();
+    epoll_event events[64];
+    const int count = ::epoll_wait(epoll.get(), events, static_cast<int>(std::size(events)), 0);
+    for (int index = 0; index < count; ++index) {
+      handle(events[index].data.u64, events[index].events);
+      settleChanged();
+    }
+    runHandedOver();
+    dispatching = outer;
+  }
+
+  void listen(UniqueDescriptor socket, Admitter admitter_) {
+    listener = std::move(socket);
+    ::fcntl(listener.get(), F_SETFL, ::fcntl(listener.get(), F_GETFL) | O_NONBLOCK);
+    admitter = std::move(admitter_);
+    control(EPOLL_CTL_ADD, listener.get(), EPOLLIN, listenerTag);
+  }
+
+  void stopListening() {
+    listener.reset();
+    resumeAccepting.reset();
+  }
+
+  std::shared_ptr<BusConnection> adopt(UniqueDescriptor socket, PeerIdentity peer,
+                                       std::shared_ptr<BusHandler> handler) {
+    ::fcntl(socket.get(), F_SETFL, ::fcntl(socket.get(), F_GETFL) | O_NONBLOCK);
+    const auto session = add(std::move(socket), std::move(peer));
+    begin(*session, std::move(handler));
+    return session;
+  }
+
+  void stopReading() {
+    stopListening();
+    forEachSession([](BusSession& session) { session.stopReading(); });
+  }
+
+  bool isDrained() const {
+    return std::all_of(sessions.begin(), sessions.end(),
+                       [](const auto& entry) { return entry.second.session->isDrained(); });
+  }
+
+  void closeAll() {
+    stopListening();
+    forEachSession([](BusSession& session) { session.close(); });
+  }
+
+  int descriptor() const { return epoll.get(); }
+
+  // BusSessionHost
+  const BusService& service() const override { return _service; }
+  void changed(BusSession& session) override { changed(session.number); }
+  void socketMoved(BusSession& session, int before) override {
+    Entry& entry = sessions.at(session.number);
+    ::epoll_ctl(epoll.get(), EPOLL_CTL_DEL, before, nullptr);
+    control(EPOLL_CTL_ADD, session.socket(), entry.events, socketTag(session.number));
+  }
+  BusCompletion completion(std::uint64_t session, std::uint64_t call) override {
+    return [weak = weak_from_this(), session, call](BusReply reply) {
+      const auto self = weak.lock();
+      if (!self) return;
+      self->handOver([self = self.get(), session, call, reply = std::move(reply)]() mutable {
+        self->withSession(session, [&](BusSession& found) { found.complete(call, std::move(reply)); });
+      });
+    };
+  }
+
+ private:
+  struct Entry {
+    std::shared_ptr<BusSession> session;
+    std::uint32_t events = 0;  // what epoll watches for
+    std::optional<Clock::time_point> deadline;
+  };
+  using Work = std::function<void()>;
+
+  void control(int operation, int descriptor, std::uint32_t events, std::uint64_t tag) {
+    epoll_event event{};
+    event.events = events;
+    event.data.u64 = tag;
+    if (::epoll_ctl(epoll.get(), operation, descriptor, &event) < 0)
+      platform::stop(std::string("bus server: epoll: ") + std::strerror(errno));
+  }
+
+  void handle(std::uint64_t tag, std::uint32_t events) {
+    if (tag == wakeUpTag) {
+      clear(wakeUp);
+      runHandedOver();
+    } else if (tag == timerTag) {
+      handleTimer();
+    } else if (tag == listenerTag) {
+      acceptSome();
+    } else if (tag % 2 == 0) {
+      withSession(tag / 2, [&](BusSession& session) { session.ready(events); });
+    } else {
+      withSession(tag / 2, [&](BusSession& session) { session.processEnded(); });
+    }
+  }
+
+  // Work of other threads, at once where this is the server's own turn.
+  void handOver(Work work) {
+    if (dispatching == this) return work();
+    bool first;
+    {
+      std::lock_guard lock(mutex);
+      first = handedOver.empty();
+      handedOver.push_back(std::move(work));
+    }
+    if (first) eventfd_write(wakeUp.get(), 1);
+  }
+
+  void runHandedOver() {
+    std::vector<Work> batch;
+    {
+      std::lock_guard lock(mutex);
+      batch.swap(handedOver);
+    }
+    for (Work& work : batch) {
+      work();
+      settleChanged();
+    }
+  }
+
+  // An event or timer descriptor: both count in eight bytes.
+  static void clear(const UniqueDescriptor& counter) {
+    eventfd_t ignored;
+    eventfd_read(counter.get(), &ignored);
+  }
+
+  template <class Call>
+  void withSession(std::uint64_t number, Call call) {
+    const auto found = sessions.find(number);
+    if (found == sessions.end()) return;
+    call(*found->second.session);
+    changed(number);
+  }
+
+  template <class Call>
+  void forEachSession(Call call) {
+    std::vector<std::uint64_t> numbers;
+    for (const auto& entry : sessions) numbers.push_back(entry.first);
+    for (const std::uint64_t number : numbers) withSession(number, call);
+  }
+
+  // Not while something of it is on the stack: it may be the session's end.
+  void changed(std::uint64_t number) {
+    if (dispatching != this) return settle(number);
+    if (changedSessions.empty() || changedSessions.back() != number) changedSessions.push_back(number);
+  }
+
+  void settleChanged() {
+    while (!changedSessions.empty()) {
+      const auto numbers = std::exchange(changedSessions, {});
+      for (const std::uint64_t number : numbers) settle(number);
+    }
+  }
+
+  // Brings what is watched for into line with what the session wants now.
+  void settle(std::uint64_t number) {
+    const auto found = sessions.find(number);
+    if (found == sessions.end()) return;
+    Entry& entry = found->second;
+    if (entry.session->hasEnded()) return remove(number);
+    if (const std::uint32_t wanted = entry.session->wantedEvents(); wanted != entry.events) {
+      entry.events = wanted;
+      control(EPOLL_CTL_MOD, entry.session->socket(), wanted, socketTag(number));
+    }
+    setDeadline(entry, entry.session->deadline());
+  }
+
+  void setDeadline(Entry& entry, std::optional<Clock::time_point> deadline) {
+    if (deadline == entry.deadline) return;
+    if (entry.deadline) deadlines.erase({*entry.deadline, entry.session->number});
+    if (deadline) deadlines.insert({*deadline, entry.session->number});
+    entry.deadline = deadline;
+    armTimer();
+  }
+
+  void remove(std::uint64_t number) {
+    const auto found = sessions.find(number);
+    Entry entry = std::move(found->second);
+    setDeadline(entry, std::nullopt);
+    sessions.erase(found);
+    ::epoll_ctl(epoll.get(), EPOLL_CTL_DEL, entry.session->socket(), nullptr);
+    const PeerIdentity& peer = entry.session->peer();
+    if (peer.process) ::epoll_ctl(epoll.get(), EPOLL_CTL_DEL, peer.process->get(), nullptr);
+    if (--perUser[peer.uid] == 0) perUser.erase(peer.uid);
+    entry.session->finish();
+    if (resumeAccepting) resume();
+  }
+
+  void handleTimer() {
+    clear(timer);
+    armed.reset();
+    const auto now = Clock::now();
+    for (const auto& [time, number] : deadlines) {
+      if (time > now) break;
+      withSession(number, [](BusSession& session) { session.deadlinePassed(); });
+    }
+    if (resumeAccepting && *resumeAccepting <= now) resume();
+    armTimer();
+  }
+
+  // For the earliest deadline; with none, nothing wakes.
+  void armTimer() {
+    std::optional<Clock::time_point> next = resumeAccepting;
+    if (!deadlines.empty() && (!next || deadlines.begin()->first < *next)) next = deadlines.begin()->first;
+    if (next == armed) return;
+    armed = next;
+    itimerspec spec{};
+    if (next) {
+      const auto since =
+          std::chrono::duration_cast<std::chrono::nanoseconds>(next->time_since_epoch()).count();
+      spec.it_value = {since / 1'000'000'000, since % 1'000'000'000};
+    }
+    ::timerfd_settime(timer.get(), TFD_TIMER_ABSTIME, &spec, nullptr);
+  }
+
+  void acceptSome() {
+    // In turns, so that those who are connected already have theirs.
+    for (int turn = 0; turn < 16 && listener; ++turn) {
+      UniqueDescriptor socket(::accept4(listener.get(), nullptr, nullptr, SOCK_CLOEXEC | SOCK_NONBLOCK));
+      if (socket) {
+        offer(std::move(socket));
+      } else if (errno == EMFILE || errno == ENFILE || errno == ENOBUFS || errno == ENOMEM) {
+        return pause();
+      } else if (errno != ECONNABORTED && errno != EINTR) {
+        return;
+      }
+    }
+  }
+
+  void offer(UniqueDescriptor socket) {
+    PeerIdentity peer = establishPeer(socket.get());
+    const auto count = perUser.find(peer.uid);
+    if (sessions.size() >= limits::connections ||
+        (count != perUser.end() && count->second >= limits::connectionsPerUser)) {
+      if (!std::exchange(full, true))
+        log().error("too many connections, of user %u among others: further ones are closed", peer.uid);
+      return;
+    }
+    full = false;
+    const auto session = add(std::move(socket), peer);
+    admitter(std::move(peer), [weak = weak_from_this(), number = session->number](Admission admission) {
+      const auto self = weak.lock();
+      if (!self) return;
+      self->handOver(
+          [self = self.get(), number, admission = std::move(admission)] { self->decide(number, admission); });
+    });
+  }
+
+  std::shared_ptr<BusSession> add(UniqueDescriptor socket, PeerIdentity peer) {
+    const std::uint64_t number = nextSession++;
+    ++perUser[peer.uid];
+    const int process = peer.process ? peer.process->get() : -1;
+    auto session = std::make_shared<BusSession>(*this, number, std::move(socket), std::move(peer));
+    sessions[number].session = session;
+    if (process >= 0) control(EPOLL_CTL_ADD, process, EPOLLIN, processTag(number));
+    return session;
+  }
+
+  void decide(std::uint64_t number, const Admission& admission) {
+    const auto found = sessions.find(number);
+    if (found == sessions.end() || found->second.session->hasEnded()) {
+      if (admission.handler) admission.handler->closed();
+      return;
+    }
+    const auto session = found->second.session;
+    if (admission.handler) {
+      if (admission.admitted) admission.admitted(session);
+      begin(*session, admission.handler);
+    } else {
+      session->refuse();
+      watch(*session);
+    }
+  }
+
+  void begin(BusSession& session, std::shared_ptr<BusHandler> handler) {
+    session.admit(std::move(handler));
+    watch(session);
+  }
+
+  void watch(BusSession& session) {
+    Entry& entry = sessions.at(session.number);
+    entry.events = session.wantedEvents();
+    control(EPOLL_CTL_ADD, session.socket(), entry.events, socketTag(session.number));
+    changed(session.number);
+  }
+
+  void pause() {
+    log().error("at the limit of descriptors: accepting rests");
+    control(EPOLL_CTL_MOD, listener.get(), 0, listenerTag);
+    resumeAccepting = Clock::now() + limits::acceptPause;
+    armTimer();
+  }
+
+  void resume() {
+    resumeAccepting.reset();
+    if (listener) control(EPOLL_CTL_MOD, listener.get(), EPOLLIN, listenerTag);
+    armTimer();
+  }
+
+  static inline thread_local const State* dispatching = nullptr;
+
+  const UniqueDescriptor epoll;
+  const BusService _service;
+  const UniqueDescriptor wakeUp;
+  const UniqueDescriptor timer;
+  std::optional<Clock::time_point> armed;
+
+  UniqueDescriptor listener;
+  Admitter admitter;
+  std::optional<Clock::time_point> resumeAccepting;
+  bool full = false;
+
+  std::uint64_t nextSession = firstSession;
+  std::map<std::uint64_t, Entry> sessions;
+  std::vector<std::uint64_t> changedSessions;  // during dispatch(), to be settled
+  std::map<uid_t, std::size_t> perUser;
+  std::set<std::pair<Clock::time_point, std::uint64_t>> deadlines;
+
+  std::mutex mutex;
+  std::vector<Work> handedOver;  // guarded by `mutex`
+};
+
+BusServer::BusServer(BusInterface interface) : state(std::make_shared<State>(std::move(interface))) {}
+
+BusServer::~BusServer() { state->closeAll(); }
+
+int BusServer::descriptor() const { return state->descriptor(); }
+
+void BusServer::dispatch() { state->dispatch(); }
+
+void BusServer::listen(UniqueDescriptor socket, Admitter admitter) {
+  state->listen(std::move(socket), std::move(admitter));
+}
+
+void BusServer::stopListening() { state->stopListening(); }
+
+std::shared_ptr<BusConnection> BusServer::adopt(UniqueDescriptor socket, PeerIdentity peer,
+                                                std::shared_ptr<BusHandler> handler) {
+  return state->adopt(std::move(socket), std::move(peer), std::move(handler));
+}
+
+void BusServer::drain() { state->stopReading(); }
+
+bool BusServer::isDrained() const { return state->isDrained(); }
+
+}  // namespace platform::linux_

@@ -19,7 +19,7 @@
 namespace platform::linux_ {
 
 struct BusError {
-  std::string name;     // a D-Bus error name
+  std::string name;  // a D-Bus error name
   std::string message;
 };
 
@@ -70,9 +70,9 @@ class BusConnection {
 // Everything here belongs to the one thread that calls dispatch(), except where said otherwise.
 class BusServer {
  public:
-  // Called when the peer's identity is established, before anything that it sends is parsed. `decide` is called
-  // once, on any thread, with the handler of an admitted client, or with nothing: it is refused. `admitted` of the
-  // handler is its connection, given on the server's thread before its first call.
+  // Called when the peer's identity is established, before anything that it sends is parsed. `decide` is
+  // called once, on any thread, with the handler of an admitted client, or with nothing: it is refused.
+  // `admitted` of the handler is its connection, given on the server's thread before its first call.
   struct Admission {
     std::shared_ptr<BusHandler> handler;  // null: refused
     std::function<void(std::shared_ptr<BusConnection>)> admitted;

@@ -10,6 +10,7 @@
 #include <cerrno>
 #include <cstring>
 #include <string>
+#include <utility>
 
 #include "platform/LogSink.hpp"
 
@@ -61,15 +62,16 @@ PeerIdentity establishPeer(int socket) {
   peer.pid = credentials.pid;
   peer.uid = credentials.uid;
   peer.gid = credentials.gid;
-  peer.process = openProcess(socket, peer.pid);
-  if (!peer.process) {
+  UniqueDescriptor process = openProcess(socket, peer.pid);
+  if (!process) {
     warn("no handle on the peer's process", errno);
     return peer;
   }
+  peer.process = std::make_shared<const UniqueDescriptor>(std::move(process));
   const auto executable = executableOf(peer.pid);
   if (!executable) warn("the peer's executable", errno);
   // Last: only a process that still lives makes what /proc said under its pid its own.
-  if (isAlive(peer.process.get())) peer.executable = executable;
+  if (isAlive(peer.process->get())) peer.executable = executable;
   return peer;
 }
 

@@ -4,6 +4,7 @@
 #include <sys/types.h>
 
 #include <cstdint>
+#include <memory>
 #include <optional>
 
 #include "platform/linux/UniqueDescriptor.hpp"
@@ -23,7 +24,7 @@ struct PeerIdentity {
   };
   std::optional<Executable> executable;
   // A pidfd of that very process: readable once it has ended.
-  UniqueDescriptor process;
+  std::shared_ptr<const UniqueDescriptor> process;
 };
 
 // From the socket itself. Each system call that fails leaves its part absent; a line in the log says why.

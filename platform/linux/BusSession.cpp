@@ -1,0 +1,408 @@
+#include "platform/linux/BusSession.hpp"
+
+#include <fcntl.h>
+#include <sys/epoll.h>
+#include <sys/socket.h>
+#include <systemd/sd-bus.h>
+
+#include <algorithm>
+#include <cerrno>
+
+#include "platform/LogSink.hpp"
+#include "platform/linux/BusLimits.hpp"
+#include "platform/linux/BusValue.hpp"
+
+namespace platform::linux_ {
+namespace {
+
+const Logger& log() {
+  static const Logger logger = hearthLog("bus");
+  return logger;
+}
+
+// What stock clients ask of a bus before their first call; they are content with these answers.
+int answerHello(sd_bus_message* message, void* self, sd_bus_error*) {
+  const std::string name = ":1." + std::to_string(static_cast<BusSession*>(self)->number);
+  return sd_bus_reply_method_return(message, "s", name.c_str());
+}
+int answerNothing(sd_bus_message* message, void*, sd_bus_error*) {
+  return sd_bus_reply_method_return(message, "");
+}
+int answerOwner(sd_bus_message* message, void*, sd_bus_error*) {
+  return sd_bus_reply_method_return(message, "s", ":1.0");
+}
+int answerRunning(sd_bus_message* message, void*, sd_bus_error*) {
+  constexpr std::uint32_t alreadyRunning = 2;
+  return sd_bus_reply_method_return(message, "u", alreadyRunning);
+}
+const sd_bus_vtable busTable[] = {
+    SD_BUS_VTABLE_START(0),
+    SD_BUS_METHOD("Hello", "", "s", answerHello, SD_BUS_VTABLE_UNPRIVILEGED),
+    SD_BUS_METHOD("AddMatch", "s", "", answerNothing, SD_BUS_VTABLE_UNPRIVILEGED),
+    SD_BUS_METHOD("RemoveMatch", "s", "", answerNothing, SD_BUS_VTABLE_UNPRIVILEGED),
+    SD_BUS_METHOD("GetNameOwner", "s", "s", answerOwner, SD_BUS_VTABLE_UNPRIVILEGED),
+    SD_BUS_METHOD("StartServiceByName", "su", "u", answerRunning, SD_BUS_VTABLE_UNPRIVILEGED),
+    SD_BUS_VTABLE_END,
+};
+
+bool sendAll(int socket, std::string_view bytes) {
+  // A fresh socket takes a handshake whole, and one that does not is not read by anyone.
+  return ::send(socket, bytes.data(), bytes.size(), MSG_NOSIGNAL | MSG_DONTWAIT) ==
+         static_cast<ssize_t>(bytes.size());
+}
+
+std::vector<sd_bus_vtable> makeTable(const BusInterface& interface) {
+  std::vector<sd_bus_vtable> table{SD_BUS_VTABLE_START(0)};
+  for (const BusOperation& operation : interface.operations) {
+    table.push_back(SD_BUS_METHOD("", "", "", nullptr, SD_BUS_VTABLE_UNPRIVILEGED));
+    auto& method = table.back().x.method;
+    method.member = operation.name.c_str();
+    method.signature = operation.arguments.c_str();
+    method.result = operation.results.c_str();
+    method.handler = [](sd_bus_message* message, void* session, sd_bus_error*) {
+      return static_cast<BusSession*>(session)->call(message);
+    };
+  }
+  for (const BusSignal& signal : interface.signals) {
+    table.push_back(SD_BUS_SIGNAL("", "", 0));
+    table.back().x.signal.member = signal.name.c_str();
+    table.back().x.signal.signature = signal.arguments.c_str();
+  }
+  table.push_back(SD_BUS_VTABLE_END);
+  return table;
+}
+
+std::string randomIdentifier() {
+  sd_id128_t identifier{};
+  sd_id128_randomize(&identifier);
+  char text[SD_ID128_STRING_MAX];
+  return sd_id128_to_string(identifier, text);
+}
+
+}  // namespace
+
+BusService::BusService(BusInterface interface_)
+    : interface(std::move(interface_)), table(makeTable(interface)), identifier(randomIdentifier()) {}
+
+BusService::~BusService() = default;
+
+void BusSession::Unreference::operator()(sd_bus_message* message) const { sd_bus_message_unref(message); }
+
+BusSession::BusSession(BusSessionHost& host_, std::uint64_t number_, UniqueDescriptor socket_,
+                       PeerIdentity peer)
+    : number(number_),
+      host(host_),
+      _peer(std::move(peer)),
+      ownSocket(std::move(socket_)),
+      descriptor(ownSocket.get()) {}
+
+BusSession::~BusSession() { finish(); }
+
+void BusSession::admit(std::shared_ptr<BusHandler> handler_) {
+  handler = std::move(handler_);
+  phase = Phase::handshake;
+  end = std::chrono::steady_clock::now() + limits::handshakeTime;
+  shaking.emplace(_peer.uid, host.service().identifier);
+}
+
+void BusSession::refuse() {
+  phase = Phase::refused;
+  end = std::chrono::steady_clock::now() + limits::refusalTime;
+  // Closing at once, or with input unread, would reach the client as a broken pipe.
+  if (!sendAll(descriptor, busRefusal) || ::shutdown(descriptor, SHUT_WR) < 0) phase = Phase::ended;
+}
+
+std::uint32_t BusSession::wantedEvents() const {
+  switch (phase) {
+    case Phase::undecided:
+    case Phase::ended:
+      return 0;
+    case Phase::refused:
+    case Phase::handshake:
+      return EPOLLIN;
+    case Phase::running:
+      break;
+  }
+  const bool reads = !inputEnded && !readingStopped && outstanding() < limits::outstanding;
+  return (reads ? EPOLLIN : 0u) | (unsent() > 0 ? EPOLLOUT : 0u);
+}
+
+void BusSession::ready(std::uint32_t events) {
+  if (events & EPOLLOUT) flush();
+  if (events & EPOLLIN) {
+    readSome();
+    handleInput();
+  }
+  // Nobody is left to answer; what can still be read was sent before.
+  if ((events & (EPOLLHUP | EPOLLERR)) && !(events & EPOLLIN)) close();
+}
+
+void BusSession::processEnded() {
+  while (phase == Phase::running && !inputEnded && outstanding() < limits::outstanding && readSome())
+    handleInput();
+  close();
+}
+
+void BusSession::deadlinePassed() {
+  if (phase == Phase::refused) return close();
+  fail(phase == Phase::handshake ? "the handshake takes too long" : "nothing moves any more");
+}
+
+// Whether something was read. One turn's worth at most, or a flood would starve the others.
+bool BusSession::readSome() {
+  if (phase == Phase::ended) return false;
+  char buffer[limits::bytesPerTurn];
+  const ssize_t count = ::recv(descriptor, buffer, sizeof buffer, MSG_DONTWAIT);
+  if (count > 0) {
+    if (phase != Phase::refused) input.append(buffer, static_cast<std::size_t>(count));
+    return true;
+  }
+  if (count == 0) inputEnded = true;
+  if (count < 0 && errno != EAGAIN && errno != EINTR) close();
+  if (inputEnded && isDrained()) close();
+  return false;
+}
+
+void BusSession::handleInput() {
+  if (handling) return;  // an operation that is answered while it is called comes through here again
+  handling = true;
+  std::size_t used = phase == Phase::handshake ? shakeHands() : 0;
+  while (phase == Phase::running && !readingStopped && outstanding() < limits::outstanding) {
+    const std::string_view rest = std::string_view(input).substr(used);
+    const auto length = busMessageLength(rest, limits::messageBytes);
+    if (!length) {
+      fail(length.error() == Outcome::tooLarge ? "a message is too large" : "a message is malformed");
+    } else if (!*length || **length > rest.size()) {
+      break;
+    } else if (handleMessage(rest.substr(0, **length))) {
+      used += **length;
+    }
+  }
+  input.erase(0, used);
+  if (input.empty()) input.shrink_to_fit();  // thousands may be idle
+  handling = false;
+  if (phase == Phase::running) reconsiderDeadline(used > 0);
+  if (inputEnded && isDrained()) close();
+}
+
+// How many bytes it has used.
+std::size_t BusSession::shakeHands() {
+  std::string_view rest = input;
+  std::string answers;
+  const auto progress = shaking->advance(rest, answers);
+  if (!answers.empty() && !sendAll(descriptor, answers)) {
+    close();
+  } else if (progress == BusHandshake::Progress::failed) {
+    fail("the handshake failed");
+  } else if (progress == BusHandshake::Progress::done) {
+    shaking.reset();
+    end.reset();
+    phase = Phase::running;
+    if (!beginMessages()) fail("no bus can be made");
+  }
+  return input.size() - rest.size();
+}
+
+// Makes the library's bus. It insists on a handshake of its own: it gets one on the pair, and its answer goes
+// to the pair, too. Only then the client's socket takes the place of the output.
+bool BusSession::beginMessages() {
+  int pair[2];
+  if (::socketpair(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC | SOCK_NONBLOCK, 0, pair) < 0) return false;
+  UniqueDescriptor inner(pair[0]);
+  feed.reset(pair[1]);
+  UniqueDescriptor output(::fcntl(inner.get(), F_DUPFD_CLOEXEC, 0));
+  const int outputNumber = output.get();
+  if (!output || !sendAll(feed.get(), std::string_view("\0AUTH ANONYMOUS\r\nBEGIN\r\n", 24))) return false;
+  int result = openBus(std::move(inner), std::move(output));
+  while (result > 0) result = sd_bus_process(bus, nullptr);
+  if (result < 0 || sd_bus_is_ready(bus) <= 0) return false;
+
+  const int before = descriptor;
+  if (::dup3(descriptor, outputNumber, O_CLOEXEC) < 0) return false;
+  descriptor = outputNumber;
+  host.socketMoved(*this, before);
+  ownSocket.reset();
+  sendSignals();
+  return true;
+}
+
+// sd_bus_process()'s convention: more than 0, go on.
+int BusSession::openBus(UniqueDescriptor in, UniqueDescriptor out) {
+  const BusService& service = host.service();
+  int result = sd_bus_new(&bus);
+  if (result >= 0) result = sd_bus_set_fd(bus, in.get(), out.get());
+  if (result < 0) return result;
+  in.release();  // the library closes both
+  out.release();
+  sd_id128_t identifier{};
+  result = sd_id128_from_string(service.identifier.c_str(), &identifier);
+  if (result >= 0) result = sd_bus_set_server(bus, 1, identifier);
+  if (result >= 0) result = sd_bus_set_anonymous(bus, 1);
+  if (result >= 0) result = sd_bus_negotiate_fds(bus, 0);
+  if (result >= 0) {
+    const auto count = [](sd_bus_message*, void* self, sd_bus_error*) {
+      ++static_cast<BusSession*>(self)->dispatched;
+      return 0;
+    };
+    result = sd_bus_add_filter(bus, nullptr, count, this);
+  }
+  if (result >= 0)
+    result = sd_bus_add_object_vtable(bus, nullptr, service.interface.path.c_str(),
+                                      service.interface.name.c_str(), service.table.data(), this);
+  if (result >= 0)
+    result = sd_bus_add_object_vtable(bus, nullptr, "/org/freedesktop/DBus", "org.freedesktop.DBus", busTable,
+                                      this);
+  if (result >= 0) result = sd_bus_start(bus);
+  return result < 0 ? result : 1;
+}
+
+bool BusSession::handleMessage(std::string_view message) {
+  // The pair is empty, and its buffer many times the largest message.
+  if (!sendAll(feed.get(), message)) {
+    fail("a message cannot be passed on");
+    return false;
+  }
+  const std::size_t before = dispatched;
+  int result = 1;
+  while (result > 0 && dispatched == before) result = sd_bus_process(bus, nullptr);
+  if (result < 0) {
+    fail("a message is refused");
+  } else if (dispatched == before) {
+    fail("a message is malformed");  // the library drops such a one, and would wait for the next
+  }
+  return phase == Phase::running;
+}
+
+int BusSession::call(sd_bus_message* message) {
+  if (phase != Phase::running) return 1;
+  const auto& operations = host.service().interface.operations;
+  const std::string_view member = sd_bus_message_get_member(message);
+  const auto operation =
+      std::find_if(operations.begin(), operations.end(),
+                   [&](const BusOperation& candidate) { return candidate.name == member; });
+  auto arguments = readValues(message, operation->arguments);  // the library has found name and types to fit
+  if (!arguments) return -arguments.error().value();
+  const std::uint64_t identifier = ++lastCall;
+  unanswered.emplace(identifier, Message(sd_bus_message_ref(message)));
+  handler->call(static_cast<std::size_t>(operation - operations.begin()), std::move(*arguments),
+                host.completion(number, identifier));
+  return 1;
+}
+
+void BusSession::complete(std::uint64_t identifier, BusReply reply) {
+  const auto found = unanswered.find(identifier);
+  if (found == unanswered.end() || phase != Phase::running) return;
+  const Message message = std::move(found->second);
+  unanswered.erase(found);
+  const auto& operations = host.service().interface.operations;
+  const std::string_view member = sd_bus_message_get_member(message.get());
+  const auto operation =
+      std::find_if(operations.begin(), operations.end(),
+                   [&](const BusOperation& candidate) { return candidate.name == member; });
+  sd_bus_message* answer = nullptr;
+  if (const auto* error = std::get_if<BusError>(&reply)) {
+    const sd_bus_error description{error->name.c_str(), error->message.c_str(), 0};
+    sd_bus_message_new_method_error(message.get(), &answer, &description);
+  } else if (sd_bus_message_new_method_return(message.get(), &answer) >= 0) {
+    if (const auto appended = appendValues(answer, operation->results, std::get<List>(reply)); !appended) {
+      log().error("%s: the answer does not fit: %s", member, appended.error().message());
+      answer = sd_bus_message_unref(answer);
+    }
+  }
+  if (!answer) return fail("an answer cannot be made");
+  Message owned(answer);
+  if (sd_bus_message_get_expect_reply(message.get()) > 0) send(std::move(owned));
+  if (!input.empty() || inputEnded) handleInput();  // which may have been held up
+}
+
+void BusSession::stopReading() {
+  readingStopped = true;
+  if (phase == Phase::refused || phase == Phase::handshake || phase == Phase::undecided) close();
+}
+
+void BusSession::emit(std::size_t signal, List arguments, const std::string& mergeKey) {
+  if (phase == Phase::ended || phase == Phase::refused) return;
+  const auto earlier = std::find_if(signals.begin(), signals.end(),
+                                    [&](const Signal& candidate) { return candidate.mergeKey == mergeKey; });
+  if (earlier == signals.end()) {
+    signals.push_back({mergeKey, signal, std::move(arguments)});
+  } else {
+    earlier->arguments = std::move(arguments);
+  }
+  if (phase == Phase::running) sendSignals();
+  host.changed(*this);
+}
+
+// While output is unread, signals wait here, where they merge.
+void BusSession::sendSignals() {
+  std::size_t sent = 0;
+  for (; sent < signals.size() && unsent() == 0 && phase == Phase::running; ++sent) {
+    const BusInterface& interface = host.service().interface;
+    const BusSignal& description = interface.signals.at(signals[sent].signal);
+    sd_bus_message* message = nullptr;
+    if (sd_bus_message_new_signal(bus, &message, interface.path.c_str(), interface.name.c_str(),
+                                  description.name.c_str()) < 0)
+      return fail("a signal cannot be made");
+    Message owned(message);
+    if (appendValues(message, description.arguments, signals[sent].arguments)) {
+      send(std::move(owned));
+    } else {
+      log().error("signal %s does not fit", description.name);
+    }
+  }
+  signals.erase(signals.begin(), signals.begin() + static_cast<std::ptrdiff_t>(sent));
+}
+
+void BusSession::send(Message message) {
+  if (sd_bus_send(bus, message.get(), nullptr) < 0) return close();  // the client has gone
+  reconsiderDeadline(false);
+}
+
+void BusSession::flush() {
+  if (phase != Phase::running) return;
+  const std::size_t before = unsent();
+  int result = 1;
+  while (result > 0) result = sd_bus_process(bus, nullptr);  // the pair is empty: it only writes
+  if (result < 0) return close();
+  sendSignals();
+  reconsiderDeadline(unsent() < before);
+  handleInput();
+}
+
+std::size_t BusSession::unsent() const {
+  std::uint64_t count = 0;
+  if (bus) sd_bus_get_n_queued_write(bus, &count);
+  return static_cast<std::size_t>(count);
+}
+
+// By the client: an incomplete message, or unread output.
+bool BusSession::isHeldUp() const {
+  return unsent() > 0 || (!input.empty() && outstanding() < limits::outstanding);
+}
+
+void BusSession::reconsiderDeadline(bool moved) {
+  if (!isHeldUp()) {
+    end.reset();
+  } else if (!end || moved) {
+    end = std::chrono::steady_clock::now() + limits::stallTime;
+  }
+}
+
+void BusSession::close() {
+  if (std::exchange(phase, Phase::ended) != Phase::ended) host.changed(*this);
+}
+
+void BusSession::fail(const char* reason) {
+  if (phase != Phase::ended) log().info("client %d: %s; it is disconnected", _peer.pid, reason);
+  close();
+}
+
+void BusSession::finish() {
+  unanswered.clear();  // messages refer to the bus
+  bus = sd_bus_close_unref(bus);
+  ownSocket.reset();
+  feed.reset();
+  if (const auto told = std::exchange(handler, nullptr)) told->closed();
+}
+
+}  // namespace platform::linux_
