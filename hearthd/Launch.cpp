@@ -2,7 +2,6 @@
 
 #include <fcntl.h>
 #include <signal.h>
-#include <sys/pidfd.h>
 #include <sys/prctl.h>
 #include <sys/stat.h>
 #include <sys/wait.h>
@@ -11,6 +10,8 @@
 #include <cerrno>
 #include <cstdio>
 #include <cstring>
+
+#include "hearthd/ProcessHandle.hpp"
 
 namespace hearth {
 namespace {
@@ -112,7 +113,7 @@ platform::Result<LaunchedProcess> launch(const LaunchRequest& request) {
   launched.pid = ::fork();
   if (launched.pid < 0) return lastError();
   if (launched.pid == 0) runChild(prepared, parent, writeEnd.get());
-  launched.process.reset(::pidfd_open(launched.pid, 0));
+  launched.process = openProcess(launched.pid);
 
   // Closed by exec, so the end of the file is success.
   writeEnd.reset();

@@ -3,7 +3,6 @@
 #include <fcntl.h>
 #include <signal.h>
 #include <sys/file.h>
-#include <sys/pidfd.h>
 #include <sys/stat.h>
 #include <unistd.h>
 
@@ -11,6 +10,8 @@
 #include <cstdlib>
 #include <filesystem>
 #include <system_error>
+
+#include "hearthd/ProcessHandle.hpp"
 
 namespace hearth {
 namespace {
@@ -55,9 +56,9 @@ std::vector<UniqueDescriptor> endHolders(const std::string& path) {
     const pid_t pid = std::atoi(process.filename().c_str());
     if (pid <= 0 || pid == ::getpid()) return;
     // The handle first: what is then found to hold the file is what the handle stands for, or has ended.
-    UniqueDescriptor handle(::pidfd_open(pid, 0));
+    UniqueDescriptor handle = openProcess(pid);
     if (!handle || !holds(process, file)) return;
-    if (::pidfd_send_signal(handle.get(), SIGKILL, nullptr, 0) == 0) ended.push_back(std::move(handle));
+    if (signalProcess(handle, SIGKILL) == 0) ended.push_back(std::move(handle));
   });
   return ended;
 }

@@ -16,6 +16,7 @@
 #include "hearthd/ServiceManager.hpp"
 #include "platform/LogSink.hpp"
 #include "platform/linux/EventLoop.hpp"
+#include "platform/linux/LinuxFileSystem.hpp"
 #include "platform/linux/Paths.hpp"
 #include "platform/linux/UnifiedLog.hpp"
 
@@ -99,7 +100,7 @@ int main(int count, char** arguments) {
   if (!alive) return failed;
 
   platform::linux_::EventLoop loop;
-  platform::linux_::LinuxFileSystem files;
+  platform::linux_::LinuxFileSystem files(nullptr);  // nothing is watched
   hearth::ServiceManager manager(loop, files, paths);
   const auto stop = [&] { manager.stop([&] { loop.stop(); }); };
   const auto terminated = loop.watchSignal(SIGTERM, stop);

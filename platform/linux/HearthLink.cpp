@@ -35,7 +35,7 @@ class HearthLink::State : public std::enable_shared_from_this<State> {
       self->client = std::make_unique<AsyncBusClient>(
           self->io, std::move(*shared), hearthInterface(),
           [weak](std::size_t signal, List arguments) {
-            if (auto state = weak.lock()) state->received(signal, arguments);
+            if (auto live = weak.lock()) live->received(signal, arguments);
           },
           self->lost);
     });
