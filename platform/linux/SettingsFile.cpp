@@ -155,8 +155,9 @@ Result<void> SettingsFile::update(const std::function<bool(Dictionary& document)
     writing = true;
   }
   Dictionary next = *before;
-  Result<void> written;
-  if (change(next) || again) written = write(next);
+  const bool differs = change(next);
+  if (!differs) next = *before;
+  const auto written = differs || again ? write(next) : Result<void>();
   finishWrite(*before, next, written.has_value());
   return written;
 }
