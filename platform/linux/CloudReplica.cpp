@@ -1,0 +1,182 @@
+#include "platform/linux/CloudReplica.hpp"
+
+#include <algorithm>
+#include <tuple>
+#include <utility>
+
+#include "platform/linux/SettingsDocument.hpp"
+
+namespace platform::linux_ {
+namespace {
+
+// Beyond what any clock says, and far from overflow: such a stamp is its entry's fault.
+constexpr std::int64_t greatestStamp = std::int64_t{1} << 61;
+
+std::optional<std::int64_t> stampPart(const Dictionary& entry, std::string_view name) {
+  const auto found = entry.find(name);
+  const auto* number = found == entry.end() ? nullptr : found->second.as<std::int64_t>();
+  return number && *number >= 0 && *number <= greatestStamp ? std::optional(*number) : std::nullopt;
+}
+
+CloudStamp greatestOf(const Dictionary& entries) {
+  CloudStamp greatest;
+  for (const auto& [key, value] : entries) {
+    if (const auto entry = CloudEntry::fromValue(value)) greatest = std::max(greatest, entry->stamp);
+  }
+  return greatest;
+}
+
+std::int64_t microsecondsOf(Time time) {
+  return static_cast<std::int64_t>(std::clamp(time.count() * 1e6, 0.0, static_cast<double>(greatestStamp)));
+}
+
+bool isEcho(const CloudWrite& write) {
+  if (!write.lastKnown) return false;
+  const std::optional<Value>& known = *write.lastKnown;
+  return known && write.value ? sameValue(*known, *write.value)
+                              : known.has_value() == write.value.has_value();
+}
+
+// The key whose value says when that of `write` ends, if the write clears it and that moment is there. An
+// alarm drops the fraction, so it may come up to a second early.
+std::optional<std::string> passedCompanion(const Dictionary& entries, const CloudWrite& write) {
+  if (write.value && toBool(*write.value).value_or(true)) return std::nullopt;
+  std::string companion = write.key + "Expiration";
+  const auto entry = CloudEntry::find(entries, companion);
+  const auto end = entry && entry->value ? toDouble(*entry->value) : std::nullopt;
+  return end && *end <= write.now.count() + 1 ? std::optional(companion) : std::nullopt;
+}
+
+std::optional<std::int64_t> number(const Dictionary& document, std::string_view name) {
+  const auto found = document.find(name);
+  return found == document.end() ? std::nullopt : toInteger(found->second);
+}
+
+// A reason counts once: when its sequence number is new.
+CloudStore::ChangeReason reasonGiven(const Dictionary& before, const Dictionary& after) {
+  const auto reason = number(after, "reason");
+  const bool isNew = number(after, "reasonSequence") != number(before, "reasonSequence");
+  return isNew && reason && *reason >= 1 && *reason <= 3 ? CloudStore::ChangeReason(*reason)
+                                                         : CloudStore::ChangeReason::serverChange;
+}
+
+}  // namespace
+
+std::optional<CloudEntry> CloudEntry::fromValue(const Value& value) {
+  const auto* fields = value.as<Dictionary>();
+  if (!fields) return std::nullopt;
+  const auto microseconds = stampPart(*fields, "time");
+  const auto tick = stampPart(*fields, "tick");
+  const auto device = fields->find("device");
+  const auto stored = fields->find("value");
+  const auto removed = fields->find("removed");
+  const bool isRemoved = removed != fields->end() && removed->second == Value(true);
+  if (!microseconds || !tick || device == fields->end() || !device->second.as<std::string>())
+    return std::nullopt;
+  if (isRemoved == (stored != fields->end())) return std::nullopt;
+  return CloudEntry{isRemoved ? std::nullopt : std::optional(stored->second),
+                    {*microseconds, *tick},
+                    *device->second.as<std::string>()};
+}
+
+std::optional<CloudEntry> CloudEntry::find(const Dictionary& entries, std::string_view key) {
+  const auto found = entries.find(key);
+  return found == entries.end() ? std::nullopt : fromValue(found->second);
+}
+
+Value CloudEntry::toValue() const {
+  Dictionary fields{{"time", stamp.microseconds}, {"tick", stamp.tick}, {"device", device}};
+  fields.emplace(value ? "value" : "removed", value ? *value : Value(true));
+  return fields;
+}
+
+bool CloudEntry::outranks(const CloudEntry& other) const {
+  if (std::tie(stamp, device) != std::tie(other.stamp, other.device)) {
+    return std::tie(stamp, device) > std::tie(other.stamp, other.device);
+  }
+  return describe(toValue()) > describe(other.toValue());
+}
+
+Dictionary cloudValues(const Dictionary& entries) {
+  Dictionary values;
+  for (const auto& [key, value] : entries) {
+    const auto entry = CloudEntry::fromValue(value);
+    if (entry && entry->value) values.emplace(key, *entry->value);
+  }
+  return values;
+}
+
+bool mergeCloudEntries(const Dictionary& other, Dictionary& into) {
+  bool changed = false;
+  for (const auto& [key, value] : other) {
+    const auto theirs = CloudEntry::fromValue(value);
+    const auto ours = CloudEntry::find(into, key);
+    if (!theirs || (ours && !theirs->outranks(*ours))) continue;
+    into.insert_or_assign(key, value);
+    changed = true;
+  }
+  return changed;
+}
+
+std::vector<CloudReport> cloudReports(const Dictionary& before, const Dictionary& after) {
+  using Reason = CloudStore::ChangeReason;
+  std::vector<std::string> keys =
+      differingKeys(cloudValues(settingsValues(before)), cloudValues(settingsValues(after)));
+  const Reason reason = reasonGiven(before, after);
+  std::vector<CloudReport> reports;
+  if (reason == Reason::quotaViolation) reports.push_back({reason, {}});
+  const bool isOwnReport = reason == Reason::initialSync || reason == Reason::accountChange;
+  if (isOwnReport || !keys.empty()) {
+    reports.push_back({isOwnReport ? reason : Reason::serverChange, std::move(keys)});
+  }
+  return reports;
+}
+
+bool CloudBursts::write(Dictionary& entries, const CloudWrite& write) {
+  if (const auto companion = passedCompanion(entries, write)) return expire(entries, write, *companion);
+  if (!write.value && write.key == expiring) return place(entries, write);
+  if (!joins(entries, write)) {
+    if (isEcho(write)) return false;
+    stamp = {std::max(microsecondsOf(write.now), greatestOf(entries).microseconds + 1), 0};
+    keys.clear();
+    expiring.clear();
+  }
+  keys.insert(write.key);
+  lastWrite = write.now;
+  return place(entries, write);
+}
+
+void CloudBursts::finished(Time now) {
+  if (lastWrite) lastWrite = now;
+}
+
+// With the stamp of now, a device that was off for days and ends its stale period at boot would end what
+// somebody switched on since; and flag and end time of two devices could mix.
+bool CloudBursts::expire(Dictionary& entries, const CloudWrite& write, const std::string& companion) {
+  const auto cleared = CloudEntry::find(entries, write.key);
+  const CloudStamp end = CloudEntry::find(entries, companion)->stamp;
+  stamp = cleared ? std::max(cleared->stamp, end) : end;
+  ++stamp.tick;
+  lastWrite.reset();
+  expiring = companion;
+  return !isEcho(write) && place(entries, write);
+}
+
+// What is written together carries one stamp, or the flag and end time of two devices could mix. A second
+// value for a key begins the next at once: another process may have published the first. So does an entry
+// that somebody else has overtaken, since the write would be lost on it.
+bool CloudBursts::joins(const Dictionary& entries, const CloudWrite& write) const {
+  if (!lastWrite || write.now < *lastWrite || write.now - *lastWrite > quiet) return false;
+  const auto there = CloudEntry::find(entries, write.key);
+  return !keys.contains(write.key) && !(there && there->stamp >= stamp);
+}
+
+bool CloudBursts::place(Dictionary& entries, const CloudWrite& write) {
+  const CloudEntry entry{write.value, stamp, write.device};
+  const auto there = CloudEntry::find(entries, write.key);
+  if (there && !entry.outranks(*there)) return false;  // an expiry whose period somebody has begun anew
+  entries.insert_or_assign(write.key, entry.toValue());
+  return true;
+}
+
+}  // namespace platform::linux_

@@ -1,0 +1,124 @@
+#include "platform/linux/ReplicaFileCloudStore.hpp"
+
+#include <utility>
+
+#include "platform/LogSink.hpp"
+#include "platform/UUID.hpp"
+#include "platform/linux/SettingsDocument.hpp"
+
+namespace platform::linux_ {
+namespace {
+
+// The device's name, made with its first write.
+std::string deviceOf(Dictionary& document) {
+  Value& device = document["device"];
+  if (!device.as<std::string>()) device = UUID::random().text();
+  return *device.as<std::string>();
+}
+
+}  // namespace
+
+std::shared_ptr<ReplicaFileCloudStore> ReplicaFileCloudStore::create(FileSystem& files, WorkQueue* delivery,
+                                                                     NotificationCentre& centre, Clock& clock,
+                                                                     std::string path) {
+  std::shared_ptr<ReplicaFileCloudStore> store(
+      new ReplicaFileCloudStore(files, centre, clock, std::move(path)));
+  if (!delivery) return store;
+  store->file->startWatching(
+      *delivery, [weak = std::weak_ptr(store)](const Dictionary& before, const Dictionary& after) {
+        const auto self = weak.lock();
+        if (!self) return;
+        for (const CloudReport& report : cloudReports(before, after)) self->report(report);
+      });
+  return store;
+}
+
+ReplicaFileCloudStore::ReplicaFileCloudStore(FileSystem& files, NotificationCentre& centre_, Clock& clock_,
+                                             std::string path)
+    : centre(centre_), clock(clock_), file(SettingsFile::create(files, std::move(path))) {}
+
+std::optional<Value> ReplicaFileCloudStore::read(std::string_view key) {
+  std::lock_guard lock(mutex);
+  const auto document = file->contents();
+  const auto entry = CloudEntry::find(settingsValues(*document), key);
+  const std::optional<Value> value = entry ? entry->value : std::nullopt;
+  lastKnown.insert_or_assign(std::string(key), value);
+  return value;
+}
+
+bool ReplicaFileCloudStore::boolForKey(std::string_view key) {
+  const auto found = read(key);
+  return found && toBool(*found).value_or(false);
+}
+
+double ReplicaFileCloudStore::doubleForKey(std::string_view key) {
+  const auto found = read(key);
+  return found ? toDouble(*found).value_or(0.0) : 0.0;
+}
+
+std::optional<std::string> ReplicaFileCloudStore::textForKey(std::string_view key) {
+  const auto found = read(key);
+  return found ? toText(*found) : std::nullopt;
+}
+
+void ReplicaFileCloudStore::setValue(const std::optional<Value>& value, std::string_view key) {
+  if (const auto written = write(value, key); !written) {
+    hearthLog("files").error("cloud store: %s cannot be stored: %s", key, written.error().message());
+  }
+}
+
+Result<void> ReplicaFileCloudStore::write(const std::optional<Value>& value, std::string_view key) {
+  std::lock_guard writeLock(writeMutex);
+  CloudWrite write{std::string(key), value, std::nullopt, Time{}, {}};
+  {
+    std::lock_guard lock(mutex);
+    if (const auto known = lastKnown.find(key); known != lastKnown.end()) write.lastKnown = known->second;
+  }
+  CloudBursts next = bursts;
+  const auto written = file->update([&](Dictionary& document) {
+    write.device = deviceOf(document);
+    write.now = clock.now();
+    return next.write(settingsValues(document), write);
+  });
+  std::lock_guard lock(mutex);
+  isDurable = written.has_value();
+  if (!written) return written;
+  next.finished(clock.now());
+  bursts = next;
+  lastKnown.insert_or_assign(write.key, value);
+  return written;
+}
+
+Result<void> ReplicaFileCloudStore::replaceValues(const Dictionary& values) {
+  return file->update([&](Dictionary& document) {
+    const std::string device = deviceOf(document);
+    Dictionary& entries = settingsValues(document);
+    CloudBursts own;
+    bool changed = false;
+    for (const std::string& key : differingKeys(cloudValues(entries), values)) {
+      const auto found = values.find(key);
+      const auto value = found == values.end() ? std::nullopt : std::optional(found->second);
+      changed |= own.write(entries, {key, value, std::nullopt, clock.now(), device});
+    }
+    return changed;
+  });
+}
+
+bool ReplicaFileCloudStore::synchronise() {
+  std::lock_guard lock(mutex);
+  return isDurable;
+}
+
+Dictionary ReplicaFileCloudStore::dictionaryRepresentation() {
+  return cloudValues(settingsValues(*file->contents()));
+}
+
+void ReplicaFileCloudStore::report(const CloudReport& report) {
+  List keys(report.keys.begin(), report.keys.end());
+  Dictionary userInfo;
+  userInfo.emplace(changeReasonKey, static_cast<int>(report.reason));
+  userInfo.emplace(changedKeysKey, std::move(keys));
+  centre.post(externalChangeNotification, static_cast<CloudStore*>(this), std::move(userInfo));
+}
+
+}  // namespace platform::linux_
