@@ -1,0 +1,60 @@
+#include "platform/linux/DeviceFile.hpp"
+
+#include <system_error>
+#include <utility>
+
+#include "platform/LogSink.hpp"
+#include "platform/linux/Json.hpp"
+
+namespace platform::linux_ {
+namespace {
+
+constexpr std::size_t sizeLimit = 1 << 20;
+
+Result<Dictionary> parse(const Result<std::string>& text, std::string& problem) {
+  if (!text) {
+    problem = text.error().message();
+    return text.error();
+  }
+  const auto value = parseJson(*text, problem);
+  if (!value) return value.error();
+  if (const auto* entries = value->as<Dictionary>()) return *entries;
+  problem = "line 1, column 1: not an object";
+  return Outcome::malformedFile;
+}
+
+}  // namespace
+
+DeviceFile::DeviceFile(FileSystem& files_, std::string path_) : files(files_), path(std::move(path_)) {}
+
+std::optional<Value> DeviceFile::entry(std::string_view key) {
+  std::lock_guard lock(mutex);
+  refresh();
+  const auto found = entries.find(key);
+  return found == entries.end() ? std::nullopt : std::optional(found->second);
+}
+
+void DeviceFile::refresh() {
+  const auto current = files.identity(path);
+  if (current && held && *current == heldIdentity) return;
+  entries.clear();
+  held.reset();
+  auto file = files.openToRead(path);
+  const auto previous = std::exchange(failure, file ? std::error_code() : file.error());
+  if (!file) {
+    const bool isNews = failure != previous && failure != std::errc::no_such_file_or_directory;
+    if (isNews) hearthLog("files").error("%s: %s; skipped", path, failure.message());
+    return;
+  }
+  const auto identity = (*file)->identity();
+  std::string problem;
+  auto parsed = parse((*file)->readAll(sizeLimit), problem);
+  if (!parsed) hearthLog("files").error("%s: %s; skipped", path, problem);
+  if (parsed) entries = std::move(*parsed);
+  if (identity) {
+    heldIdentity = *identity;
+    held = std::move(*file);
+  }
+}
+
+}  // namespace platform::linux_
