@@ -1,0 +1,255 @@
+// Admission of clients, and what they may ask.
+#include "pairwelld/service/ConduitListener.hpp"
+
+#include "pairwelld/service/ConduitConnection.hpp"
+#include "pairwelld/service/RadixDistributedDebugLogging.hpp"
+#include "tests/pairwelld/World.hpp"
+
+namespace pairwell {
+namespace {
+
+constexpr const char* systemKey = "com.kestrel.bluetooth.system";
+constexpr const char* internalKey = "com.kestrel.bluetooth.internal";
+
+// Says what it is asked, and answers what it was told to.
+class RecordingManager : public DebugManager {
+ public:
+  RecordingManager(std::shared_ptr<KeyValueStoreManager> store, Effects& effects_)
+      : DebugManager(std::move(store)), effects(effects_) {}
+  bool audioAccessoryLimitedLoggingEnabled() override {
+    effects.record(Effects::client, "read");
+    return answer;
+  }
+  void setAudioAccessoryLimitedLoggingEnabled(bool enabled) override {
+    effects.record(Effects::client, enabled ? "on" : "off");
+  }
+  bool answer = false;
+
+ private:
+  Effects& effects;
+};
+
+class ConduitListenerTest : public World {
+ public:
+  ConduitListenerTest() {
+    listener->activate();
+    run();
+    // Clients that end at the test's end leave the list, and so the listener.
+    platform.cutSubscriptions.push_back([queue = listener->serialQueue] { on(queue, [] {}); });
+    mark();
+  }
+  using Client = std::shared_ptr<fakes::FakeClientConnection>;
+  Client offer(std::int32_t process, platform::Dictionary entitlements, fakes::FakeServiceListener& to) {
+    auto made =
+        std::make_shared<fakes::FakeClientConnection>(platform.effects, process, std::move(entitlements));
+    to.offer(made);
+    run();
+    return made;
+  }
+  Client offer(std::int32_t process, platform::Dictionary entitlements = {{systemKey, true}}) {
+    return offer(process, std::move(entitlements), *platform.listeners[0]);
+  }
+  std::vector<std::int32_t> connected() {
+    std::vector<std::int32_t> processes;
+    on(listener->serialQueue, [&] {
+      listener->serialQueue->assertCurrent();
+      for (const auto& connection : listener->connections()) {
+        processes.push_back(connection->conduitConnection->processIdentifier());
+      }
+    });
+    return processes;
+  }
+  auto completion() {
+    return [this](platform::OptionalError error) { calls.push_back(error ? "error" : "done"); };
+  }
+  // Of an operation with a result.
+  auto answer() {
+    return [this](auto result, platform::OptionalError error) {
+      calls.push_back(error ? "error" : std::to_string(result));
+    };
+  }
+  // What the operation did on the way to its answer, which comes last. None of it before the pool's turn.
+  template <class Operation>
+  Calls outcome(Operation operation) {
+    mark();
+    calls.clear();
+    operation(*client->exportedObject);
+    EXPECT_THAT(effects(~0u), IsEmpty());
+    EXPECT_THAT(calls, IsEmpty());
+    run();
+    Calls all = effects(Effects::log | Effects::client);
+    all.insert(all.end(), calls.begin(), calls.end());
+    return all;
+  }
+  using Interface = platform::RadixUserControllerInterface;
+  Calls statusRead() {
+    return outcome([this](Interface& object) { object.getDistributedLoggingStatus(answer()); });
+  }
+  Calls statusWrite(std::uint32_t status) {
+    return outcome([&](Interface& object) { object.setDistributedLoggingStatus(status, completion()); });
+  }
+  Calls switchRead() {
+    return outcome([this](Interface& object) { object.kestrelAudioAccessoryLimitedLogging(answer()); });
+  }
+  Calls switchWrite(bool enabled) {
+    return outcome(
+        [&](Interface& object) { object.setKestrelAudioAccessoryLimitedLogging(enabled, completion()); });
+  }
+
+  std::shared_ptr<ConduitListener> listener = ConduitListener::create();
+  Client client;
+};
+
+TEST_F(ConduitListenerTest, OnlyTheBooleanTrueOfEitherEntitlementAdmits) {
+  const struct {
+    const char* name;
+    platform::Dictionary entitlements;
+    bool admitted;
+    std::size_t lookUps;
+  } table[] = {
+      {"system", {{systemKey, true}}, true, 1},
+      {"internal", {{internalKey, true}}, true, 2},
+      {"system false, internal true", {{systemKey, false}, {internalKey, true}}, true, 2},
+      {"text", {{systemKey, "true"}, {internalKey, platform::List{true}}}, false, 2},
+      {"number", {{systemKey, 1}, {internalKey, 1}}, false, 2},
+      {"another", {{"com.kestrel.bluetooth", true}}, false, 2},
+      {"none", {}, false, 2},
+  };
+  for (const int internalBuild : {0, 2}) {
+    platform.device.internalBuild = internalBuild;
+    const std::string denial = std::string("conduit error: Conduit connection denied, 7") +
+                               (internalBuild ? ", add com.kestrel.bluetooth.system entitlement" : "");
+    for (const auto& row : table) {
+      SCOPED_TRACE(row.name);
+      mark();
+      const auto offered = offer(7, row.entitlements);
+      EXPECT_EQ(offered->admitted, row.admitted);
+      EXPECT_EQ(offered->lookedUp.size(), row.lookUps);
+      EXPECT_EQ(log(), Calls{row.admitted ? "conduit default: Conduit connection started: 7" : denial});
+      EXPECT_EQ(offered->exportedObject != nullptr, row.admitted);
+    }
+  }
+}
+
+TEST_F(ConduitListenerTest, AnAdmittedClientIsSetUpBeforeItIsResumed) {
+  client = offer(7);
+  EXPECT_THAT(effects(~0u),
+              ElementsAre("exported interface", "exported object", "invalidation handler", "remote interface",
+                          "resumed", "conduit default: Conduit connection started: 7"));
+  EXPECT_EQ(client->exportedInterface, platform::RadixUserControllerConduitInterface());
+  EXPECT_EQ(client->remoteInterface, client->exportedInterface);
+  const auto second = offer(7);
+  EXPECT_NE(second->exportedObject, client->exportedObject);
+}
+
+TEST_F(ConduitListenerTest, AForeignListenerIsRefusedAfterTheEntitlement) {
+  const auto other = std::make_shared<fakes::FakeServiceListener>("other");
+  other->setDelegate(listener);
+  other->setQueue(listener->serialQueue);
+  other->resume();
+  EXPECT_FALSE(*offer(7, {{systemKey, true}}, *other)->admitted);
+  EXPECT_FALSE(*offer(8, {}, *other)->admitted);
+  EXPECT_THAT(log(), ElementsAre("conduit error: Conduit connection denied bad listener, 7",
+                                 "conduit error: Conduit connection denied, 8"));
+  EXPECT_THAT(connected(), IsEmpty());
+}
+
+TEST_F(ConduitListenerTest, ConnectionsStayInOrderUntilTheyEnd) {
+  const auto first = offer(1), second = offer(2), third = offer(3);
+  EXPECT_THAT(connected(), ElementsAre(1, 2, 3));
+  const std::weak_ptr<Interface> weak = second->exportedObject;
+  second->end();
+  EXPECT_THAT(connected(), ElementsAre(1, 3));
+  run();
+  EXPECT_TRUE(weak.expired());
+  mark();
+  listener->invalidate();
+  run();
+  EXPECT_THAT(log(), ElementsAre("conduit default: Invalidate Pairwell Controller Conduit Service"));
+  EXPECT_TRUE(platform.listeners[0]->invalidated);
+  EXPECT_THAT(connected(), ElementsAre(1, 3));
+}
+
+TEST_F(ConduitListenerTest, AListenerThatHasGoneIsMissedByNobody) {
+  const auto last = offer(1);
+  const std::weak_ptr<ConduitListener> weak = listener;
+  listener.reset();
+  EXPECT_FALSE(weak.expired()) << "its client still needs it";
+  platform.listeners[0]->clients.clear();
+  last->end();
+  run();
+  EXPECT_TRUE(weak.expired());
+  mark();
+  EXPECT_FALSE(*offer(2)->admitted);
+  auto unused = ConduitListener::create();
+  unused->activate();
+  unused->invalidate();
+  unused.reset();
+  run();
+  EXPECT_THAT(effects(~0u), IsEmpty());
+}
+
+TEST_F(ConduitListenerTest, OperationsReachTheDebugManagerOfTheMoment) {
+  client = offer(7);
+  const auto line = [](std::string text) { return "conduit default: " + text; };
+  const std::string status = line("Distributed logging status: "),
+                    changed = line("Distributed logging status changed: ");
+  const std::string limited = line("Kestrel audio accessory limited logging enabled: "),
+                    enable = line("Enable Kestrel audio accessory limited logging: ");
+  EXPECT_THAT(statusRead(), ElementsAre(status + "0", "0"));
+  EXPECT_THAT(statusWrite(3), ElementsAre(changed + "3", "done"));
+  EXPECT_THAT(switchRead(), ElementsAre("0"));
+  EXPECT_THAT(switchWrite(true), ElementsAre(enable + "Yes", "done"));
+
+  const auto manager = std::make_shared<RecordingManager>(makeManager(), platform.effects);
+  listener->debugManager = manager;
+  EXPECT_THAT(statusRead(), ElementsAre("read", status + "0", "0"));
+  EXPECT_THAT(switchRead(), ElementsAre("read", limited + "false", "0"));
+  manager->answer = true;
+  EXPECT_THAT(statusRead(), ElementsAre("read", status + "1", "1"));
+  EXPECT_THAT(switchRead(), ElementsAre("read", limited + "true", "1"));
+  EXPECT_THAT(statusWrite(3), ElementsAre("on", changed + "3", "done"));
+  EXPECT_THAT(statusWrite(2), ElementsAre("off", changed + "2", "done"));
+  EXPECT_THAT(statusWrite(0x80000001), ElementsAre("on", changed + "2147483649", "done"));
+  EXPECT_THAT(switchWrite(true), ElementsAre(enable + "Yes", "on", "done"));
+  EXPECT_THAT(switchWrite(false), ElementsAre(enable + "No", "off", "done"));
+
+  std::optional<std::string> name;
+  client->exportedObject->getCurrentUserGivenName([&](auto text, auto error) {
+    if (!error) name = text;
+  });
+  EXPECT_EQ(name, "") << "answered at once";
+}
+
+TEST_F(ConduitListenerTest, AnAcceptedCallCompletesThoughItsClientHasGone) {
+  listener->debugManager = makeDebugManager();
+  run();
+  client = offer(7);
+  client->exportedObject->setDistributedLoggingStatus(1, completion());
+  client->exportedObject->getDistributedLoggingStatus(answer());
+  const std::weak_ptr<Interface> weak = client->exportedObject;
+  platform.listeners[0]->clients.clear();
+  client->end();
+  client.reset();
+  EXPECT_THAT(calls, IsEmpty());
+  run();
+  EXPECT_THAT(calls, ElementsAre("done", "1"));
+  EXPECT_TRUE(weak.expired());
+  EXPECT_EQ(platform.cloud->value(flagKey), Value(true));
+}
+
+TEST(RadixDistributedDebugLoggingTest, OnlyBitZeroHasAName) {
+  using Set = RadixDistributedDebugLogging;
+  const char* texts[] = {"", "Kestrel Audio Accessory", "", "Kestrel Audio Accessory"};
+  for (std::uint32_t raw = 0; raw < 4; ++raw) EXPECT_EQ(Set(raw).description(), texts[raw]);
+  EXPECT_EQ(Set{}.rawValue, 0u);
+  EXPECT_EQ((Set{Set::audioAccessory, Set::audioAccessory}).rawValue, 1u);
+  EXPECT_EQ((Set{Set::audioAccessory, Set(6)}).rawValue, 7u);
+  EXPECT_FALSE(Set(2).contains(Set(3)));
+  EXPECT_TRUE(Set(3).contains(Set(2)) && Set(2).isSubset(Set(3)) && Set(2).isDisjoint(Set(1)));
+  EXPECT_EQ(Set(6).subtracting(Set(2)), Set(4));
+  EXPECT_EQ(Set(6).symmetricDifference(Set(3)), Set(5));
+}
+
+}  // namespace
+}  // namespace pairwell
