@@ -59,6 +59,7 @@ class BusServer::State : public BusSessionHost, public std::enable_shared_from_t
     }
     runHandedOver();
     dispatching = outer;
+    tellIfDrained();
   }
 
   void listen(UniqueDescriptor socket, Admitter admitter_) {
@@ -81,14 +82,11 @@ class BusServer::State : public BusSessionHost, public std::enable_shared_from_t
     return session;
   }
 
-  void stopReading() {
+  void drain(std::function<void()> drained) {
     stopListening();
+    whenDrained = std::move(drained);
     forEachSession([](BusSession& session) { session.stopReading(); });
-  }
-
-  bool isDrained() const {
-    return std::all_of(sessions.begin(), sessions.end(),
-                       [](const auto& entry) { return entry.second.session->isDrained(); });
+    tellIfDrained();
   }
 
   void closeAll() {
@@ -203,6 +201,13 @@ class BusServer::State : public BusSessionHost, public std::enable_shared_from_t
       const auto numbers = std::exchange(changedSessions, {});
       for (const std::uint64_t number : numbers) settle(number);
     }
+  }
+
+  void tellIfDrained() {
+    if (!whenDrained) return;
+    const bool drained = std::all_of(sessions.begin(), sessions.end(),
+                                     [](const auto& entry) { return entry.second.session->isDrained(); });
+    if (drained) std::exchange(whenDrained, nullptr)();
   }
 
   // Brings what is watched for into line with what the session wants now.
@@ -365,6 +370,7 @@ class BusServer::State : public BusSessionHost, public std::enable_shared_from_t
 
   std::uint64_t nextSession = firstSession;
   std::map<std::uint64_t, Entry> sessions;
+  std::function<void()> whenDrained;
   std::vector<std::uint64_t> changedSessions;  // during dispatch(), to be settled
   std::map<uid_t, std::size_t> perUser;
   std::set<std::pair<Clock::time_point, std::uint64_t>> deadlines;
@@ -392,8 +398,6 @@ std::shared_ptr<BusConnection> BusServer::adopt(UniqueDescriptor socket, PeerIde
   return state->adopt(std::move(socket), std::move(peer), std::move(handler));
 }
 
-void BusServer::drain() { state->stopReading(); }
-
-bool BusServer::isDrained() const { return state->isDrained(); }
+void BusServer::drain(std::function<void()> drained) { state->drain(std::move(drained)); }
 
 }  // namespace platform::linux_

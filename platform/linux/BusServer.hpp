@@ -94,9 +94,9 @@ class BusServer {
   // Serves a socket whose other end is known already.
   std::shared_ptr<BusConnection> adopt(UniqueDescriptor socket, PeerIdentity peer,
                                        std::shared_ptr<BusHandler> handler);
-  // Reading stops for good; answers still under way leave. Whether none is left.
-  void drain();
-  bool isDrained() const;
+  // Accepting and reading stop for good; `drained` is called once no answer is left to be made or to leave,
+  // perhaps before drain() returns.
+  void drain(std::function<void()> drained);
 
  private:
   class State;

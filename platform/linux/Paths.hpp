@@ -2,6 +2,7 @@
 #pragma once
 
 #include <string>
+#include <string_view>
 
 namespace platform::linux_ {
 
@@ -20,8 +21,8 @@ struct Paths {
   std::string entitlements() const { return etc + "/entitlements.d"; }
   std::string userSettings() const { return var + "/settings/user/com.kestrel.pairwelld.json"; }
   std::string rootSettings() const { return var + "/settings/root/com.kestrel.bluetooth.json"; }
-  std::string cloudSettings() const {
-    return var + "/settings/cloud/com.kestrel.bluetooth.cloud.settings.json";
+  std::string cloudSettings(std::string_view identifier) const {
+    return var + "/settings/cloud/" + std::string(identifier) + ".json";
   }
   std::string hearthd() const { return var + "/hearthd"; }
   std::string hearthdSocket() const { return run + "/hearthd.sock"; }
