@@ -10,18 +10,6 @@
 namespace platform::linux_ {
 namespace {
 
-BusInterface busInterface(std::string_view serviceName, const InterfaceDescription& description) {
-  BusInterface interface {
-    "/" + std::string(serviceName), std::string(description.name), {}, {}
-  };
-  std::replace(interface.path.begin(), interface.path.end(), '.', '/');
-  for (const OperationDescription& operation : description.operations) {
-    interface.operations.push_back(
-        {std::string(operation.name), std::string(operation.arguments), std::string(operation.results)});
-  }
-  return interface;
-}
-
 // One client. Set up on the listener's queue; from the decision on the I/O thread's alone.
 class BusClientConnection : public ClientConnection, public BusHandler {
  public:
@@ -70,6 +58,19 @@ class BusClientConnection : public ClientConnection, public BusHandler {
 
 }  // namespace
 
+BusInterface clientInterface(std::string_view serviceName) {
+  const auto description = RadixUserControllerConduitInterface();
+  BusInterface interface {
+    "/" + std::string(serviceName), std::string(description->name), {}, {}
+  };
+  std::replace(interface.path.begin(), interface.path.end(), '.', '/');
+  for (const OperationDescription& operation : description->operations) {
+    interface.operations.push_back(
+        {std::string(operation.name), std::string(operation.arguments), std::string(operation.results)});
+  }
+  return interface;
+}
+
 std::shared_ptr<BusServiceListener> BusServiceListener::create(EventLoop& io, Entitlements& entitlements,
                                                                std::string_view serviceName,
                                                                UniqueDescriptor socket) {
@@ -82,8 +83,7 @@ BusServiceListener::BusServiceListener(EventLoop& io_, Entitlements& entitlement
     : io(io_),
       entitlements(entitlements_),
       socket(std::move(socket_)),
-      server(std::make_unique<BusServer>(busInterface(serviceName, *RadixUserControllerConduitInterface()))) {
-}
+      server(std::make_unique<BusServer>(clientInterface(serviceName))) {}
 
 BusServiceListener::~BusServiceListener() {
   // Ended where they are used.

@@ -12,7 +12,10 @@
 
 namespace platform::linux_ {
 
-// Serves RadixUserControllerInterface on an object named after the service: dots become slashes.
+// The client interface as the message format has it, on an object named after the service: dots become
+// slashes.
+BusInterface clientInterface(std::string_view serviceName);
+
 class BusServiceListener : public ServiceListener, public std::enable_shared_from_this<BusServiceListener> {
  public:
   // `io`, on whose thread clients are served, and `entitlements` outlive the object. Without a socket nobody
