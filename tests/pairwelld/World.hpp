@@ -4,6 +4,7 @@
 #include <gmock/gmock.h>
 #include <gtest/gtest.h>
 
+#include <cstdint>
 #include <functional>
 #include <memory>
 #include <string>
@@ -71,6 +72,19 @@ class World : public testing::Test {
   Calls log() const { return effects(Effects::log); }
   void mark() { platform.effects.mark(); }
   void run() { platform.runAll(); }
+  void changeUser() { platform.user->changeFromElsewhere(overrideKey, 60); }
+  void changeRoot() { platform.named.postFromElsewhere("com.kestrel.bluetooth.prefsChanged"); }
+  void changeCloud() { platform.cloud->changeFromElsewhere({{"other", 1}, {"another", 2}}); }
+  // A client comes to the first listener, or to another.
+  std::shared_ptr<fakes::FakeClientConnection> offerClient(
+      std::int32_t process, platform::Dictionary entitlements = {{"com.kestrel.bluetooth.system", true}},
+      fakes::FakeServiceListener* listener = nullptr) {
+    auto client =
+        std::make_shared<fakes::FakeClientConnection>(platform.effects, process, std::move(entitlements));
+    (listener ? listener : platform.listeners[0].get())->offer(client);
+    run();
+    return client;
+  }
   double now() { return platform.manualClock.time.count(); }
 
   std::shared_ptr<Subscriber> makeSubscriber(const char* label) {

@@ -10,74 +10,64 @@ namespace {
 
 constexpr double infinity = std::numeric_limits<double>::infinity();
 
-Calls steps(const std::string& flag, const std::string& end, const std::string& alarm) {
-  return {"root flag=" + flag,
-          "post bluetooth.prefsChanged",
-          "cloud flag=" + flag,
-          "post cloud.storeChanged",
-          "post pairwell.prefsChanged",
-          "cloud end=" + end,
-          "post cloud.storeChanged",
-          "post pairwell.prefsChanged",
-          "alarm " + alarm,
-          "post pairwell.settingsChanged"};
+Calls steps(std::string flag, std::string end, std::string alarm) {
+  const std::string cloud = "post cloud.storeChanged", changed = "post pairwell.prefsChanged";
+  Calls all = {"root flag=" + flag, "post bluetooth.prefsChanged", "cloud flag=" + flag, cloud, changed};
+  all.insert(all.end(), {"cloud end=" + end, cloud, changed, "alarm " + alarm});
+  all.push_back("post pairwell.settingsChanged");
+  return all;
 }
-const Calls stopped = steps("false", "nil", "cleared"),
-            fresh = steps("true", "1345600.0", "at 1345600000000000 ns");
+// The clock stands at 1,000,000.
+const Calls fresh = steps("true", "1345600.0", "at 1345600000000000 ns"),
+            stopped = steps("false", "nil", "cleared"), nothing;
 
 class DebugManagerTest : public World {
  public:
+  void start() {
+    manager = makeDebugManager();
+    effectsAfterRun();
+  }
+  // With its end an hour from now.
+  void startWithAPeriod() {
+    platform.cloud->store(flagKey, true);
+    platform.cloud->store(endKey, now() + 3600);
+    start();
+  }
   Calls effectsAfterRun() {
     run();
-    auto all = effects(Effects::store | Effects::alarm | Effects::post);
+    lines.clear();
+    for (const auto& line : log()) {
+      if (line.find("debugManager ") == 0 && line.find("keyValueChanged") == line.npos)
+        lines.push_back(line.substr(13));
+    }
+    const Calls all = effects(Effects::store | Effects::alarm | Effects::post);
     mark();
     return all;
   }
-  Calls debugLines() const {
-    Calls lines;
-    for (const auto& line : log()) {
-      const std::string prefix = "debugManager ";
-      if (line.find(prefix) == 0 && line.find("keyValueChanged") == line.npos)
-        lines.push_back(line.substr(prefix.size()));
-    }
-    return lines;
+  Calls effectsOf(bool enabled) {
+    manager->setAudioAccessoryLimitedLoggingEnabled(enabled);
+    return effectsAfterRun();
   }
-  std::shared_ptr<DebugManager> makeIdle() {
-    auto manager = makeDebugManager();
-    run();
-    mark();
-    return manager;
-  }
-  // Running, with its end an hour from now.
-  std::shared_ptr<DebugManager> makeRunning() {
-    platform.cloud->store(flagKey, true);
-    platform.cloud->store(endKey, now() + 3600);
-    return makeIdle();
-  }
-  bool isOn(DebugManager& manager) { return manager.audioAccessoryLimitedLoggingEnabled(); }
-  void set(DebugManager& manager, bool enabled) { manager.setAudioAccessoryLimitedLoggingEnabled(enabled); }
+  bool isOn() { return manager->audioAccessoryLimitedLoggingEnabled(); }
+
+  std::shared_ptr<DebugManager> manager;
+  Calls lines;  // the manager's own, of the last run, but those that tell of changes
 };
 
 TEST_F(DebugManagerTest, StartAndStopTakeTheirStepsInOrder) {
-  const auto manager = makeIdle();
-  set(*manager, true);
+  start();
+  manager->setAudioAccessoryLimitedLoggingEnabled(true);
   EXPECT_THAT(effects(~0u), IsEmpty()) << "it is only queued";
-  run();
-  EXPECT_THAT(debugLines(), ElementsAre("default: Start audio accessory limited logging",
-                                        "info: Requesting default expiration interval"));
-  EXPECT_THAT(log(), testing::Contains("debugManager default: keyValueChanged source: root"));
   EXPECT_EQ(effectsAfterRun(), fresh);
-  EXPECT_TRUE(isOn(*manager));
-  set(*manager, true);
-  EXPECT_THAT(effectsAfterRun(), IsEmpty());
-  set(*manager, false);
-  run();
-  EXPECT_THAT(debugLines(), ElementsAre("default: Stop Audio Accessory Limited Logging"));
-  EXPECT_EQ(effectsAfterRun(), stopped);
-  EXPECT_FALSE(isOn(*manager));
-  set(*manager, false);
-  run();
-  EXPECT_THAT(effects(~0u), IsEmpty());
+  EXPECT_THAT(lines, ElementsAre("default: Start audio accessory limited logging",
+                                 "info: Requesting default expiration interval"));
+  EXPECT_TRUE(isOn());
+  EXPECT_EQ(effectsOf(true), nothing);
+  EXPECT_EQ(effectsOf(false), stopped);
+  EXPECT_THAT(lines, ElementsAre("default: Stop Audio Accessory Limited Logging"));
+  EXPECT_FALSE(isOn());
+  EXPECT_EQ(effectsOf(false), nothing);
+  EXPECT_THAT(lines, IsEmpty());
 }
 
 TEST_F(DebugManagerTest, AnOverrideGivesTheLengthOfANewPeriod) {
@@ -86,6 +76,7 @@ TEST_F(DebugManagerTest, AnOverrideGivesTheLengthOfANewPeriod) {
     std::optional<Value> interval;
     const char* text;
     double length;
+    bool alarm = true;
   } table[] = {
       {"absent", {}, "default", 345600},
       {"a minute", 60, "override 60.0", 60},
@@ -95,158 +86,117 @@ TEST_F(DebugManagerTest, AnOverrideGivesTheLengthOfANewPeriod) {
       {"negative", -60, "default", 345600},
       {"not a number", std::nan(""), "default", 345600},
       {"text", "60", "default", 345600},
+      {"past the last alarm", 1e16, "override 1e+16", 1e16, false},
+      {"infinite", infinity, "override inf", infinity, false},
   };
-  const auto manager = makeIdle();
+  start();
   for (const auto& row : table) {
     SCOPED_TRACE(row.name);
     platform.user->store(overrideKey, row.interval);
-    set(*manager, true);
-    run();
-    EXPECT_THAT(debugLines(),
-                testing::Contains("info: Requesting " + std::string(row.text) + " expiration interval"));
+    effectsOf(true);
+    EXPECT_EQ(lines.back(), "info: Requesting " + std::string(row.text) + " expiration interval");
     EXPECT_EQ(platform.cloud->value(endKey), Value(now() + row.length));
-    EXPECT_EQ(platform.streams.alarms.size(), 1u);
-    EXPECT_EQ(platform.streams.nextDue(), platform::Time(std::trunc(now() + row.length)));
-    set(*manager, false);
-    run();
-    mark();
+    const platform::Time due(std::trunc(now() + row.length));
+    EXPECT_EQ(platform.streams.nextDue(), row.alarm ? std::optional(due) : std::nullopt);
+    if (!row.alarm) platform.advance(platform::Time(1e9));
+    EXPECT_TRUE(isOn());
+    effectsOf(false);
   }
 }
 
-TEST_F(DebugManagerTest, AnEndWithoutAnAlarmDateGivesAPeriodWithoutAnAlarm) {
-  const auto manager = makeIdle();
-  for (double interval : {1e16, infinity}) {
-    platform.user->store(overrideKey, interval);
-    set(*manager, true);
-    run();
-    EXPECT_THAT(debugLines(), testing::Contains("info: Requesting override " + platform::describe(interval) +
-                                                " expiration interval"));
-    EXPECT_EQ(platform.cloud->value(endKey), Value(now() + interval));
-    EXPECT_THAT(effects(Effects::alarm), IsEmpty());
-    platform.advance(platform::Time(1e9));
-    EXPECT_TRUE(isOn(*manager));
-    set(*manager, false);
-    EXPECT_EQ(effectsAfterRun().back(), stopped.back());
-  }
-}
-
-// The clock stands at 1,000,000.
 TEST_F(DebugManagerTest, AStoredEndFoundAtStartIsKeptPassedOrTakenForNone) {
-  const Calls kept = steps("true", "1000100.75", "at 1000100000000000 ns"), nothing;
+  const Calls kept = steps("true", "1000100.75", "at 1000100000000000 ns");
   const struct {
     const char* name;
     std::optional<Value> flag, end;
     Calls effects;
-    bool on;
   } table[] = {
-      {"flag absent", {}, 1000100.75, nothing, false},
-      {"flag off", false, 1000100.75, nothing, false},
-      {"future", true, 1000100.75, kept, true},
-      {"absent", true, {}, fresh, true},
-      {"past", true, 999999.5, stopped, false},
-      {"this moment", true, 1000000, steps("true", "1000000.0", "at 1000000000000000 ns"), true},
-      {"zero", true, 0, fresh, true},
-      {"negative", true, -5, fresh, true},
-      {"not a number", true, std::nan(""), fresh, true},
-      {"infinite", true, infinity, fresh, true},
-      {"out of range", true, 9223372037.0, fresh, true},
-      {"text", true, "1000100", fresh, true},
+      {"flag absent", {}, 1000100.75, nothing},
+      {"flag off", false, 1000100.75, nothing},
+      {"future", true, 1000100.75, kept},
+      {"absent", true, {}, fresh},
+      {"past", true, 999999.5, stopped},
+      {"this moment", true, 1000000, steps("true", "1000000.0", "at 1000000000000000 ns")},
+      {"negative", true, -5, fresh},
+      {"not a number", true, std::nan(""), fresh},
+      {"infinite", true, infinity, fresh},
+      {"out of range", true, 9223372037.0, fresh},
+      {"text", true, "1000100", fresh},
   };
   for (const auto& row : table) {
     SCOPED_TRACE(row.name);
     DebugManagerTest device;
     device.platform.cloud->store(flagKey, row.flag);
     device.platform.cloud->store(endKey, row.end);
-    const auto manager = device.makeDebugManager();
+    device.manager = device.makeDebugManager();
     EXPECT_EQ(device.effectsAfterRun(), row.effects);
-    EXPECT_EQ(isOn(*manager), row.on);
+    EXPECT_EQ(device.isOn(), row.effects.size() > 1 && row.effects != stopped);
   }
 }
 
-TEST_F(DebugManagerTest, AnEndThatHasPassedTurnsTheFirstOnIntoAStop) {
-  const auto manager = makeIdle();
-  platform.cloud->store(endKey, now() - 1);
-  set(*manager, true);
-  EXPECT_EQ(effectsAfterRun(), stopped);
-  set(*manager, true);
-  EXPECT_EQ(effectsAfterRun(), fresh);
-}
-
 TEST_F(DebugManagerTest, TheFirstReadAfterTheEndStopsThePeriod) {
-  const auto manager = makeRunning();
+  startWithAPeriod();
   platform.manualClock.time += platform::Time(3600);
-  EXPECT_TRUE(isOn(*manager));
-  EXPECT_THAT(effectsAfterRun(), IsEmpty());
+  EXPECT_TRUE(isOn());
+  EXPECT_EQ(effectsAfterRun(), nothing);
   platform.manualClock.time += platform::Time(0.001);
-  EXPECT_FALSE(isOn(*manager));
+  EXPECT_FALSE(isOn());
   EXPECT_THAT(effects(~0u), ElementsAre("debugManager default: Audio accessory limited logging expired"));
   EXPECT_EQ(effectsAfterRun(), stopped);
   platform.cloud->store(endKey, now() - 1);
-  EXPECT_FALSE(isOn(*manager));
+  EXPECT_FALSE(isOn());
   EXPECT_THAT(effects(~0u), IsEmpty()) << "what is off does not expire";
+  EXPECT_EQ(effectsOf(true), stopped) << "an end that has passed turns the first switch into a stop";
+  EXPECT_EQ(effectsOf(true).front(), fresh.front());
 }
 
 TEST_F(DebugManagerTest, OnlyItsOwnAlarmEndsThePeriod) {
-  const auto manager = makeRunning();
+  startWithAPeriod();
   SystemNotificationManager::shared()->scheduleAlarm("velalogcloudcollectionenabled", now() + 60);
   mark();
   platform.advance(platform::Time(3599));
-  EXPECT_TRUE(isOn(*manager));
-  EXPECT_THAT(debugLines(), IsEmpty());
-  EXPECT_THAT(effectsAfterRun(), IsEmpty());
+  EXPECT_EQ(effectsAfterRun(), nothing);
+  EXPECT_THAT(lines, IsEmpty());
+  EXPECT_TRUE(isOn());
   platform.advance(platform::Time(1));
-  EXPECT_THAT(
-      debugLines(),
-      ElementsAre("default: didReceieve notification from source: alarm, name: VelaLogCloudCollectionEnabled",
-                  "default: Stop Audio Accessory Limited Logging"));
   EXPECT_EQ(effectsAfterRun(), stopped);
+  EXPECT_THAT(lines, ElementsAre("default: didReceieve notification from source: alarm, name: " +
+                                     std::string(flagKey),
+                                 "default: Stop Audio Accessory Limited Logging"));
   EXPECT_TRUE(platform.streams.alarms.empty());
 }
 
 TEST_F(DebugManagerTest, AnyChangeLeadsToTheCloudFlag) {
-  const auto manager = makeRunning();
-  const std::function<void()> changes[] = {
-      [&] { platform.named.postFromElsewhere("com.kestrel.bluetooth.prefsChanged"); },
-      [&] { platform.user->changeFromElsewhere(overrideKey, 1); },
-      [&] {
-        platform.cloud->changeFromElsewhere({{"other", 1}});
-      },
-  };
+  startWithAPeriod();
   bool flag = true;
-  for (const auto& change : changes) {
+  for (const auto change : {&World::changeRoot, &World::changeUser, &World::changeCloud}) {
     flag = !flag;
     platform.cloud->store(flagKey, flag);
-    change();
+    (this->*change)();
     run();
-    EXPECT_EQ(isOn(*manager), flag);
+    EXPECT_EQ(isOn(), flag);
   }
   EXPECT_THAT(log(), testing::Contains("debugManager default: keyValueChanged source: user"));
 }
 
 TEST_F(DebugManagerTest, AFailedStoreHoldsUpNoStep) {
-  const auto manager = makeIdle();
+  start();
   platform.radix.failure = std::make_error_code(std::errc::io_error);
-  set(*manager, true);
-  run();
-  EXPECT_TRUE(isOn(*manager));
-  EXPECT_EQ(effects(Effects::post).back(), "post pairwell.settingsChanged");
-  set(*manager, false);
-  run();
+  EXPECT_EQ(effectsOf(true).back(), fresh.back());
+  EXPECT_TRUE(isOn());
+  effectsOf(false);
   platform.cloud->failing = true;
-  mark();
-  set(*manager, true);
-  run();
-  EXPECT_FALSE(isOn(*manager)) << "the cloud still says off";
-  EXPECT_THAT(effects(Effects::alarm), ElementsAre("alarm at 1345600000000000 ns", "alarm cleared"));
+  EXPECT_THAT(effectsOf(true), testing::IsSupersetOf({"alarm at 1345600000000000 ns", "alarm cleared"}));
+  EXPECT_FALSE(isOn()) << "the cloud still says off";
 }
 
 TEST_F(DebugManagerTest, ItsEndGivesBackTheSubscriptionAndLogsAnError) {
   for (const std::error_code result : {std::error_code(), std::make_error_code(std::errc::io_error)}) {
-    auto manager = DebugManager::create(makeManager());
+    manager = DebugManager::create(makeManager());
     // A handle that holds nobody, or the manager could not go.
-    manager->kvsSubscription.emplace(nullptr, [&](const auto&) {
+    manager->kvsSubscription.emplace(nullptr, [&](const auto&) -> platform::Result<void> {
       calls.push_back("given back");
-      return platform::Result<void>(result);
+      return result;
     });
     manager.reset();
     run();

@@ -38,17 +38,6 @@ class ConduitListenerTest : public World {
     platform.cutSubscriptions.push_back([queue = listener->serialQueue] { on(queue, [] {}); });
     mark();
   }
-  using Client = std::shared_ptr<fakes::FakeClientConnection>;
-  Client offer(std::int32_t process, platform::Dictionary entitlements, fakes::FakeServiceListener& to) {
-    auto made =
-        std::make_shared<fakes::FakeClientConnection>(platform.effects, process, std::move(entitlements));
-    to.offer(made);
-    run();
-    return made;
-  }
-  Client offer(std::int32_t process, platform::Dictionary entitlements = {{systemKey, true}}) {
-    return offer(process, std::move(entitlements), *platform.listeners[0]);
-  }
   std::vector<std::int32_t> connected() {
     std::vector<std::int32_t> processes;
     on(listener->serialQueue, [&] {
@@ -59,45 +48,41 @@ class ConduitListenerTest : public World {
     });
     return processes;
   }
-  auto completion() {
-    return [this](platform::OptionalError error) { calls.push_back(error ? "error" : "done"); };
+  void record(const std::string& answer, platform::OptionalError error) {
+    platform.effects.record(Effects::client, error ? "error" : answer);
   }
-  // Of an operation with a result.
+  auto done() {
+    return [this](auto error) { record("done", error); };
+  }
   auto answer() {
-    return [this](auto result, platform::OptionalError error) {
-      calls.push_back(error ? "error" : std::to_string(result));
-    };
+    return [this](auto result, auto error) { record(std::to_string(result), error); };
   }
-  // What the operation did on the way to its answer, which comes last. None of it before the pool's turn.
+  // What the operation did, its answer last; none of it before the pool's turn.
   template <class Operation>
   Calls outcome(Operation operation) {
     mark();
-    calls.clear();
     operation(*client->exportedObject);
     EXPECT_THAT(effects(~0u), IsEmpty());
-    EXPECT_THAT(calls, IsEmpty());
     run();
-    Calls all = effects(Effects::log | Effects::client);
-    all.insert(all.end(), calls.begin(), calls.end());
-    return all;
+    return effects(Effects::log | Effects::client);
   }
   using Interface = platform::RadixUserControllerInterface;
   Calls statusRead() {
     return outcome([this](Interface& object) { object.getDistributedLoggingStatus(answer()); });
   }
   Calls statusWrite(std::uint32_t status) {
-    return outcome([&](Interface& object) { object.setDistributedLoggingStatus(status, completion()); });
+    return outcome([&](Interface& object) { object.setDistributedLoggingStatus(status, done()); });
   }
   Calls switchRead() {
     return outcome([this](Interface& object) { object.kestrelAudioAccessoryLimitedLogging(answer()); });
   }
   Calls switchWrite(bool enabled) {
     return outcome(
-        [&](Interface& object) { object.setKestrelAudioAccessoryLimitedLogging(enabled, completion()); });
+        [&](Interface& object) { object.setKestrelAudioAccessoryLimitedLogging(enabled, done()); });
   }
 
   std::shared_ptr<ConduitListener> listener = ConduitListener::create();
-  Client client;
+  std::shared_ptr<fakes::FakeClientConnection> client;
 };
 
 TEST_F(ConduitListenerTest, OnlyTheBooleanTrueOfEitherEntitlementAdmits) {
@@ -122,7 +107,7 @@ TEST_F(ConduitListenerTest, OnlyTheBooleanTrueOfEitherEntitlementAdmits) {
     for (const auto& row : table) {
       SCOPED_TRACE(row.name);
       mark();
-      const auto offered = offer(7, row.entitlements);
+      const auto offered = offerClient(7, row.entitlements);
       EXPECT_EQ(offered->admitted, row.admitted);
       EXPECT_EQ(offered->lookedUp.size(), row.lookUps);
       EXPECT_EQ(log(), Calls{row.admitted ? "conduit default: Conduit connection started: 7" : denial});
@@ -132,13 +117,13 @@ TEST_F(ConduitListenerTest, OnlyTheBooleanTrueOfEitherEntitlementAdmits) {
 }
 
 TEST_F(ConduitListenerTest, AnAdmittedClientIsSetUpBeforeItIsResumed) {
-  client = offer(7);
+  client = offerClient(7);
   EXPECT_THAT(effects(~0u),
               ElementsAre("exported interface", "exported object", "invalidation handler", "remote interface",
                           "resumed", "conduit default: Conduit connection started: 7"));
   EXPECT_EQ(client->exportedInterface, platform::RadixUserControllerConduitInterface());
   EXPECT_EQ(client->remoteInterface, client->exportedInterface);
-  const auto second = offer(7);
+  const auto second = offerClient(7);
   EXPECT_NE(second->exportedObject, client->exportedObject);
 }
 
@@ -147,15 +132,15 @@ TEST_F(ConduitListenerTest, AForeignListenerIsRefusedAfterTheEntitlement) {
   other->setDelegate(listener);
   other->setQueue(listener->serialQueue);
   other->resume();
-  EXPECT_FALSE(*offer(7, {{systemKey, true}}, *other)->admitted);
-  EXPECT_FALSE(*offer(8, {}, *other)->admitted);
+  EXPECT_FALSE(*offerClient(7, {{systemKey, true}}, other.get())->admitted);
+  EXPECT_FALSE(*offerClient(8, {}, other.get())->admitted);
   EXPECT_THAT(log(), ElementsAre("conduit error: Conduit connection denied bad listener, 7",
                                  "conduit error: Conduit connection denied, 8"));
   EXPECT_THAT(connected(), IsEmpty());
 }
 
 TEST_F(ConduitListenerTest, ConnectionsStayInOrderUntilTheyEnd) {
-  const auto first = offer(1), second = offer(2), third = offer(3);
+  const auto first = offerClient(1), second = offerClient(2), third = offerClient(3);
   EXPECT_THAT(connected(), ElementsAre(1, 2, 3));
   const std::weak_ptr<Interface> weak = second->exportedObject;
   second->end();
@@ -171,7 +156,7 @@ TEST_F(ConduitListenerTest, ConnectionsStayInOrderUntilTheyEnd) {
 }
 
 TEST_F(ConduitListenerTest, AListenerThatHasGoneIsMissedByNobody) {
-  const auto last = offer(1);
+  const auto last = offerClient(1);
   const std::weak_ptr<ConduitListener> weak = listener;
   listener.reset();
   EXPECT_FALSE(weak.expired()) << "its client still needs it";
@@ -180,7 +165,7 @@ TEST_F(ConduitListenerTest, AListenerThatHasGoneIsMissedByNobody) {
   run();
   EXPECT_TRUE(weak.expired());
   mark();
-  EXPECT_FALSE(*offer(2)->admitted);
+  EXPECT_FALSE(*offerClient(2)->admitted);
   auto unused = ConduitListener::create();
   unused->activate();
   unused->invalidate();
@@ -190,12 +175,11 @@ TEST_F(ConduitListenerTest, AListenerThatHasGoneIsMissedByNobody) {
 }
 
 TEST_F(ConduitListenerTest, OperationsReachTheDebugManagerOfTheMoment) {
-  client = offer(7);
-  const auto line = [](std::string text) { return "conduit default: " + text; };
-  const std::string status = line("Distributed logging status: "),
-                    changed = line("Distributed logging status changed: ");
-  const std::string limited = line("Kestrel audio accessory limited logging enabled: "),
-                    enable = line("Enable Kestrel audio accessory limited logging: ");
+  client = offerClient(7);
+  const std::string channel = "conduit default: ", status = channel + "Distributed logging status: ",
+                    changed = channel + "Distributed logging status changed: ",
+                    limited = channel + "Kestrel audio accessory limited logging enabled: ",
+                    enable = channel + "Enable Kestrel audio accessory limited logging: ";
   EXPECT_THAT(statusRead(), ElementsAre(status + "0", "0"));
   EXPECT_THAT(statusWrite(3), ElementsAre(changed + "3", "done"));
   EXPECT_THAT(switchRead(), ElementsAre("0"));
@@ -224,24 +208,24 @@ TEST_F(ConduitListenerTest, OperationsReachTheDebugManagerOfTheMoment) {
 TEST_F(ConduitListenerTest, AnAcceptedCallCompletesThoughItsClientHasGone) {
   listener->debugManager = makeDebugManager();
   run();
-  client = offer(7);
-  client->exportedObject->setDistributedLoggingStatus(1, completion());
+  client = offerClient(7);
+  client->exportedObject->setDistributedLoggingStatus(1, done());
   client->exportedObject->getDistributedLoggingStatus(answer());
   const std::weak_ptr<Interface> weak = client->exportedObject;
   platform.listeners[0]->clients.clear();
   client->end();
   client.reset();
-  EXPECT_THAT(calls, IsEmpty());
+  mark();
   run();
-  EXPECT_THAT(calls, ElementsAre("done", "1"));
+  EXPECT_THAT(effects(Effects::client), ElementsAre("done", "1"));
   EXPECT_TRUE(weak.expired());
   EXPECT_EQ(platform.cloud->value(flagKey), Value(true));
 }
 
 TEST(RadixDistributedDebugLoggingTest, OnlyBitZeroHasAName) {
   using Set = RadixDistributedDebugLogging;
-  const char* texts[] = {"", "Kestrel Audio Accessory", "", "Kestrel Audio Accessory"};
-  for (std::uint32_t raw = 0; raw < 4; ++raw) EXPECT_EQ(Set(raw).description(), texts[raw]);
+  for (const Set set : {Set(0), Set(2)}) EXPECT_EQ(set.description(), "");
+  for (const Set set : {Set(1), Set(3)}) EXPECT_EQ(set.description(), "Kestrel Audio Accessory");
   EXPECT_EQ(Set{}.rawValue, 0u);
   EXPECT_EQ((Set{Set::audioAccessory, Set::audioAccessory}).rawValue, 1u);
   EXPECT_EQ((Set{Set::audioAccessory, Set(6)}).rawValue, 7u);

@@ -1,6 +1,5 @@
 // Reads, writes and change notices of the three sources, through manager and observer.
 #include "pairwelld/settings/CloudStoreHandle.hpp"
-#include "pairwelld/settings/KeyValueStoreCustomObserver.hpp"
 #include "tests/pairwelld/World.hpp"
 
 namespace pairwell {
@@ -12,30 +11,24 @@ using platform::List;
 
 constexpr auto cloud = KeyValueSource::cloud, root = KeyValueSource::root, user = KeyValueSource::user;
 constexpr auto flag = Defaults::velaLogCloudCollectionEnabled;
-constexpr auto end = Defaults::velaLogCloudCollectionEnabledExpiration;
-constexpr const char* pairwellPost = "post pairwell.prefsChanged";
+constexpr const char *rootChanged = "post bluetooth.prefsChanged", *cloudChanged = "post cloud.storeChanged",
+                     *changed = "post pairwell.prefsChanged";
 
 class KeyValueStoreManagerTest : public World {
- protected:
+ public:
+  // With one subscriber, "1".
   std::shared_ptr<KeyValueStoreManager> makeActive() {
-    auto kvs = makeManager();
+    const auto kvs = makeManager();
+    kvs->subscribe(makeSubscriber("1"));
     kvs->activate();
     mark();
     return kvs;
   }
-  void store(KeyValueSource source, const std::optional<Value>& value) {
+  void store(const std::optional<Value>& value) {
+    platform.cloud->store(flagKey, value);
+    platform.user->store(flagKey, value);
     platform.radix.contents.clear();
-    if (source == root && value) platform.radix.contents.emplace(flagKey, *value);
-    if (source == cloud) platform.cloud->store(flagKey, value);
-    if (source == user) platform.user->store(flagKey, value);
-  }
-  std::shared_ptr<KeyValueStoreCustomObserver> makeObserver() {
-    return KeyValueStoreCustomObserver::create(
-        {flagKey, "b"}, [this](KeyValueSource source, const std::vector<std::string>& keys) {
-          std::string call(platform::rawValue(source));
-          for (const auto& key : keys) call += " " + Effects::shortKey(key);
-          calls.push_back(call);
-        });
+    if (value) platform.radix.contents.emplace(flagKey, *value);
   }
   Calls callsAfterRun() {
     calls.clear();
@@ -54,9 +47,9 @@ TEST_F(KeyValueStoreManagerTest, ReadsAnswerWhatConvertsOrNothing) {
   } table[] = {{"absent", {}, false, 0},       {"true", true, true, 1}, {"fraction", 1.5, false, 1.5},
                {"whole number", 1, true, 1.0}, {"text", "1", false, 0}, {"list", List{1}, false, 0}};
   for (const auto& row : table) {
+    store(row.stored);
     for (KeyValueSource source : {cloud, root, user}) {
       SCOPED_TRACE(std::string(row.name) + " in " + std::string(platform::rawValue(source)));
-      store(source, row.stored);
       EXPECT_EQ(kvs->getBool(source, flag), row.asBool);
       EXPECT_EQ(kvs->getDouble(source, flag), row.asDouble);
     }
@@ -64,52 +57,46 @@ TEST_F(KeyValueStoreManagerTest, ReadsAnswerWhatConvertsOrNothing) {
   EXPECT_THAT(log(), IsEmpty());
   platform.radix.failure = std::make_error_code(std::errc::io_error);
   EXPECT_FALSE(kvs->getBool(root, flag));
-  EXPECT_EQ(kvs->getDouble(root, end), 0);
+  EXPECT_EQ(kvs->getDouble(root, flag), 0);
+  const std::string cause = " for key: " + std::string(flagKey) + " due to: Input/output error";
   EXPECT_THAT(
-      log(),
-      ElementsAre(
-          "kvs error: Unable to get bool for key: VelaLogCloudCollectionEnabled due to: Input/output error",
-          "kvs error: Unable to get double for key: VelaLogCloudCollectionEnabledExpiration due to: "
-          "Input/output error"));
+      log(), ElementsAre("kvs error: Unable to get bool" + cause, "kvs error: Unable to get double" + cause));
 }
 
 TEST_F(KeyValueStoreManagerTest, WritesHaveTheirEffectsInOrder) {
   const auto kvs = makeActive();
-  const auto updated = [](std::string rest) {
-    return "kvs default: Cloud Update Key Value VelaLogCloudCollectionEnabled: " + rest;
-  };
+  const std::string updated = "kvs default: Cloud Update Key Value VelaLogCloudCollectionEnabled: ";
   const auto effectsOf = [&](const std::vector<KeyValueSource>& sources, const std::optional<Value>& value) {
     mark();
     kvs->setValue(sources, value, flag);
     return effects(~0u);
   };
   EXPECT_THAT(effectsOf({root, cloud}, true),
-              ElementsAre("root flag=true", "post bluetooth.prefsChanged", "cloud flag=true",
-                          updated("true, Synced: true"), "post cloud.storeChanged", pairwellPost));
-  EXPECT_THAT(
-      effectsOf({cloud, user, root}, std::nullopt),
-      ElementsAre("cloud flag=nil", updated("nil, Synced: true"), "post cloud.storeChanged", pairwellPost,
-                  "user flag=nil", pairwellPost, "root flag=null", "post bluetooth.prefsChanged"));
+              ElementsAre("root flag=true", rootChanged, "cloud flag=true", updated + "true, Synced: true",
+                          cloudChanged, changed));
+  EXPECT_THAT(effectsOf({cloud, user, root}, std::nullopt),
+              ElementsAre("cloud flag=nil", updated + "nil, Synced: true", cloudChanged, changed,
+                          "user flag=nil", changed, "root flag=null", rootChanged));
   EXPECT_TRUE(platform.cloud->contents.empty() && platform.radix.contents.empty());
-  platform.radix.failure = std::make_error_code(std::errc::no_space_on_device);
+  platform.radix.failure = std::make_error_code(std::errc::io_error);
   platform.cloud->failing = true;
-  EXPECT_THAT(effectsOf({root, cloud}, false),
-              ElementsAre("root flag=false failed",
-                          "kvs error: Unable to get value for key: VelaLogCloudCollectionEnabled due to: No "
-                          "space left on device",
-                          "cloud flag=false failed", updated("false, Synced: false"),
-                          "post cloud.storeChanged", pairwellPost));
+  EXPECT_THAT(
+      effectsOf({root, cloud}, false),
+      ElementsAre(
+          "root flag=false failed",
+          "kvs error: Unable to get value for key: " + std::string(flagKey) + " due to: Input/output error",
+          "cloud flag=false failed", updated + "false, Synced: false", cloudChanged, changed));
 }
 
 TEST_F(KeyValueStoreManagerTest, EachChangedKeyReachesEverySubscriberInTurn) {
   const auto kvs = makeManager();
-  const auto first = makeSubscriber("1"), second = makeSubscriber("2"), late = makeSubscriber("3");
-  const auto handle = kvs->subscribe(first), other = kvs->subscribe(second);
+  const auto first = makeSubscriber("1"), late = makeSubscriber("3");
+  const auto handle = kvs->subscribe(first), other = kvs->subscribe(makeSubscriber("2"));
   first->onCall = [&] { EXPECT_TRUE(kvs->serialQueue->isCurrent()); };
   kvs->handleStoreChange(user, {flagKey, "b"});
   EXPECT_THAT(calls, IsEmpty());
   EXPECT_THAT(callsAfterRun(), ElementsAre("1 user flag", "2 user flag", "1 user b", "2 user b"));
-  EXPECT_THAT(effects(Effects::post), ElementsAre(pairwellPost));
+  EXPECT_THAT(effects(Effects::post), ElementsAre(changed));
   mark();
   // Who joins or leaves during a delivery does so for the next one.
   first->onCall = [&] {
@@ -127,37 +114,35 @@ TEST_F(KeyValueStoreManagerTest, EachChangedKeyReachesEverySubscriberInTurn) {
 
 TEST_F(KeyValueStoreManagerTest, ChangesMadeElsewhereArrive) {
   const auto kvs = makeActive();
-  kvs->subscribe(makeSubscriber("1"));
-  platform.user->changeFromElsewhere(flagKey, true);
-  platform.user->changeFromElsewhere("unknown", true);
-  EXPECT_THAT(callsAfterRun(), ElementsAre("1 user flag"));
-  platform.cloud->changeFromElsewhere({{flagKey, true}, {"unknown", 1}});
-  EXPECT_THAT(callsAfterRun(), ElementsAre("1 cloud flag", "1 cloud unknown"));
-  platform.named.postFromElsewhere("com.kestrel.bluetooth.prefsChanged");
+  for (const char* key : {flagKey, "unknown", endKey, overrideKey})
+    platform.user->changeFromElsewhere(key, true);
+  EXPECT_THAT(callsAfterRun(), ElementsAre("1 user flag", "1 user end", "1 user override"));
+  changeRoot();
   EXPECT_THAT(callsAfterRun(), ElementsAre("1 root -"));
-  EXPECT_EQ(log().back(), "kvs default: Root KVS Notification");
+  EXPECT_THAT(log(), ElementsAre("kvs default: Root KVS Notification"));
+  const auto observer = kvs->keyValueStoreObserver();
+  observer->observeValue(std::nullopt, platform.user.get());
+  observer->observeValue("b", platform.cloud.get());
+  EXPECT_THAT(callsAfterRun(), ElementsAre("1 user b"));
 }
 
 TEST_F(KeyValueStoreManagerTest, OutsideCloudChangesCountByReasonAndKeys) {
-  const auto observer = makeObserver();
-  observer->start();
+  const auto kvs = makeActive();
   const auto change = [](Value reason, Value keys) {
-    return Dictionary{{std::string(CloudStore::changeReasonKey), std::move(reason)},
-                      {std::string(CloudStore::changedKeysKey), std::move(keys)}};
+    return Dictionary{{"ChangeReason", std::move(reason)}, {"ChangedKeys", std::move(keys)}};
   };
   const struct {
     const char* name;
     std::optional<Dictionary> userInfo;
     Calls calls;
   } table[] = {
-      {"server", change(0, List{flagKey, "c"}), {"cloud flag c"}},
-      {"first download", change(1, List{"c"}), {"cloud c"}},
+      {"server", change(0, List{flagKey, "c"}), {"1 cloud flag", "1 cloud c"}},
+      {"first download", change(1, List{"c"}), {"1 cloud c"}},
       {"quota", change(2, List{"c"}), {}},
-      {"account", change(3, List{}), {"cloud"}},
+      {"account", change(3, List{}), {"1 cloud -"}},
       {"unknown", change(4, List{"c"}), {}},
       {"negative", change(-1, List{"c"}), {}},
       {"reason that is no number", change("0", List{"c"}), {}},
-      {"keys that are no list", change(0, "c"), {}},
       {"keys that are no texts", change(0, List{"c", 1}), {}},
       {"empty", Dictionary{}, {}},
       {"no user information", {}, {}},
@@ -170,49 +155,33 @@ TEST_F(KeyValueStoreManagerTest, OutsideCloudChangesCountByReasonAndKeys) {
     const std::string prefix = "kvs default: Cloud KVS Notification: ";
     EXPECT_EQ(log(), row.userInfo ? Calls{prefix + platform::describe(*row.userInfo)} : Calls{});
   }
-  calls.clear();
-  platform.centre.post(CloudStore::externalChangeNotification, &platform, change(0, List{"c"}));
-  EXPECT_THAT(calls, IsEmpty());
-  for (const auto& userInfo : {std::optional<Dictionary>(), std::optional(Dictionary{{"ChangedKeys", 1}})}) {
-    platform.centre.post(cloudStoreChangedNotification, &platform, userInfo);
-  }
-  observer->observeValue(std::nullopt, platform.user.get());
-  observer->observeValue("b", platform.cloud.get());
-  EXPECT_THAT(calls, ElementsAre("cloud", "cloud", "user b"));
+  platform.centre.post(CloudStore::externalChangeNotification, &platform, table[0].userInfo);
+  EXPECT_THAT(callsAfterRun(), IsEmpty()) << "another store's";
+  platform.centre.post(cloudStoreChangedNotification, &platform, std::nullopt);
+  platform.centre.post(cloudStoreChangedNotification, nullptr, change(0, "c"));
+  EXPECT_THAT(callsAfterRun(), ElementsAre("1 cloud -", "1 cloud -"));
 }
 
 TEST_F(KeyValueStoreManagerTest, TheObserverStopsWheneverItIsTold) {
-  auto observer = makeObserver();
-  observer->stop();
-  EXPECT_THAT(platform.named.cancelled, ElementsAre(-1));
-  observer->start();
-  EXPECT_EQ(observer->rootPrefsChangeToken, 1);
-  EXPECT_EQ(platform.user->observers.size() + platform.cloud->observers.size(), 4u);
-  platform.named.postFromElsewhere(
-      "com.kestrel.bluetooth.prefsChanged");  // on its way when the observer goes
+  auto kvs = KeyValueStoreManager::create();
+  const auto handle = kvs->subscribe(makeSubscriber("1"));
+  kvs->keyValueStoreObserver()->stop();
+  kvs->activate();
+  EXPECT_EQ(kvs->keyValueStoreObserver()->rootPrefsChangeToken, 1);
+  EXPECT_EQ(platform.user->observers.size() + platform.cloud->observers.size(), 6u);
+  kvs->setValue({root, cloud, user}, true, flag);
   platform.user->changeFromElsewhere(flagKey, true);
   platform.cloud->changeFromElsewhere({{flagKey, true}});
-  observer->stop();
-  EXPECT_EQ(platform.user->observers.size() + platform.cloud->observers.size(), 0u);
-  observer.reset();
-  EXPECT_THAT(platform.named.cancelled, ElementsAre(-1, 1, 1));
   mark();
-  EXPECT_THAT(callsAfterRun(), IsEmpty());
-  EXPECT_THAT(log(), ElementsAre("kvs default: Root KVS Notification"));
-}
-
-TEST_F(KeyValueStoreManagerTest, AManagerEndsAnObserverThatItNeverNeeded) {
-  KeyValueStoreManager::create().reset();
-  EXPECT_THAT(platform.named.cancelled, ElementsAre(-1, -1));
-  auto kvs = KeyValueStoreManager::create();
-  kvs->activate();
-  const auto subscriber = makeSubscriber("1");
-  const auto handle = kvs->subscribe(subscriber);
-  kvs->setValue({root, cloud, user}, true, flag);
-  kvs.reset();
+  kvs.reset();  // while all these are on their way
+  EXPECT_EQ(platform.user->observers.size() + platform.cloud->observers.size(), 0u);
+  EXPECT_THAT(platform.named.cancelled, ElementsAre(-1, 1, 1));
   handle.unsubscribe([&](const auto& error) { calls.push_back(error ? "error" : "done"); });
-  run();
-  EXPECT_THAT(calls, ElementsAre("done"));
+  EXPECT_THAT(callsAfterRun(), ElementsAre("done"));
+  EXPECT_THAT(log(), ElementsAre("kvs default: Root KVS Notification"));
+  KeyValueStoreManager::create().reset();
+  EXPECT_THAT(platform.named.cancelled, ElementsAre(-1, 1, 1, -1, -1))
+      << "it ends the observer that it never needed";
 }
 
 }  // namespace

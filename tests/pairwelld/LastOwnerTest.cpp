@@ -1,0 +1,178 @@
+// The last owner of an object goes inside a delivery to it, on each thread and queue where that can happen.
+#include "pairwelld/TarnNotificationHelper.hpp"
+#include "pairwelld/notifications/TarnNotificationManager.hpp"
+#include "pairwelld/service/ConduitConnection.hpp"
+#include "pairwelld/service/ConduitListener.hpp"
+#include "pairwelld/settings/CloudStoreHandle.hpp"
+#include "tests/pairwelld/World.hpp"
+
+namespace pairwell {
+namespace {
+
+class LastOwnerTest : public World {
+ public:
+  using Device = LastOwnerTest;
+  struct Row {
+    const char* name;
+    std::function<void(Device&)> deliver;
+    // The effect at which the owner goes, in the midst of what makes it.
+    std::string at;
+  };
+  // Each row on a device of its own.
+  static void check(const std::function<void(Device&)>& make, const std::vector<Row>& rows) {
+    for (const Row& row : rows) {
+      SCOPED_TRACE(row.name);
+      Device device;
+      make(device);
+      device.run();
+      device.mark();
+      device.platform.effects.onMoment = [&] {
+        const Calls all = device.effects(~0u);
+        if (!all.empty() && all.back().find(row.at) != std::string::npos) device.drop();
+      };
+      row.deliver(device);
+      device.run();
+      EXPECT_TRUE(device.watched.expired());
+      EXPECT_THAT(device.calls, ElementsAre("dropped"));
+    }
+  }
+  // `release` lets go of every reference but those of a delivery under way.
+  void keep(std::weak_ptr<void> object, std::function<void()> release_) {
+    watched = std::move(object);
+    release = std::move(release_);
+  }
+  void drop() {
+    if (!release) return;
+    calls.push_back("dropped");
+    std::exchange(release, nullptr)();
+  }
+  // Its one call may be the moment at which the owner goes; a later one would wipe out the record of that.
+  std::shared_ptr<Subscriber> makeCaller() {
+    const auto subscriber = makeSubscriber("");
+    subscriber->onCall = [this] {
+      calls.clear();
+      effect();
+    };
+    return subscriber;
+  }
+  void effect() { platform.effects.record(Effects::client, "called"); }
+
+  void switchOn() { platform.cloud->changeFromElsewhere({{flagKey, true}}); }
+  void writeUser() {
+    platform.pool->async([this] { platform.user->setValue(60, overrideKey); });
+  }
+  void writeCloud() {
+    platform.pool->async([this] { platform.centre.post(cloudStoreChangedNotification, nullptr, {}); });
+  }
+  void fireAlarm() { platform.streams.deliver("com.kestrel.alarm", {{"Name", flagKey}}); }
+
+ private:
+  std::weak_ptr<void> watched;
+  std::function<void()> release;
+};
+
+TEST_F(LastOwnerTest, OfTheStoreManager) {
+  const auto make = [](Device& device) {
+    auto kvs = KeyValueStoreManager::create();
+    kvs->activate();
+    kvs->subscribe(device.makeCaller());
+    device.keep(kvs, [kvs]() mutable { kvs.reset(); });
+  };
+  check(make, {{"on its queue", &Device::changeUser, "called"},
+               {"on its queue, with more deliveries behind", &Device::changeCloud, "called"},
+               {"on the poster's thread, before the notice", &Device::changeCloud, "Cloud KVS Notification"},
+               {"on the poster's thread, in the notice", &Device::changeCloud, "post pairwell.prefsChanged"},
+               {"on the writer's thread", &Device::writeUser, "user override"},
+               {"on a global queue", &Device::changeRoot, "Root KVS Notification"}});
+}
+
+TEST_F(LastOwnerTest, OfTheObserver) {
+  const auto make = [](Device& device) {
+    auto observer = KeyValueStoreCustomObserver::create(
+        {overrideKey}, [&device](KeyValueSource, const auto&) { device.effect(); });
+    observer->start();
+    device.keep(observer, [observer]() mutable { observer.reset(); });
+  };
+  check(make, {{"on the delivery thread", &Device::changeUser, "called"},
+               {"on the thread of an outside change", &Device::changeCloud, "called"},
+               {"on the writer's thread", &Device::writeUser, "called"},
+               {"on the poster's thread", &Device::writeCloud, "called"},
+               {"on a global queue", &Device::changeRoot, "called"},
+               {"on a global queue, before it is looked for", &Device::changeRoot, "Root KVS"}});
+}
+
+TEST_F(LastOwnerTest, OfTheDebugManager) {
+  const auto make = [](Device& device) {
+    const auto kvs = device.makeManager();
+    kvs->activate();
+    auto manager = DebugManager::create(kvs);
+    manager->activate();
+    device.keep(manager, [manager]() mutable {
+      dropSubscriptions(*manager->kvs);
+      letGo(*manager);
+      manager.reset();
+    });
+  };
+  check(make, {{"on main", &Device::fireAlarm, "didReceieve notification"},
+               {"on the store manager's queue", &Device::changeUser, "keyValueChanged source"},
+               {"on its queue, at its first step", &Device::switchOn, "Start audio"},
+               {"on its queue, inside a write", &Device::switchOn, "post cloud.storeChanged"},
+               {"on its queue, at its last step", &Device::switchOn, "post pairwell.settingsChanged"}});
+}
+
+TEST_F(LastOwnerTest, OfASubscriber) {
+  const auto make = [](Device& device) {
+    const auto kvs = device.makeManager();
+    kvs->activate();
+    const auto subscriber = device.makeCaller();
+    const auto changes = kvs->subscribe(subscriber);
+    const auto alarms = SystemNotificationManager::shared()->subscribe(subscriber);
+    device.keep(subscriber, [changes, alarms] {
+      changes.unsubscribe([](const auto&) {});
+      alarms.unsubscribe([](const auto&) {});
+    });
+  };
+  check(make, {{"on main", &Device::fireAlarm, "called"},
+               {"on the store manager's queue", &Device::changeUser, "called"}});
+}
+
+TEST_F(LastOwnerTest, OfAHelper) {
+  const auto make = [](Device& device) {
+    TarnNotificationManager::shared()->setUp();
+    const std::weak_ptr helper = TarnNotificationHelper::create({{"a", [&device] { device.effect(); }}});
+    device.keep(helper, [helper] { TarnNotificationManager::shared()->unregisterHelper(*helper.lock()); });
+  };
+  const auto post = [](Device& device) { device.platform.named.postFromElsewhere("a"); };
+  const auto match = [](Device& device) {
+    device.platform.streams.deliver("com.kestrel.tidingsd.matching", {{"Name", "a"}});
+  };
+  check(make, {{"on main, from the centre", post, "Got tarn notification"},
+               {"in its callback, from the centre", post, "called"},
+               {"in its callback, from the stream", match, "called"}});
+}
+
+TEST_F(LastOwnerTest, OfAConnectionAndItsListener) {
+  const auto make = [](Device& device) {
+    auto listener = ConduitListener::create();
+    listener->activate();
+    device.run();
+    const auto client = device.offerClient(7);
+    // The connection holds its listener, so both go.
+    device.keep(listener, [&device, listener, client]() mutable {
+      device.platform.listeners[0]->clients.clear();
+      listener.reset();
+      client->end();
+    });
+  };
+  const auto object = [](Device& device) { return device.platform.listeners[0]->clients[0]->exportedObject; };
+  const auto read = [&](Device& device) { object(device)->getDistributedLoggingStatus([](auto, auto) {}); };
+  const auto write = [&](Device& device) {
+    object(device)->setDistributedLoggingStatus(1, [&device](auto) { device.effect(); });
+  };
+  check(make, {{"on a worker", read, "logging status"},
+               {"on a worker, in the answer", write, "called"},
+               {"on the listener's queue", [](Device& device) { device.offerClient(8, {}); }, "denied, 8"}});
+}
+
+}  // namespace
+}  // namespace pairwell
