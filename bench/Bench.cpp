@@ -12,6 +12,7 @@
 
 #include "bench/Device.hpp"
 #include "bench/Peers.hpp"
+#include "platform/linux/BusServiceListener.hpp"
 #include "platform/linux/HearthInterface.hpp"
 #include "platform/linux/Json.hpp"
 
@@ -50,6 +51,11 @@ void report(const char* what, double figure, const char* unit) {
   std::printf("%-46s %13.2f %s\n", what, figure, unit);
   std::fflush(stdout);
   results.emplace(what, Dictionary{{"value", figure}, {"unit", unit}});
+}
+
+const platform::linux_::BusInterface& clientInterface() {
+  static const auto interface = platform::linux_::clientInterface(serviceName);
+  return interface;
 }
 
 void mustAnswer(const platform::Result<platform::linux_::BusReply>& reply) {

@@ -12,26 +12,10 @@
 #include <stdexcept>
 #include <thread>
 
-#include "platform/RadixUserControllerInterface.hpp"
-
 namespace bench {
 
 namespace fs = std::filesystem;
 using platform::linux_::BusClient;
-using platform::linux_::BusInterface;
-
-const BusInterface& clientInterface() {
-  static const BusInterface interface = [] {
-    const auto description = platform::RadixUserControllerConduitInterface();
-    BusInterface result{"/com/kestrel/pairwell/conduit", std::string(description->name), {}, {}};
-    for (const auto& operation : description->operations) {
-      result.operations.push_back(
-          {std::string(operation.name), std::string(operation.arguments), std::string(operation.results)});
-    }
-    return result;
-  }();
-  return interface;
-}
 
 Device::Device(const std::string& programs, const std::string& benchmark) {
   char name[] = "/tmp/pairwell-bench-XXXXXX";

@@ -11,6 +11,8 @@
 
 namespace bench {
 
+inline constexpr const char* serviceName = "com.kestrel.pairwell.conduit";
+
 class Device {
  public:
   // `programs` is the folder of the built programs; they are copied into the root, so that their owner and
@@ -24,7 +26,7 @@ class Device {
   pid_t hearthd() const { return pid; }
   pid_t pairwelld() const;
   const platform::linux_::Paths& paths() const { return _paths; }
-  std::string clientSocket() const { return _paths.serviceSocket("com.kestrel.pairwell.conduit"); }
+  std::string clientSocket() const { return _paths.serviceSocket(serviceName); }
   // Connected and authenticated, trying until it is served.
   std::unique_ptr<platform::linux_::BusClient> client() const;
 
@@ -33,8 +35,5 @@ class Device {
   platform::linux_::Paths _paths;
   pid_t pid = -1;
 };
-
-// The client service as its users describe it.
-const platform::linux_::BusInterface& clientInterface();
 
 }  // namespace bench
