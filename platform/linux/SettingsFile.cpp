@@ -2,7 +2,6 @@
 
 #include <filesystem>
 #include <utility>
-#include <vector>
 
 #include "platform/LogSink.hpp"
 #include "platform/linux/SettingsDocument.hpp"
@@ -22,17 +21,15 @@ std::string parentOf(const std::string& path) {
   return parent.empty() ? "." : parent;
 }
 
-// With what a power cut would take of it: the entry of each new folder in its parent.
+// With its entry in each folder above, which a power cut would take otherwise; whether an earlier attempt or
+// another process made it, and was cut off, cannot be told.
 Result<void> makeFolderDurably(FileSystem& files, const std::string& folder) {
-  std::vector<std::string> parents;
-  for (std::string path = folder; path != parentOf(path); path = parentOf(path)) {
-    const auto there = files.identity(path);
-    if (there || !isMissing(there.error())) break;
-    parents.push_back(parentOf(path));
-  }
   if (const auto made = files.makeFolder(folder); !made) return made;
-  for (const std::string& parent : parents) {
-    if (const auto synced = files.syncFolder(parent); !synced) return synced;
+  for (std::string path = folder; path != parentOf(path); path = parentOf(path)) {
+    const auto synced = files.syncFolder(parentOf(path));
+    // What may not be opened was not made here, either; nor was anything above it.
+    if (!synced && synced.error() == std::errc::permission_denied) break;
+    if (!synced && synced.error() != std::errc::read_only_file_system) return synced;
   }
   return {};
 }
@@ -132,12 +129,12 @@ void SettingsFile::moveAside() {
   lastGoodInForce = true;
 }
 
+// A file that is there is proof that its folders are durable: they are made so before it is.
 Result<std::unique_ptr<FileLock>> SettingsFile::lockForWriting() {
-  const std::string name = path + ".lock";
-  auto lock = files.lock(name);
-  if (lock || !isMissing(lock.error())) return lock;
-  if (const auto made = makeFolderDurably(files, parentOf(path)); !made) return made.error();
-  return files.lock(name);
+  if (!files.identity(path)) {
+    if (const auto made = makeFolderDurably(files, parentOf(path)); !made) return made.error();
+  }
+  return files.lock(path + ".lock");
 }
 
 Result<void> SettingsFile::update(const std::function<bool(Dictionary& document)>& change) {
@@ -220,7 +217,7 @@ void SettingsFile::startWatching(WorkQueue& delivery_, Changed changed_) {
   delivery = &delivery_;
   changed = std::move(changed_);
   const std::string folder = parentOf(path);
-  const auto made = makeFolderDurably(files, folder);
+  const auto made = files.makeFolder(folder);
   auto begun = made ? files.watch(folder,
                                   [weak = weak_from_this()](const std::string&) {
                                     if (const auto self = weak.lock()) self->look();
