@@ -1,0 +1,216 @@
+// Files in memory. A power cut takes what was not synced: contents by the file's sync, names by their
+// folder's. Unlike a real disk it runs on the test's thread alone, its clock stands still, and it gives a
+// freed inode to the next file at once: so only an open file tells two of one size apart.
+#pragma once
+
+#include <cerrno>
+#include <functional>
+#include <limits>
+#include <map>
+#include <memory>
+#include <set>
+#include <string>
+#include <string_view>
+#include <system_error>
+#include <utility>
+#include <vector>
+
+#include "platform/linux/FileSystem.hpp"
+
+namespace fakes {
+
+class MemoryFileSystem : public platform::linux_::FileSystem {
+ public:
+  template <class T>
+  using Result = platform::Result<T>;
+  using File = platform::linux_::File;
+  using FileIdentity = platform::linux_::FileIdentity;
+  using FileLock = platform::linux_::FileLock;
+  using FolderWatch = platform::linux_::FolderWatch;
+  using Changed = std::function<void(const std::string&)>;
+
+  // Calls are counted; from the `failFrom`th on all fail with `failure`.
+  int calls = 0;
+  int failFrom = std::numeric_limits<int>::max();
+  int failure = EIO;
+  std::set<std::string> unreadable, immovable;  // paths that cannot be opened; or renamed
+
+  // Everything that was not synced is gone, and all works again. Objects of before belong to a dead process.
+  void powerCut() {
+    for (auto& [path, node] : durable) node->bytes = node->synced;
+    now = durable;
+    std::erase_if(now, [&](const auto& entry) { return !hasFolder(parentOf(entry.first)); });
+    durable = now;
+    locks.clear();
+    watches.clear();
+    pending.clear();
+    failFrom = std::numeric_limits<int>::max();
+  }
+  // The file has these bytes, durably, as a new file put in the old one's place.
+  void put(const std::string& path, std::string_view bytes) {
+    for (std::string folder = parentOf(path); !hasFolder(folder); folder = parentOf(folder)) {
+      now[folder] = durable[folder] = std::make_shared<Node>(inodes);
+    }
+    const auto node = std::make_shared<Node>(inodes);
+    node->bytes = node->synced = bytes;
+    now[path] = durable[path] = node;
+    happened(path);
+  }
+  std::string bytes(const std::string& path) const { return now.at(path)->bytes; }
+  bool exists(const std::string& path) const { return now.contains(path); }
+  // Events are held back until now.
+  void deliverEvents() {
+    for (const std::string& path : std::exchange(pending, {})) {
+      const auto current = watches;
+      for (const Watched& watch : current) {
+        if (!watch.token.expired() && watch.folder == parentOf(path))
+          watch.changed(path.substr(watch.folder.size() + 1));
+      }
+    }
+  }
+
+  Result<std::unique_ptr<File>> openToRead(const std::string& path) override {
+    if (const int error = unreadable.contains(path) ? EACCES : check(path)) return code(error);
+    return std::unique_ptr<File>(std::make_unique<OpenFile>(*this, path, now[path]));
+  }
+  Result<std::unique_ptr<File>> create(const std::string& path) override {
+    const int error = check(path);
+    if (error != ENOENT) return code(error != 0 ? error : EEXIST);
+    if (!hasFolder(parentOf(path))) return code(ENOENT);
+    now[path] = std::make_shared<Node>(inodes);
+    return std::unique_ptr<File>(std::make_unique<OpenFile>(*this, path, now[path]));
+  }
+  Result<FileIdentity> identity(const std::string& path) override {
+    if (const int error = check(path)) return code(error);
+    return now[path]->identity();
+  }
+  Result<void> rename(const std::string& from, const std::string& to) override {
+    if (const int error = immovable.contains(from) ? EPERM : check(from)) return code(error);
+    now[to] = now[from];
+    now.erase(from);
+    happened(to);
+    return {};
+  }
+  Result<void> remove(const std::string& path) override {
+    if (const int error = check(path)) return code(error);
+    now.erase(path);
+    happened(path);
+    return {};
+  }
+  Result<void> syncFolder(const std::string& path) override {
+    if (const int error = check(path)) return code(error);
+    const auto inFolder = [&](const auto& entry) { return parentOf(entry.first) == path; };
+    std::erase_if(durable, inFolder);
+    for (const auto& entry : now) {
+      if (inFolder(entry)) durable.insert(entry);
+    }
+    return {};
+  }
+  Result<void> makeFolder(const std::string& path) override {
+    if (const int error = check(path); error != ENOENT) return code(error);
+    for (std::string folder = path; !hasFolder(folder); folder = parentOf(folder)) {
+      now[folder] = std::make_shared<Node>(inodes);
+    }
+    return {};
+  }
+  Result<std::vector<std::string>> list(const std::string& folder) override {
+    if (const int error = check(folder)) return code(error);
+    std::vector<std::string> names;
+    for (const auto& [path, node] : now) {
+      if (parentOf(path) == folder) names.push_back(path.substr(folder.size() + 1));
+    }
+    return names;
+  }
+  // One that is held cannot be waited for on a single thread.
+  Result<std::unique_ptr<FileLock>> lock(const std::string& path) override {
+    const int error = check(path);
+    if (error != 0 && error != ENOENT) return code(error);
+    if (!hasFolder(parentOf(path))) return code(ENOENT);
+    if (!now.contains(path)) now[path] = std::make_shared<Node>(inodes);
+    if (!locks[path].expired()) return code(EDEADLK);
+    const auto token = std::make_shared<int>();
+    locks[path] = token;
+    return std::unique_ptr<FileLock>(std::make_unique<Held<FileLock>>(token));
+  }
+  Result<std::unique_ptr<FolderWatch>> watch(const std::string& folder, Changed changed) override {
+    if (const int error = check(folder)) return code(error);
+    const auto token = std::make_shared<int>();
+    watches.push_back({token, folder, std::move(changed)});
+    return std::unique_ptr<FolderWatch>(std::make_unique<Held<FolderWatch>>(token));
+  }
+
+ private:
+  struct Node {
+    explicit Node(std::shared_ptr<std::set<std::uint64_t>> used_) : used(std::move(used_)) {
+      while (!used->insert(inode).second) ++inode;
+    }
+    ~Node() { used->erase(inode); }
+    FileIdentity identity() const { return {1, inode, static_cast<std::int64_t>(bytes.size()), 0}; }
+    std::string bytes, synced;
+    const std::shared_ptr<std::set<std::uint64_t>> used;
+    std::uint64_t inode = 1;
+  };
+  struct OpenFile : File {
+    OpenFile(MemoryFileSystem& owner_, std::string path_, std::shared_ptr<Node> node_)
+        : owner(owner_), path(std::move(path_)), node(std::move(node_)) {}
+    Result<FileIdentity> identity() override {
+      if (const int error = owner.count()) return code(error);
+      return node->identity();
+    }
+    Result<std::string> readAll(std::size_t limit) override {
+      if (const int error = owner.count()) return code(error);
+      if (node->bytes.size() > limit) return platform::Outcome::tooLarge;
+      return node->bytes;
+    }
+    Result<void> writeAll(std::string_view bytes) override {
+      const int error = owner.count();
+      // What fails has got half of its way.
+      node->bytes += error != 0 ? bytes.substr(0, bytes.size() / 2) : bytes;
+      owner.happened(path);
+      return code(error);
+    }
+    Result<void> sync() override {
+      if (const int error = owner.count()) return code(error);
+      node->synced = node->bytes;
+      return {};
+    }
+    MemoryFileSystem& owner;
+    const std::string path;
+    const std::shared_ptr<Node> node;
+  };
+  // Lasts as long as its token lives.
+  template <class Registration>
+  struct Held : Registration {
+    explicit Held(std::shared_ptr<int> token_) : token(std::move(token_)) {}
+    const std::shared_ptr<int> token;
+  };
+  struct Watched {
+    std::weak_ptr<int> token;
+    std::string folder;
+    Changed changed;
+  };
+  using Names = std::map<std::string, std::shared_ptr<Node>>;
+
+  static std::error_code code(int error) { return {error, std::system_category()}; }
+  static std::string parentOf(const std::string& path) {
+    const auto slash = path.rfind('/');
+    return slash == 0 ? "/" : path.substr(0, slash);
+  }
+  bool hasFolder(const std::string& path) const {
+    return path == "/" || (now.contains(path) && hasFolder(parentOf(path)));
+  }
+  int count() { return ++calls >= failFrom ? failure : 0; }
+  int check(const std::string& path) {
+    const int error = count();
+    return error != 0 ? error : path == "/" || now.contains(path) ? 0 : ENOENT;
+  }
+  void happened(const std::string& path) { pending.push_back(path); }
+
+  const std::shared_ptr<std::set<std::uint64_t>> inodes = std::make_shared<std::set<std::uint64_t>>();
+  std::map<std::string, std::weak_ptr<int>> locks;
+  Names now, durable;  // folders are entries, too
+  std::vector<Watched> watches;
+  std::vector<std::string> pending;
+};
+
+}  // namespace fakes

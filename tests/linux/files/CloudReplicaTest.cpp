@@ -1,0 +1,180 @@
+#include "platform/linux/CloudReplica.hpp"
+
+#include <gtest/gtest.h>
+
+#include <random>
+
+#include "platform/linux/SettingsDocument.hpp"
+
+namespace platform::linux_ {
+namespace {
+
+// One process of a device: its replica, its clock, its bursts.
+struct Device {
+  explicit Device(std::string name_) : name(std::move(name_)) {}
+
+  bool write(const std::string& key, std::optional<Value> value) {
+    const auto known = lastKnown.find(key);
+    const bool news = bursts.write(
+        entries,
+        {key, value, known == lastKnown.end() ? std::nullopt : std::optional(known->second), now, name});
+    bursts.finished(now);
+    lastKnown[key] = value;
+    return news;
+  }
+  void read(const std::string& key) {
+    const auto entry = CloudEntry::find(entries, key);
+    lastKnown[key] = entry ? entry->value : std::nullopt;
+  }
+  void switchOn(double end) {
+    write("flag", true);
+    write("flagExpiration", end);
+  }
+  void switchOff() {
+    write("flag", false);
+    write("flagExpiration", std::nullopt);
+  }
+  CloudStamp stamp(const std::string& key) { return CloudEntry::find(entries, key)->stamp; }
+  std::string values() const { return describe(cloudValues(entries)); }
+  void exchange(Device& other) {
+    mergeCloudEntries(other.entries, entries);
+    mergeCloudEntries(entries, other.entries);
+    EXPECT_EQ(entries, other.entries);
+  }
+
+  std::string name;
+  Time now{1000};
+  Dictionary entries;
+  CloudBursts bursts;
+  std::map<std::string, std::optional<Value>> lastKnown;
+};
+
+TEST(CloudReplicaTest, EchoKeepsItsPlaceEvenIfANewerEntryHasArrived) {
+  Device ours("ours"), theirs("theirs");
+  theirs.switchOn(5000);
+  ours.exchange(theirs);
+  for (const char* key : {"flag", "flagExpiration"}) ours.read(key);
+  theirs.now += Time(10);
+  theirs.switchOff();
+  ours.exchange(theirs);
+  ours.now += Time(20);
+  EXPECT_FALSE(ours.write("flag", true)) << "what it read before";
+  EXPECT_FALSE(ours.write("flagExpiration", 5000.0));
+  EXPECT_EQ(ours.values(), R"(["flag": false])");
+
+  ours.read("never");
+  EXPECT_FALSE(ours.write("never", std::nullopt));
+  EXPECT_TRUE(ours.write("never", false)) << "an absent entry equals only a removal";
+  ours.now += Time(1);
+  EXPECT_FALSE(ours.write("never", false)) << "what it wrote before";
+  EXPECT_TRUE(ours.write("never", 0)) << "not the same in the file";
+  EXPECT_TRUE(ours.write("unread", std::nullopt)) << "nothing known";
+}
+
+TEST(CloudReplicaTest, WhatIsWrittenTogetherSharesOneTimestamp) {
+  Device device("d");
+  device.read("end");
+  device.write("flag", true);
+  const CloudStamp first = device.stamp("flag");
+  device.now += Time(0.024);
+  EXPECT_TRUE(device.write("end", std::nullopt)) << "no echo behind news";
+  EXPECT_EQ(device.stamp("end"), first);
+  device.now += Time(0.024);
+  device.write("third", 1);
+  EXPECT_EQ(device.stamp("third"), first) << "the quiet is that between two writes";
+  device.write("flag", false);
+  const CloudStamp second = device.stamp("flag");
+  EXPECT_GT(second, first) << "a second value";
+  device.write("end", 1);
+  EXPECT_EQ(device.stamp("end"), second);
+  device.now += Time(0.026);
+  device.write("third", 2);
+  EXPECT_GT(device.stamp("third"), second);
+
+  Device neighbour("d");
+  neighbour.entries = device.entries;
+  neighbour.now = Time(10);
+  neighbour.write("flag", true);
+  EXPECT_GT(neighbour.stamp("flag"), device.stamp("third")) << "though its clock is behind";
+  device.entries = neighbour.entries;
+  EXPECT_TRUE(device.write("flag", 7)) << "not lost on what has overtaken the burst";
+  EXPECT_EQ(device.values(), R"(["end": 1, "flag": 7, "third": 2])");
+}
+
+TEST(CloudReplicaTest, ExpiryRanksRightAfterTheSwitchThatItEnds) {
+  Device away("away"), home("home");
+  home.switchOn(5000);
+  away.exchange(home);
+  home.now = Time(3000);
+  home.switchOff();
+  home.now += Time(60);
+  home.switchOn(9000);
+
+  away.now = Time(4999.2);  // within the second
+  away.switchOff();
+  EXPECT_EQ(away.stamp("flag"), (CloudStamp{1'000'000'000, 1}));
+  EXPECT_EQ(away.stamp("flagExpiration"), away.stamp("flag"));
+  away.write("other", 1);
+  EXPECT_EQ(away.stamp("other").microseconds, 4'999'200'000) << "a burst of its own";
+  away.exchange(home);
+  EXPECT_EQ(cloudValues(away.entries).at("flagExpiration"), Value(9000.0)) << "the newest period stands";
+
+  // Begun anew between the two writes of an expiry.
+  away.now = Time(9000);
+  away.write("flag", false);
+  home.now = Time(9000);
+  home.switchOn(12000);
+  away.exchange(home);
+  EXPECT_FALSE(away.write("flagExpiration", std::nullopt));
+  EXPECT_EQ(away.values(), R"(["flag": true, "flagExpiration": 12000.0, "other": 1])");
+
+  // A person's "off" before the end is one with the stamp of now.
+  for (const char* key : {"flag", "flagExpiration"}) away.read(key);
+  away.switchOff();
+  EXPECT_EQ(away.stamp("flag").tick, 0);
+  home.exchange(away);
+  EXPECT_EQ(home.values(), R"(["flag": false, "other": 1])");
+}
+
+TEST(CloudReplicaTest, MergingTakesTheGreaterInWhateverOrder) {
+  std::mt19937 random(7);
+  const auto below = [&](int limit) { return static_cast<int>(random() % static_cast<unsigned>(limit)); };
+  const auto merged = [](Dictionary into, const Dictionary& other) {
+    mergeCloudEntries(other, into);
+    return into;
+  };
+  for (int round = 0; round < 2000; ++round) {
+    Dictionary replicas[3];
+    for (Dictionary& replica : replicas) {
+      for (const char* key : {"a", "b"}) {
+        const CloudEntry entry{below(3) == 0 ? std::nullopt : std::optional<Value>(below(3)),
+                               {below(2), below(2)},
+                               below(2) == 0 ? "d" : "e"};
+        if (below(4) > 0) replica[key] = below(8) == 0 ? Value("no entry") : entry.toValue();
+      }
+    }
+    const auto& [a, b, c] = replicas;
+    const auto valid = [&](const Dictionary& entries) { return merged({}, entries); };
+    ASSERT_EQ(valid(merged(a, b)), valid(merged(b, a)));
+    ASSERT_EQ(valid(merged(merged(a, b), c)), valid(merged(a, merged(b, c))));
+    ASSERT_EQ(merged(a, a), a);
+    Dictionary both = merged(a, b);
+    ASSERT_FALSE(mergeCloudEntries(b, both)) << "nothing new the second time";
+  }
+}
+
+TEST(CloudReplicaTest, EntryOutOfRangeCountsAsNotThere) {
+  const Value good = CloudEntry{1, {5, 0}, "d"}.toValue();
+  for (const auto& [name, value] :
+       Dictionary{{"time", -1}, {"time", 1.5}, {"tick", "0"}, {"device", 1}, {"removed", true}}) {
+    Dictionary fields = std::get<Dictionary>(good.storage);
+    fields.insert_or_assign(name, value);
+    EXPECT_FALSE(CloudEntry::fromValue(fields)) << name;
+  }
+  EXPECT_TRUE(CloudEntry::fromValue(good));
+  EXPECT_EQ(cloudValues({{"a", good}, {"b", true}, {"c", CloudEntry{{}, {5, 0}, "d"}.toValue()}}),
+            (Dictionary{{"a", 1}}));
+}
+
+}  // namespace
+}  // namespace platform::linux_

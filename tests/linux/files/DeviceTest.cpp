@@ -1,0 +1,82 @@
+#include <cerrno>
+
+#include "platform/linux/FileDeviceProperties.hpp"
+#include "platform/linux/LinuxEnvironment.hpp"
+#include "tests/linux/files/World.hpp"
+
+namespace platform::linux_ {
+namespace {
+
+class DeviceTest : public World {
+ protected:
+  std::string answer(const char* key) {
+    std::int32_t error = 0;
+    const std::string text = describe(properties.copyAnswerWithError(key, error));
+    return error != 0 ? text + " error " + std::to_string(error) : text;
+  }
+  std::string bootSession(std::size_t size, std::size_t& length) {
+    std::string buffer(size, '?');
+    length = size;
+    if (kernel.sysctlbyname("kern.bootsessionuuid", buffer.data(), &length) != 0)
+      return std::to_string(errno);
+    return buffer.substr(0, length - 1);
+  }
+
+  const std::string etc = "/root/etc/device.json";
+  DeviceFile file{files, etc};
+  FileDeviceProperties properties{files, file};
+  LinuxSystemControl kernel{files, file};
+};
+
+TEST_F(DeviceTest, FileComesFirstThenTheMachine) {
+  files.put("/usr/lib/os-release", "NAME=\"X\"\nVERSION_ID=\"12\"\nBUILD_ID='21A5'\n");
+  files.put("/etc/machine-id", "0123abcd\n");
+  EXPECT_EQ(answer("BuildVersion"), "21A5");
+  EXPECT_EQ(answer("ProductVersion"), "12");
+  EXPECT_EQ(answer("UniqueDeviceID"), "0123abcd");
+  EXPECT_EQ(answer("ProductType"), "nil");
+  EXPECT_NE(answer("UserAssignedDeviceName"), "nil");
+  EXPECT_NE(answer("k7QIBwZJJOVw+Sej/8h8VA"), "nil");
+  EXPECT_EQ(properties.isInternalBuild(), 0);
+
+  files.put(etc, R"({"BuildVersion": "9Z", "UniqueChipID": 77, "ProductType": {"value": "T", "error": -3},
+                     "ProductVersion": {"error": 5}, "InternalBuild": true})");
+  EXPECT_EQ(answer("BuildVersion"), "9Z") << "read anew";
+  EXPECT_EQ(answer("UniqueChipID"), "77");
+  EXPECT_EQ(answer("ProductType"), "T error -3");
+  EXPECT_EQ(answer("ProductVersion"), "nil error 5");
+  EXPECT_EQ(properties.isInternalBuild(), 1);
+
+  files.put(etc, "{\n\"BuildVersion\": }");
+  EXPECT_EQ(answer("BuildVersion"), "21A5");
+  EXPECT_EQ(answer("ProductVersion"), "12");
+  EXPECT_THAT(logged(), testing::ElementsAre(testing::HasSubstr(etc + ": line 2, column"))) << "once";
+  EXPECT_TRUE(files.exists(etc)) << "it is its administrator's";
+}
+
+TEST_F(DeviceTest, BootSessionIsTheKernelsInUpperCaseOrTheFiles) {
+  std::size_t length = 0;
+  EXPECT_EQ(bootSession(37, length), std::to_string(ENOENT));
+  files.put("/proc/sys/kernel/random/boot_id", "01234567-89ab-cdef-0123-456789abcdef\n");
+  EXPECT_EQ(bootSession(37, length), "01234567-89AB-CDEF-0123-456789ABCDEF");
+  EXPECT_EQ(length, 37u);
+  EXPECT_EQ(bootSession(36, length), std::to_string(ENOMEM));
+  files.put(etc, R"({"BootSessionUUID": "another"})");
+  EXPECT_EQ(bootSession(37, length), "another");
+  EXPECT_EQ(kernel.sysctlbyname("kern.bootsessionuuid", nullptr, &length), 0);
+  EXPECT_EQ(length, 8u);
+  EXPECT_EQ(kernel.sysctlbyname("kern.other", nullptr, &length), -1);
+  EXPECT_EQ(errno, ENOENT);
+}
+
+TEST_F(DeviceTest, EnvironmentTellsEmptyFromAbsent) {
+  ::setenv("FILES_TEST", "", 1);
+  LinuxEnvironment environment;
+  EXPECT_EQ(environment.variable("FILES_TEST"), "");
+  EXPECT_EQ(environment.all().count("FILES_TEST"), 1u);
+  EXPECT_EQ(environment.all().at("PATH"), environment.variable("PATH"));
+  EXPECT_EQ(environment.variable("FILES_TEST_ABSENT"), std::nullopt);
+}
+
+}  // namespace
+}  // namespace platform::linux_

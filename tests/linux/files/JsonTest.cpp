@@ -1,0 +1,50 @@
+#include "platform/linux/Json.hpp"
+
+#include <gtest/gtest.h>
+
+#include <limits>
+
+namespace platform::linux_ {
+namespace {
+
+std::string nested(int levels) {
+  const auto count = static_cast<std::size_t>(levels);
+  return std::string(count, '[') + std::string(count, ']');
+}
+
+TEST(JsonTest, RefusesWhatItCouldNotKeepAndSaysWhere) {
+  const std::pair<std::string, const char*> rows[] = {
+      {nested(33), "line 1, column"},
+      {nested(100'000), "line 1, column"},
+      {"{\"a\": 1,\n \"a\": 1}", "line 2, column"},
+      {"\n[1e400]", "line 2, column"},
+      {"18446744073709551615", "line 1, column"},
+      {"9223372036854775808", "line 1, column"},
+      {"\"\xff\"", "line 1, column"},
+      {"1 2", "line 1, column"},
+      {"NaN", "line 1, column"},
+      {"", "line 1, column 1"},
+  };
+  for (const auto& [text, place] : rows) {
+    std::string problem;
+    EXPECT_EQ(parseJson(text, problem).error(), Outcome::malformedFile) << text.substr(0, 40);
+    EXPECT_EQ(problem.rfind(place, 0), 0u) << problem;
+  }
+}
+
+TEST(JsonTest, ReadsBackWhatItWrote) {
+  using Limits = std::numeric_limits<std::int64_t>;
+  const Value value =
+      Dictionary{{"integers", List{Limits::min(), Limits::max(), std::int64_t{0}}},
+                 {"doubles", List{5.0, -0.5, 1e300, 5e-324, std::numeric_limits<double>::infinity()}},
+                 {"others", List{nullptr, true, "\"\n\xc3\xa9", Date{-1}, Dictionary{}}}};
+  std::string problem;
+  for (const JsonStyle style : {JsonStyle::line, JsonStyle::indented}) {
+    EXPECT_EQ(parseJson(*printJson(value, style), problem).value(), value);
+  }
+  EXPECT_TRUE(parseJson(nested(32), problem)) << problem;
+  EXPECT_EQ(printJson("\xff", JsonStyle::line).value(), "\"\xef\xbf\xbd\"");
+}
+
+}  // namespace
+}  // namespace platform::linux_

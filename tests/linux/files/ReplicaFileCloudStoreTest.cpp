@@ -1,0 +1,119 @@
+#include "platform/linux/ReplicaFileCloudStore.hpp"
+
+#include "platform/linux/SettingsDocument.hpp"
+#include "tests/linux/files/World.hpp"
+
+namespace platform::linux_ {
+namespace {
+
+using testing::ElementsAre;
+using testing::HasSubstr;
+using testing::IsEmpty;
+
+class ReplicaFileCloudStoreTest : public World {
+ protected:
+  struct Listener {
+    void changed(const Notification& notification) { seen.push_back(describe(*notification.userInfo)); }
+    std::vector<std::string> seen;
+  };
+  ReplicaFileCloudStoreTest() {
+    device.centre.addObserver(listener, &Listener::changed, CloudStore::externalChangeNotification,
+                              static_cast<CloudStore*>(store.get()));
+  }
+  std::shared_ptr<ReplicaFileCloudStore> open(WorkQueue* delivery) {
+    return ReplicaFileCloudStore::create(files, delivery, device.centre, device.manualClock, path);
+  }
+  std::vector<std::string> announced() {
+    deliver();
+    return std::exchange(listener->seen, {});
+  }
+  std::string entry(const std::string& key) {
+    std::string problem;
+    return describe(settingsValues(*decodeSettings(files.bytes(path), problem)).at(key));
+  }
+
+  const std::shared_ptr<ReplicaFileCloudStore> store = open(device.delivery.get());
+  const std::shared_ptr<ReplicaFileCloudStore> neighbour = open(nullptr);
+  const std::shared_ptr<Listener> listener = std::make_shared<Listener>();
+};
+
+TEST_F(ReplicaFileCloudStoreTest, OutsideChangeIsAnnouncedOnceAndAnOwnOneNever) {
+  store->setValue(true, "flag");
+  EXPECT_THAT(announced(), IsEmpty());
+  neighbour->setValue(5.5, "end");
+  neighbour->setValue(false, "flag");
+  store->setValue(1, "own");
+  EXPECT_FALSE(store->boolForKey("flag"));
+  EXPECT_THAT(listener->seen, IsEmpty()) << "not from inside a write or a read";
+  EXPECT_THAT(announced(), ElementsAre(R"(["ChangeReason": 0, "ChangedKeys": ["end", "flag"]])"));
+  EXPECT_THAT(announced(), IsEmpty());
+  neighbour->setValue(std::nullopt, "absent");
+  EXPECT_THAT(announced(), IsEmpty()) << "a tombstone where there was nothing";
+  EXPECT_EQ(describe(store->dictionaryRepresentation()), R"(["end": 5.5, "flag": false, "own": 1])");
+}
+
+TEST_F(ReplicaFileCloudStoreTest, ReasonsInTheFileAreAnnouncedEvenWithoutAKey) {
+  neighbour->setValue(1, "a");
+  EXPECT_EQ(announced().size(), 1u);
+  const auto file = SettingsFile::create(files, path);
+  const auto announce = [&](int reason, int sequence, bool alsoRemoved) {
+    ASSERT_TRUE(file->update([&](Dictionary& whole) {
+      whole["reason"] = reason;
+      whole["reasonSequence"] = sequence;
+      return !alsoRemoved || settingsValues(whole).erase("a") == 1;
+    }));
+  };
+  announce(3, 1, false);
+  EXPECT_THAT(announced(), ElementsAre(R"(["ChangeReason": 3, "ChangedKeys": []])"));
+  announce(1, 2, true);
+  EXPECT_THAT(announced(), ElementsAre(R"(["ChangeReason": 1, "ChangedKeys": ["a"]])"));
+  neighbour->setValue(2, "a");
+  EXPECT_THAT(announced(), ElementsAre(R"(["ChangeReason": 0, "ChangedKeys": ["a"]])"))
+      << "a reason counts once";
+  announce(2, 3, true);
+  EXPECT_THAT(announced(), ElementsAre(R"(["ChangeReason": 2, "ChangedKeys": []])",
+                                       R"(["ChangeReason": 0, "ChangedKeys": ["a"]])"));
+}
+
+TEST_F(ReplicaFileCloudStoreTest, EchoOfATypedReadLeavesTheEntry) {
+  neighbour->setValue(true, "flag");
+  const std::string before = entry("flag");
+  device.manualClock.time += Time(60);
+  static_cast<void>(store->dictionaryRepresentation());
+  EXPECT_TRUE(store->boolForKey("flag"));
+  store->setValue(true, "flag");
+  EXPECT_EQ(entry("flag"), before);
+  EXPECT_TRUE(store->synchronise());
+  const auto other = open(nullptr);
+  static_cast<void>(other->dictionaryRepresentation());
+  other->setValue(true, "flag");
+  EXPECT_NE(entry("flag"), before) << "the whole contents are no typed read";
+}
+
+TEST_F(ReplicaFileCloudStoreTest, FailedWriteIsNotDurableAndNotRemembered) {
+  EXPECT_TRUE(store->synchronise());
+  files.failure = ENOSPC;
+  files.failFrom = files.calls + 4;
+  store->setValue(true, "flag");
+  files.failFrom = std::numeric_limits<int>::max();
+  EXPECT_FALSE(store->synchronise());
+  EXPECT_THAT(logged(), ElementsAre(HasSubstr("flag cannot be stored: No space left on device")));
+  store->setValue(true, "flag");
+  EXPECT_TRUE(store->synchronise());
+  files.powerCut();
+  EXPECT_TRUE(open(nullptr)->boolForKey("flag")) << "no echo of what was never written";
+}
+
+TEST_F(ReplicaFileCloudStoreTest, EditedValuesAreWrittenAsOneBurst) {
+  for (const char* key : {"a", "b", "c"}) neighbour->setValue(1, key);
+  const std::string kept = entry("a");
+  device.manualClock.time += Time(60);
+  ASSERT_TRUE(neighbour->replaceValues({{"a", 1}, {"b", 2}}));
+  EXPECT_EQ(entry("a"), kept);
+  EXPECT_EQ(describe(store->dictionaryRepresentation()), R"(["a": 1, "b": 2])");
+  EXPECT_THAT(entry("c"), HasSubstr(R"("removed": true, "tick": 0, "time": 1000060000000])"));
+  EXPECT_THAT(entry("b"), HasSubstr(R"("tick": 0, "time": 1000060000000)"));
+}
+
+}  // namespace
+}  // namespace platform::linux_

@@ -1,0 +1,169 @@
+#include "platform/linux/SettingsFile.hpp"
+
+#include "platform/linux/SettingsDocument.hpp"
+#include "tests/linux/files/World.hpp"
+
+namespace platform::linux_ {
+namespace {
+
+using testing::AllOf;
+using testing::ElementsAre;
+using testing::HasSubstr;
+
+class SettingsFileTest : public World {
+ protected:
+  std::shared_ptr<SettingsFile> open() { return SettingsFile::create(files, path); }
+  static Dictionary stored(SettingsFile& file) { return settingsValues(*file.contents()); }
+};
+
+struct Damage {
+  const char* name;
+  std::string text;
+  const char* place;
+};
+
+TEST_F(SettingsFileTest, DamageIsMovedAsideWhileTheLastGoodContentsStayInForce) {
+  const Damage rows[] = {
+      {"empty", "", "line 1, column 1"},
+      {"cut short", "{\n  \"values\": {\"a\": 1", "line 2, column"},
+      {"no object", "[1]", "line 1, column 1: not an object"},
+      {"values of another type", "{\n\"values\": 5}", "line 2: \"values\""},
+      {"a key twice", "{\"values\": {\"a\": 1, \"a\": 2}}", "line 1, column"},
+      {"checksum of other contents", "{\"values\": {\"a\": 3},\n\"checksum\": \"00000000\"}",
+       "line 2: the contents"},
+      {"checksum of another type", "{\"values\": {\"a\": 3}, \"checksum\": 0}", "line 1: the contents"},
+      {"too large", std::string(SettingsFile::sizeLimit + 1, ' '), "larger than"},
+  };
+  const auto file = open();
+  ASSERT_TRUE(file->setValue("a", 1));
+  int number = 0;
+  for (const Damage& row : rows) {
+    SCOPED_TRACE(row.name);
+    files.put(path, row.text);
+    EXPECT_EQ(stored(*file), (Dictionary{{"a", 1}}));
+    EXPECT_EQ(stored(*file), (Dictionary{{"a", 1}})) << "with no file in its place";
+    const std::string aside = path + ".damaged-" + std::to_string(++number);
+    EXPECT_EQ(files.bytes(aside), row.text);
+    EXPECT_THAT(logged(), ElementsAre(AllOf(HasSubstr(path + ": "), HasSubstr(row.place), HasSubstr(aside),
+                                            HasSubstr("remove its checksum line"))));
+  }
+  ASSERT_TRUE(file->setValue("b", 2));
+  EXPECT_EQ(stored(*open()), (Dictionary{{"a", 1}, {"b", 2}})) << "another process, from the file";
+
+  files.put(path, "?");
+  ASSERT_TRUE(file->setValue("c", 3)) << "first met by a write";
+  EXPECT_EQ(stored(*open()), (Dictionary{{"a", 1}, {"b", 2}, {"c", 3}}));
+  files.put(path, "?");
+  EXPECT_EQ(stored(*open()), Dictionary{}) << "by a process that knows nothing good";
+}
+
+TEST_F(SettingsFileTest, DamageThatCannotBeMovedIsNotOverwritten) {
+  files.put(path, "?");
+  files.immovable.insert(path);
+  const auto file = open();
+  EXPECT_EQ(stored(*file), Dictionary{});
+  EXPECT_EQ(stored(*file), Dictionary{});
+  EXPECT_EQ(logged().size(), 1u) << "not at each read";
+  EXPECT_EQ(file->setValue("a", 1).error(), Outcome::malformedFile);
+  EXPECT_EQ(files.bytes(path), "?");
+}
+
+TEST_F(SettingsFileTest, NoSingleFlippedBitChangesWhatIsServed) {
+  ASSERT_TRUE(open()->setValue("flag", true));
+  const std::string good = files.bytes(path);
+  int found = 0;
+  for (std::size_t bit = 0; bit < good.size() * 8; ++bit) {
+    std::string text = good;
+    text[bit / 8] = static_cast<char>(text[bit / 8] ^ (1 << bit % 8));
+    std::string problem;
+    const auto document = decodeSettings(text, problem);
+    if (!document) ++found;
+    // "values" itself may become an unknown field, if the flip also hit the checksum's name; one bit cannot
+    // do both.
+    EXPECT_TRUE(!document || settingsValues(*document) == (Dictionary{{"flag", true}})) << text;
+  }
+  EXPECT_GT(found, 400);
+}
+
+TEST_F(SettingsFileTest, HandEditIsWelcomeAndUnknownFieldsSurviveARewrite) {
+  files.put(path, R"({"note": {"by": ["me"]}, "values": {"a": 1, "later": {"x": null}}})");
+  const auto file = open();
+  ASSERT_TRUE(file->setValue("a", std::nullopt));
+  ASSERT_TRUE(file->setValue("infinite", std::numeric_limits<double>::infinity()));
+  std::string problem;
+  EXPECT_THAT(files.bytes(path), HasSubstr("\"checksum\""));
+  const auto document = decodeSettings(files.bytes(path), problem);
+  ASSERT_TRUE(document) << problem;
+  EXPECT_EQ(describe(*document),
+            R"(["note": ["by": ["me"]], "values": ["infinite": inf, "later": ["x": null]]])");
+
+  const auto edited = decodeEditedSettings(R"({"checksum": "of before", "values": {}})", problem);
+  ASSERT_TRUE(edited);
+  ASSERT_TRUE(file->update([&](Dictionary& whole) { return whole = *edited, true; }));
+  EXPECT_EQ(stored(*open()), Dictionary{});
+  EXPECT_TRUE(logged().empty());
+}
+
+TEST_F(SettingsFileTest, WhatCouldNotBeReadBackIsNotWritten) {
+  const auto file = open();
+  ASSERT_TRUE(file->setValue("a", 1));
+  const std::string before = files.bytes(path);
+  Value deep = 1;
+  for (int level = 0; level < 40; ++level) deep = List{deep};
+  EXPECT_EQ(file->setValue("b", deep).error(), Outcome::tooLarge);
+  EXPECT_EQ(file->setValue("b", std::string(SettingsFile::sizeLimit, 'x')).error(), Outcome::tooLarge);
+  EXPECT_FALSE(file->update([](Dictionary& whole) {
+    settingsValues(whole) = {{"\xff", 1}, {"\xfe", 2}};
+    return true;
+  })) << "two keys that print alike";
+  EXPECT_EQ(files.bytes(path), before);
+}
+
+// Two objects on one file are two processes. The values' texts are of one size, and inodes come back at once.
+TEST_F(SettingsFileTest, NeighboursWriteIsReadThoughItsEventsAreHeldBack) {
+  const auto ours = open(), theirs = open();
+  ours->startWatching(*device.delivery, [](const auto&, const auto&) {});
+  for (int value = 10; value < 30; ++value) {
+    ASSERT_TRUE(theirs->setValue("key", value));
+    EXPECT_EQ(stored(*ours), (Dictionary{{"key", value}}));
+  }
+  files.put(path, R"({"values": {}})");
+  EXPECT_EQ(stored(*ours), Dictionary{});
+  ASSERT_TRUE(files.remove(path));
+  ASSERT_TRUE(theirs->setValue("key", 1));
+  ASSERT_TRUE(files.remove(path));
+  EXPECT_EQ(stored(*ours), Dictionary{}) << "a missing file is an empty one";
+}
+
+// Cuts a write at every call that it makes; then its process ends, or loses its power, or tries again.
+TEST_F(SettingsFileTest, CutAtAnyCallLeavesTheOldContentsOrTheNew) {
+  enum End { killed, powerCut, retriedThenPowerCut };
+  for (const bool first : {true, false}) {
+    for (const End end : {killed, powerCut, retriedThenPowerCut}) {
+      bool whole = false;
+      for (int cut = 1; !whole; ++cut) {
+        SCOPED_TRACE(testing::Message() << "first " << first << ", end " << end << ", call " << cut);
+        fakes::MemoryFileSystem disk;
+        const auto file = SettingsFile::create(disk, path);
+        ASSERT_TRUE(first || file->setValue("a", "old"));
+        disk.calls = 0;
+        disk.failFrom = cut;
+        bool told = file->setValue("a", "new").has_value();
+        whole = disk.calls < cut;
+        disk.failFrom = std::numeric_limits<int>::max();
+        if (end == retriedThenPowerCut) told = file->setValue("a", "new").has_value();
+        EXPECT_TRUE(told || end != retriedThenPowerCut);
+        if (end != killed) disk.powerCut();
+        const auto next = SettingsFile::create(disk, path);
+        const Dictionary old = first ? Dictionary{} : Dictionary{{"a", "old"}};
+        const Dictionary values = stored(*next);
+        EXPECT_TRUE(values == (Dictionary{{"a", "new"}}) || (!told && values == old)) << describe(values);
+        EXPECT_TRUE(next->setValue("b", 1));
+        EXPECT_FALSE(disk.exists(path + ".damaged-1"));
+      }
+    }
+  }
+}
+
+}  // namespace
+}  // namespace platform::linux_
