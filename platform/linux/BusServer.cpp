@@ -70,6 +70,9 @@ class BusServer::State : public BusSessionHost, public std::enable_shared_from_t
   }
 
   void stopListening() {
+    // The service manager holds the same socket: closing ours alone would leave it watched, and clients that
+    // come later would wake the loop for ever.
+    if (listener) ::epoll_ctl(epoll.get(), EPOLL_CTL_DEL, listener.get(), nullptr);
     listener.reset();
     resumeAccepting.reset();
   }
