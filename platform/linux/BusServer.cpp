@@ -50,6 +50,7 @@ class BusServer::State : public BusSessionHost, public std::enable_shared_from_t
 
   void dispatch() {
     const State* const outer = std::exchange(dispatching, this);
+    settleChanged();
     runHandedOver();
     epoll_event events[64];
     const int count = ::epoll_wait(epoll.get(), events, static_cast<int>(std::size(events)), 0);
@@ -95,6 +96,7 @@ class BusServer::State : public BusSessionHost, public std::enable_shared_from_t
   void closeAll() {
     stopListening();
     forEachSession([](BusSession& session) { session.close(); });
+    settleChanged();  // there may be no further dispatch()
   }
 
   int descriptor() const { return epoll.get(); }
@@ -193,9 +195,10 @@ class BusServer::State : public BusSessionHost, public std::enable_shared_from_t
     for (const std::uint64_t number : numbers) withSession(number, call);
   }
 
-  // Not while something of it is on the stack: it may be the session's end.
+  // Settled by dispatch(), when nothing of the session is on the stack: it may be the session's end, and its
+  // handler may let go of the connection that is emitting.
   void changed(std::uint64_t number) {
-    if (dispatching != this) return settle(number);
+    if (dispatching != this && changedSessions.empty()) eventfd_write(wakeUp.get(), 1);
     if (changedSessions.empty() || changedSessions.back() != number) changedSessions.push_back(number);
   }
 
@@ -374,7 +377,7 @@ class BusServer::State : public BusSessionHost, public std::enable_shared_from_t
   std::uint64_t nextSession = firstSession;
   std::map<std::uint64_t, Entry> sessions;
   std::function<void()> whenDrained;
-  std::vector<std::uint64_t> changedSessions;  // during dispatch(), to be settled
+  std::vector<std::uint64_t> changedSessions;  // to be settled
   std::map<uid_t, std::size_t> perUser;
   std::set<std::pair<Clock::time_point, std::uint64_t>> deadlines;
 
