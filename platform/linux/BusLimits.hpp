@@ -18,13 +18,17 @@ inline constexpr std::size_t messageBytes = 16 * 1024;
 inline constexpr std::size_t handshakeBytes = 1024;
 inline constexpr std::size_t handshakeLines = 16;
 
-// Libraries send their handshake at once; a process that is stopped for longer has to connect anew.
-inline constexpr std::chrono::seconds handshakeTime{5};
-// How long a refused client is listened to, so that its late bytes do not turn the refusal into a broken
-// pipe.
-inline constexpr std::chrono::seconds refusalTime{5};
-// How long a begun message may stay incomplete, or output unread, without a byte moving.
-inline constexpr std::chrono::seconds stallTime{10};
+// How long clients are waited for; only tests are more impatient.
+struct Patience {
+  // Libraries send their handshake at once; a process that is stopped for longer has to connect anew.
+  std::chrono::milliseconds handshake{5000};
+  // A refused client is listened to, so that its late bytes do not turn the refusal into a broken pipe.
+  std::chrono::milliseconds refusal{5000};
+  // For the whole of a begun message, and for each unread one to move on.
+  std::chrono::milliseconds stall{10'000};
+  // At the descriptor limit the listener rests, this long or until a connection ends.
+  std::chrono::milliseconds accept{500};
+};
 
 // Calls unanswered and messages unsent together: reading stops there, which slows the client down and is no
 // error. What a client that never reads can hold is this many answers, and one signal a merge key.
@@ -32,7 +36,8 @@ inline constexpr std::size_t outstanding = 16;
 
 // One turn of the loop reads this much of a client, then the others have theirs.
 inline constexpr std::size_t bytesPerTurn = 16 * 1024;
-// At the descriptor limit the listener rests this long, or until a connection ends.
-inline constexpr std::chrono::milliseconds acceptPause{500};
+// Left free when clients are accepted: a turn's sixteen clients take four each until they are served, and the
+// process has files to open. Accepted with the last one, a client could only be refused.
+inline constexpr std::size_t spareDescriptors = 64;
 
 }  // namespace platform::linux_::limits

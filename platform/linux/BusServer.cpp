@@ -3,6 +3,7 @@
 #include <fcntl.h>
 #include <sys/epoll.h>
 #include <sys/eventfd.h>
+#include <sys/resource.h>
 #include <sys/socket.h>
 #include <sys/timerfd.h>
 #include <systemd/sd-bus.h>
@@ -38,9 +39,9 @@ std::uint64_t processTag(std::uint64_t session) { return session * 2 + 1; }
 
 class BusServer::State : public BusSessionHost, public std::enable_shared_from_this<State> {
  public:
-  explicit State(BusInterface interface)
+  State(BusInterface interface, limits::Patience patience)
       : epoll(::epoll_create1(EPOLL_CLOEXEC)),
-        _service(std::move(interface)),
+        _service(std::move(interface), patience),
         wakeUp(::eventfd(0, EFD_CLOEXEC | EFD_NONBLOCK)),
         timer(::timerfd_create(CLOCK_MONOTONIC, TFD_CLOEXEC | TFD_NONBLOCK)) {
     if (!epoll || !wakeUp || !timer) platform::stop(std::string("bus server: ") + std::strerror(errno));
@@ -280,15 +281,25 @@ class BusServer::State : public BusSessionHost, public std::enable_shared_from_t
   void acceptSome() {
     // In turns, so that those who are connected already have theirs.
     for (int turn = 0; turn < 16 && listener; ++turn) {
+      if (!hasSpareDescriptors()) return pause();
       UniqueDescriptor socket(::accept4(listener.get(), nullptr, nullptr, SOCK_CLOEXEC | SOCK_NONBLOCK));
       if (socket) {
+        exhausted = false;
         offer(std::move(socket));
-      } else if (errno == EMFILE || errno == ENFILE || errno == ENOBUFS || errno == ENOMEM) {
-        return pause();
-      } else if (errno != ECONNABORTED && errno != EINTR) {
+      } else if (errno == EAGAIN) {
         return;
+      } else if (errno != ECONNABORTED && errno != EINTR) {
+        return pause();
       }
     }
+  }
+
+  // The kernel gives out the lowest free number.
+  bool hasSpareDescriptors() const {
+    const UniqueDescriptor lowest(::fcntl(epoll.get(), F_DUPFD_CLOEXEC, 0));
+    rlimit limit{};
+    if (!lowest || ::getrlimit(RLIMIT_NOFILE, &limit) != 0) return false;
+    return static_cast<rlim_t>(lowest.get()) + limits::spareDescriptors < limit.rlim_cur;
   }
 
   void offer(UniqueDescriptor socket) {
@@ -349,9 +360,9 @@ class BusServer::State : public BusSessionHost, public std::enable_shared_from_t
   }
 
   void pause() {
-    log().error("at the limit of descriptors: accepting rests");
+    if (!std::exchange(exhausted, true)) log().error("at the limit of descriptors: accepting rests");
     control(EPOLL_CTL_MOD, listener.get(), 0, listenerTag);
-    resumeAccepting = Clock::now() + limits::acceptPause;
+    resumeAccepting = Clock::now() + _service.patience.accept;
     armTimer();
   }
 
@@ -372,6 +383,7 @@ class BusServer::State : public BusSessionHost, public std::enable_shared_from_t
   UniqueDescriptor listener;
   Admitter admitter;
   std::optional<Clock::time_point> resumeAccepting;
+  bool exhausted = false;
   bool full = false;
 
   std::uint64_t nextSession = firstSession;
@@ -385,7 +397,8 @@ class BusServer::State : public BusSessionHost, public std::enable_shared_from_t
   std::vector<Work> handedOver;  // guarded by `mutex`
 };
 
-BusServer::BusServer(BusInterface interface) : state(std::make_shared<State>(std::move(interface))) {}
+BusServer::BusServer(BusInterface interface, limits::Patience patience)
+    : state(std::make_shared<State>(std::move(interface), patience)) {}
 
 BusServer::~BusServer() { state->closeAll(); }
 

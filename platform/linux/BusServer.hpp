@@ -13,6 +13,7 @@
 
 #include "platform/Result.hpp"
 #include "platform/Value.hpp"
+#include "platform/linux/BusLimits.hpp"
 #include "platform/linux/PeerIdentity.hpp"
 #include "platform/linux/UniqueDescriptor.hpp"
 
@@ -80,7 +81,7 @@ class BusServer {
   using Decide = std::function<void(Admission)>;
   using Admitter = std::function<void(PeerIdentity peer, Decide decide)>;
 
-  explicit BusServer(BusInterface interface);
+  explicit BusServer(BusInterface interface, limits::Patience patience = {});
   ~BusServer();  // closes all connections; late completions and decisions are harmless
 
   // An epoll descriptor, readable when dispatch() has something to do.

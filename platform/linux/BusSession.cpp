@@ -81,8 +81,11 @@ std::string randomIdentifier() {
 
 }  // namespace
 
-BusService::BusService(BusInterface interface_)
-    : interface(std::move(interface_)), table(makeTable(interface)), identifier(randomIdentifier()) {}
+BusService::BusService(BusInterface interface_, limits::Patience patience_)
+    : interface(std::move(interface_)),
+      patience(patience_),
+      table(makeTable(interface)),
+      identifier(randomIdentifier()) {}
 
 BusService::~BusService() = default;
 
@@ -101,13 +104,13 @@ BusSession::~BusSession() { finish(); }
 void BusSession::admit(std::shared_ptr<BusHandler> handler_) {
   handler = std::move(handler_);
   phase = Phase::handshake;
-  end = std::chrono::steady_clock::now() + limits::handshakeTime;
+  end = std::chrono::steady_clock::now() + host.service().patience.handshake;
   shaking.emplace(_peer.uid, host.service().identifier);
 }
 
 void BusSession::refuse() {
   phase = Phase::refused;
-  end = std::chrono::steady_clock::now() + limits::refusalTime;
+  end = std::chrono::steady_clock::now() + host.service().patience.refusal;
   // Closing at once, or with input unread, would reach the client as a broken pipe.
   if (!sendAll(descriptor, busRefusal) || ::shutdown(descriptor, SHUT_WR) < 0) phase = Phase::ended;
 }
@@ -384,7 +387,7 @@ void BusSession::reconsiderDeadline(bool moved) {
   if (!isHeldUp()) {
     end.reset();
   } else if (!end || moved) {
-    end = std::chrono::steady_clock::now() + limits::stallTime;
+    end = std::chrono::steady_clock::now() + host.service().patience.stall;
   }
 }
 

@@ -23,10 +23,11 @@ namespace platform::linux_ {
 
 // What the sessions of one server share.
 struct BusService {
-  explicit BusService(BusInterface interface);
+  BusService(BusInterface interface, limits::Patience patience);
   ~BusService();
 
   const BusInterface interface;
+  const limits::Patience patience;
   const std::vector<sd_bus_vtable> table;  // of `interface`, whose texts it points to
   const std::string identifier;            // of the server, in handshakes
 };
