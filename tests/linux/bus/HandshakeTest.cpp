@@ -1,0 +1,137 @@
+// What precedes messages, byte by byte: the handshake, and where a message ends.
+#include "platform/linux/BusHandshake.hpp"
+
+#include <gtest/gtest.h>
+
+#include <cstdint>
+#include <cstring>
+#include <string>
+#include <string_view>
+
+#include "platform/linux/BusLimits.hpp"
+
+namespace platform::linux_ {
+namespace {
+
+using namespace std::string_literals;
+
+// User 1000, in hexadecimal as the handshake has it.
+const std::string start = "\0AUTH EXTERNAL 31303030\r\n"s;
+const std::string ok = "OK server\r\n";
+const std::string no = "REJECTED EXTERNAL\r\n";
+
+std::string repeated(const std::string& text, std::size_t times) {
+  std::string all;
+  while (times-- > 0) all += text;
+  return all;
+}
+
+struct Shaken {
+  std::string result;  // "going", "done" or "failed", and what is left of the input
+  std::string output;
+};
+
+// Feeds `input` in pieces, as sockets cut it.
+Shaken shakeHands(const std::string& input, std::size_t pieceSize) {
+  BusHandshake handshake(1000, "server");
+  std::string pending;
+  Shaken run;
+  for (std::size_t at = 0; at < input.size(); at += pieceSize) {
+    pending += input.substr(at, pieceSize);
+    std::string_view rest = pending;
+    const auto progress = handshake.advance(rest, run.output);
+    pending = rest;
+    if (progress == BusHandshake::Progress::failed) return {"failed", run.output};
+    if (progress == BusHandshake::Progress::done) {
+      if (at + pieceSize < input.size()) pending += input.substr(at + pieceSize);
+      return {"done " + pending, run.output};
+    }
+  }
+  run.result = "going";
+  return run;
+}
+
+TEST(BusHandshakeTest, AnswersAreTheSameInWhateverPiecesItComes) {
+  const struct {
+    const char* name;
+    std::string input;
+    std::string result;
+    std::string output;
+  } rows[] = {
+      {"user named", start + "BEGIN\r\n", "done ", ok},
+      {"user asked for", "\0AUTH EXTERNAL\r\nDATA\r\nBEGIN\r\n"s, "done ", "DATA\r\n" + ok},
+      {"user named when asked", "\0AUTH EXTERNAL\r\nDATA 31303030\r\nBEGIN\r\n"s, "done ", "DATA\r\n" + ok},
+      {"messages behind it", start + "NEGOTIATE_UNIX_FD\r\nBEGIN\r\nl\1\r\n", "done l\1\r\n",
+       ok + "ERROR\r\n"},
+      {"another user", "\0AUTH EXTERNAL 30\r\nBEGIN\r\n"s, "failed", no},
+      {"another user when asked", "\0AUTH EXTERNAL\r\nDATA 30\r\nDATA\r\nBEGIN\r\n"s, "failed",
+       "DATA\r\n" + no + "ERROR\r\n"},
+      {"right at the second try", "\0AUTH EXTERNAL 30\r\nAUTH EXTERNAL 31303030\r\nBEGIN\r\n"s, "done ",
+       no + ok},
+      {"other mechanisms", "\0AUTH\r\nAUTH ANONYMOUS\r\nAUTH EXTERNALLY 31303030\r\nBEGIN\r\n"s, "failed",
+       no + no + no},
+      {"data that nobody asked for", "\0DATA\r\nBEGIN\r\n"s, "failed", "ERROR\r\n"},
+      {"data after a change of mind", "\0AUTH EXTERNAL\r\nCANCEL\r\nDATA\r\nBEGIN\r\n"s, "failed",
+       "DATA\r\n" + no + "ERROR\r\n"},
+      {"nothing said", "\0BEGIN\r\n"s, "failed", ""},
+      {"no zero byte", "AUTH EXTERNAL 31303030\r\nBEGIN\r\n", "failed", ""},
+      {"an end of line alone", start + "BEGIN\n", "going", ok},
+      {"as many lines as allowed", start + repeated("?\r\n", limits::handshakeLines - 2) + "BEGIN\r\n",
+       "done ", ok + repeated("ERROR\r\n", limits::handshakeLines - 2)},
+      {"a line too many", start + repeated("?\r\n", limits::handshakeLines - 1) + "BEGIN\r\n", "failed",
+       ok + repeated("ERROR\r\n", limits::handshakeLines - 1)},
+      {"a line too long", start + std::string(limits::handshakeBytes, 'x'), "failed", ok},
+      {"lines too long together", start + repeated(std::string(limits::handshakeBytes / 4, 'x') + "\r\n", 4),
+       "failed", ok + repeated("ERROR\r\n", 3)},
+  };
+  for (const auto& row : rows) {
+    for (const std::size_t pieceSize : {std::size_t{1}, std::size_t{7}, row.input.size()}) {
+      const Shaken run = shakeHands(row.input, pieceSize);
+      EXPECT_EQ(run.result, row.result) << row.name << " by " << pieceSize;
+      EXPECT_EQ(run.output, row.output) << row.name << " by " << pieceSize;
+    }
+  }
+}
+
+std::string header(char order, std::uint32_t body, std::uint32_t fields, char version = 1) {
+  std::string bytes{order, 1, 0, version};
+  for (const std::uint32_t number : {body, 7u, fields}) {
+    for (unsigned index = 0; index < 4; ++index)
+      bytes += static_cast<char>(number >> 8 * (order == 'l' ? index : 3 - index));
+  }
+  return bytes;
+}
+
+TEST(BusMessageLengthTest, IsKnownFromTheFixedHeaderAlone) {
+  const struct {
+    const char* name;
+    std::string bytes;
+    std::string result;
+  } rows[] = {
+      {"nothing", "", "unknown"},
+      {"all but one byte", header('l', 0, 0).substr(0, 15), "unknown"},
+      {"nothing but the header", header('l', 0, 0), "16"},
+      {"fields are padded, a body is not", header('l', 3, 9), "35"},
+      {"the other order", header('B', 3, 9) + "more", "35"},
+      {"the limit", header('l', 984, 24), "1024"},
+      {"a byte more", header('B', 985, 24), "too large"},
+      {"a body of 4 GiB", header('l', 0xffffffff, 0), "too large"},
+      {"fields of 4 GiB", header('B', 0, 0xfffffff9), "too large"},
+      {"sizes whose sum is small in 32 bits", header('l', 0xffffffff, 0xfffffff9), "too large"},
+      {"no byte order", "x", "malformed"},
+      {"version 2", header('l', 0, 0, 2), "malformed"},
+  };
+  for (const auto& row : rows) {
+    const auto length = busMessageLength(row.bytes, 1024);
+    std::string result = "malformed";
+    if (length) {
+      result = *length ? std::to_string(**length) : "unknown";
+    } else if (length.error() == Outcome::tooLarge) {
+      result = "too large";
+    }
+    EXPECT_EQ(result, row.result) << row.name;
+  }
+}
+
+}  // namespace
+}  // namespace platform::linux_
