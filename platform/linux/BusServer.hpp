@@ -62,8 +62,8 @@ class BusConnection {
  public:
   virtual ~BusConnection() = default;
   virtual const PeerIdentity& peer() const = 0;
-  // Signals that the client has not read yet merge: a later one of the same `mergeKey` takes the place of an
-  // earlier. So a client that never reads holds at most one a key.
+  // Signals that the client has not read yet merge: a later one of the same signal and `mergeKey` takes
+  // the place of an earlier. So a client that never reads holds at most one a key.
   virtual void emit(std::size_t signal, List arguments, const std::string& mergeKey) = 0;
   virtual void close() = 0;
 };

@@ -141,8 +141,11 @@ void BusSession::ready(std::uint32_t events) {
 }
 
 void BusSession::processEnded() {
-  while (phase == Phase::running && !inputEnded && outstanding() < limits::outstanding && readSome())
+  // In a handshake, too: who sends everything ahead may be gone before he is admitted.
+  while (phase == Phase::handshake || phase == Phase::running) {
+    if (inputEnded || outstanding() >= limits::outstanding || !readSome()) break;
     handleInput();
+  }
   close();
 }
 
@@ -325,8 +328,9 @@ void BusSession::stopReading() {
 
 void BusSession::emit(std::size_t signal, List arguments, const std::string& mergeKey) {
   if (phase == Phase::ended || phase == Phase::refused) return;
-  const auto earlier = std::find_if(signals.begin(), signals.end(),
-                                    [&](const Signal& candidate) { return candidate.mergeKey == mergeKey; });
+  const auto earlier = std::find_if(signals.begin(), signals.end(), [&](const Signal& candidate) {
+    return candidate.signal == signal && candidate.mergeKey == mergeKey;
+  });
   if (earlier == signals.end()) {
     signals.push_back({mergeKey, signal, std::move(arguments)});
   } else {
