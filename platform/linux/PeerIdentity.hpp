@@ -27,7 +27,11 @@ struct PeerIdentity {
   std::shared_ptr<const UniqueDescriptor> process;
 };
 
+// SO_PEERPIDFD: Linux 6.5 knows it, older headers do not name it.
+inline constexpr int peerPidfdOption = 77;
+
 // From the socket itself. Each system call that fails leaves its part absent; a line in the log says why.
-PeerIdentity establishPeer(int socket);
+// Where the kernel does not know `pidfdOption`, the handle is the one of the peer's pid, which is weaker.
+PeerIdentity establishPeer(int socket, int pidfdOption = peerPidfdOption);
 
 }  // namespace platform::linux_
