@@ -24,8 +24,13 @@ bool isTrusted(uid_t owner) { return owner == 0 || owner == ::geteuid(); }
 // followed one step at a time, since each may lie where others can change it.
 std::string writableByOthers(const fs::path& path, int links = 0) {
   if (links > 40) return path.string() + ": too many links";
-  fs::path place;
+  fs::path place;  // has no link in it, so what is above it is its parent
   for (auto part = path.begin(); part != path.end(); ++part) {
+    if (part->empty() || *part == ".") continue;
+    if (*part == "..") {
+      place = place.parent_path();
+      continue;
+    }
     place /= *part;
     struct stat status {};
     if (::lstat(place.c_str(), &status) != 0) return place.string() + ": " + std::strerror(errno);
@@ -36,7 +41,7 @@ std::string writableByOthers(const fs::path& path, int links = 0) {
       if (error) return place.string() + ": " + error.message();
       target = place.parent_path() / target;
       for (++part; part != path.end(); ++part) target /= *part;
-      return writableByOthers(target.lexically_normal(), links + 1);
+      return writableByOthers(target, links + 1);
     }
     const bool sticky = S_ISDIR(status.st_mode) && (status.st_mode & S_ISVTX);
     if ((status.st_mode & (S_IWGRP | S_IWOTH)) && !sticky)
@@ -76,15 +81,14 @@ std::string readFields(const Value& value, const std::string& root, EntitlementG
 
 std::string readGrant(FileSystem& files, const std::string& root, EntitlementGrant& grant) {
   // Before it is read: what others can write says nothing.
-  if (auto problem = writableByOthers(fs::absolute(grant.file).lexically_normal()); !problem.empty())
-    return problem;
+  if (auto problem = writableByOthers(fs::absolute(grant.file)); !problem.empty()) return problem;
   const auto text = readFile(files, grant.file, fileLimit);
   if (!text) return text.error().message();
   std::string problem;
   const auto value = parseJson(*text, problem);
   if (!value) return problem;
   if (problem = readFields(*value, root, grant); !problem.empty()) return problem;
-  return writableByOthers(fs::absolute(grant.executable).lexically_normal());
+  return writableByOthers(fs::absolute(grant.executable));
 }
 
 bool isFor(const EntitlementGrant& grant, const PeerIdentity& peer) {
