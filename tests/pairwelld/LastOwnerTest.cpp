@@ -36,7 +36,8 @@ class LastOwnerTest : public World {
       EXPECT_THAT(device.calls, ElementsAre("dropped"));
     }
   }
-  // `release` lets go of every reference but those of a delivery under way.
+  // `release`, which is dropped when it has run, lets go of every reference but those of a delivery under
+  // way.
   void keep(std::weak_ptr<void> object, std::function<void()> release_) {
     watched = std::move(object);
     release = std::move(release_);
@@ -57,7 +58,7 @@ class LastOwnerTest : public World {
   }
   void effect() { platform.effects.record(Effects::client, "called"); }
 
-  void switchOn() { platform.cloud->changeFromElsewhere({{flagKey, true}}); }
+  void switchOff() { platform.cloud->changeFromElsewhere({{flagKey, false}}); }
   void writeUser() {
     platform.pool->async([this] { platform.user->setValue(60, overrideKey); });
   }
@@ -73,10 +74,10 @@ class LastOwnerTest : public World {
 
 TEST_F(LastOwnerTest, OfTheStoreManager) {
   const auto make = [](Device& device) {
-    auto kvs = KeyValueStoreManager::create();
+    const auto kvs = KeyValueStoreManager::create();
     kvs->activate();
     kvs->subscribe(device.makeCaller());
-    device.keep(kvs, [kvs]() mutable { kvs.reset(); });
+    device.keep(kvs, [kvs] {});
   };
   check(make, {{"on its queue", &Device::changeUser, "called"},
                {"on its queue, with more deliveries behind", &Device::changeCloud, "called"},
@@ -88,10 +89,13 @@ TEST_F(LastOwnerTest, OfTheStoreManager) {
 
 TEST_F(LastOwnerTest, OfTheObserver) {
   const auto make = [](Device& device) {
-    auto observer = KeyValueStoreCustomObserver::create(
-        {overrideKey}, [&device](KeyValueSource, const auto&) { device.effect(); });
+    const auto observer = KeyValueStoreCustomObserver::create(
+        {overrideKey}, [&device, own = std::make_shared<int>()](KeyValueSource, const auto&) {
+          device.effect();
+          ++*own;
+        });
     observer->start();
-    device.keep(observer, [observer]() mutable { observer.reset(); });
+    device.keep(observer, [observer] {});
   };
   check(make, {{"on the delivery thread", &Device::changeUser, "called"},
                {"on the thread of an outside change", &Device::changeCloud, "called"},
@@ -105,19 +109,19 @@ TEST_F(LastOwnerTest, OfTheDebugManager) {
   const auto make = [](Device& device) {
     const auto kvs = device.makeManager();
     kvs->activate();
-    auto manager = DebugManager::create(kvs);
+    const auto manager = DebugManager::create(kvs);
+    device.platform.cloud->store(flagKey, true);
     manager->activate();
-    device.keep(manager, [manager]() mutable {
+    device.keep(manager, [manager] {
       dropSubscriptions(*manager->kvs);
       letGo(*manager);
-      manager.reset();
     });
   };
   check(make, {{"on main", &Device::fireAlarm, "didReceieve notification"},
                {"on the store manager's queue", &Device::changeUser, "keyValueChanged source"},
-               {"on its queue, at its first step", &Device::switchOn, "Start audio"},
-               {"on its queue, inside a write", &Device::switchOn, "post cloud.storeChanged"},
-               {"on its queue, at its last step", &Device::switchOn, "post pairwell.settingsChanged"}});
+               {"on its queue, at its first step", &Device::fireAlarm, "Stop Audio"},
+               {"on its queue, inside a write", &Device::switchOff, "post cloud.storeChanged"},
+               {"on its queue, at its last step", &Device::switchOff, "post pairwell.settingsChanged"}});
 }
 
 TEST_F(LastOwnerTest, OfASubscriber) {
@@ -153,14 +157,13 @@ TEST_F(LastOwnerTest, OfAHelper) {
 
 TEST_F(LastOwnerTest, OfAConnectionAndItsListener) {
   const auto make = [](Device& device) {
-    auto listener = ConduitListener::create();
+    const auto listener = ConduitListener::create();
     listener->activate();
     device.run();
     const auto client = device.offerClient(7);
     // The connection holds its listener, so both go.
-    device.keep(listener, [&device, listener, client]() mutable {
+    device.keep(listener, [&device, listener, client] {
       device.platform.listeners[0]->clients.clear();
-      listener.reset();
       client->end();
     });
   };

@@ -62,10 +62,8 @@ TEST(SystemVersionNumberTest, ParsesCharactersAsAPersonSeesThem) {
 
 TEST(SystemVersionNumberTest, OrdersByComponentAndEqualsByText) {
   const struct {
-    const char* a;
-    const char* b;
-    bool less;
-    bool greater;
+    const char *a, *b;
+    bool less, greater;
   } pairs[] = {
       {"21A5248v", "21A5248w", true, false}, {"21A5248", "21A5248a", true, false},
       {"20B100", "21A50", true, false},      {"21A200", "21B100", true, false},

@@ -185,9 +185,11 @@ TEST_F(ConduitListenerTest, AnAcceptedCallCompletesThoughClientAndListenerHaveGo
   client->exportedObject->setDistributedLoggingStatus(1, answer());
   client->exportedObject->getDistributedLoggingStatus(answer());
   const std::weak_ptr<Interface> object = client->exportedObject;
-  const std::weak_ptr<ConduitListener> weak = std::exchange(listener, nullptr);
+  const std::weak_ptr<ConduitListener> weak = listener;
   platform.listeners[0]->clients.clear();
   std::exchange(client, nullptr)->end();
+  on(std::exchange(listener, nullptr)->serialQueue,
+     [] {});  // its end is seen to before the calls have their turn
   EXPECT_FALSE(weak.expired()) << "the calls need it";
   mark();
   run();
