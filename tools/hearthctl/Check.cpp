@@ -1,0 +1,245 @@
+#include "tools/hearthctl/Check.hpp"
+
+#include <chrono>
+#include <cmath>
+#include <filesystem>
+#include <map>
+#include <thread>
+#include <utility>
+
+#include "pairwelld/settings/Defaults.hpp"
+#include "platform/linux/Entitlements.hpp"
+#include "platform/linux/Json.hpp"
+#include "platform/linux/LinuxEnvironment.hpp"
+#include "tools/hearthctl/Settings.hpp"
+
+namespace hearthctl {
+namespace {
+
+using pairwell::Defaults;
+using pairwell::KeyValueSource;
+using platform::Dictionary;
+using platform::List;
+using platform::Outcome;
+using platform::Value;
+using platform::linux_::FileSystem;
+using platform::linux_::Paths;
+
+constexpr std::size_t fileLimit = 64 << 20;
+constexpr double lastAlarmSecond = 9223372036;  // a later one has no date, and the daemon takes it for none
+// What a switch writes is written in far less.
+constexpr std::chrono::milliseconds switchTime{300};
+
+const std::string job = "com.kestrel.pairwelld";
+const std::string flagKey(platform::rawValue(Defaults::velaLogCloudCollectionEnabled));
+const std::string endKey(platform::rawValue(Defaults::velaLogCloudCollectionEnabledExpiration));
+
+template <class T>
+const T* field(const Dictionary& dictionary, std::string_view key) {
+  const auto found = dictionary.find(key);
+  return found == dictionary.end() ? nullptr : found->second.as<T>();
+}
+
+bool flagIn(const Dictionary& values) {
+  const auto flag = values.find(flagKey);
+  return flag != values.end() && platform::toBool(flag->second).value_or(false);
+}
+
+std::optional<double> endIn(const Dictionary& values) {
+  const auto found = values.find(endKey);
+  const auto end = found == values.end() ? std::nullopt : platform::toDouble(found->second);
+  return end && *end > 0 && std::trunc(*end) <= lastAlarmSecond ? end : std::nullopt;
+}
+
+struct Finding {
+  std::string problem;
+  std::string remedy;
+};
+
+// A period of limited logging, as it is told in four places.
+struct Period {
+  bool rootFlag = false;
+  bool cloudFlag = false;
+  std::optional<double> end;    // seconds since 1970; absent where the daemon takes it for none
+  std::optional<double> alarm;  // likewise
+};
+
+// One look at everything.
+class Look {
+ public:
+  Look(const Paths& paths_, FileSystem& files_, Hearth& hearth_)
+      : paths(paths_), files(files_), hearth(hearth_) {}
+
+  // Answers the exit code of a hearthd that runs and does not answer.
+  Exit take();
+
+  std::vector<Finding> findings;
+  bool hearthdRuns = true;
+
+ private:
+  void add(std::string problem, std::string remedy) {
+    findings.push_back({std::move(problem), std::move(remedy)});
+  }
+  void lookAtFiles();
+  void lookForDamaged(const std::string& folder);
+  // Empty where there is no file; what is wrong with it is a finding.
+  Dictionary readObject(const std::string& path, const std::string& remedy);
+  std::vector<Alarm> alarmsFromFile();
+  // Absent where a store cannot be read, which is a finding of its own.
+  std::optional<Period> readPeriod(const std::vector<Alarm>& alarms);
+  void judge(const Period& period);
+  void judgeOff(const Period& period);
+
+  const Paths& paths;
+  FileSystem& files;
+  Hearth& hearth;
+};
+
+Exit Look::take() {
+  auto alarms = hearth.alarms();
+  if (!alarms && alarms.error() != Outcome::notConnected) return hearth.fail(alarms.error());
+  hearthdRuns = alarms.has_value();
+  lookAtFiles();
+  if (const auto period = readPeriod(alarms ? *alarms : alarmsFromFile())) judge(*period);
+  for (const auto& grant : platform::linux_::readGrants(files, paths)) {
+    if (!grant.problem.empty()) add(grant.file + " does not count: " + grant.problem, "mend what it names");
+  }
+  return done;
+}
+
+void Look::lookAtFiles() {
+  readObject(paths.device(), "mend it");
+  if (const auto names = files.list(paths.jobs())) {
+    for (const std::string& name : *names) {
+      if (name.ends_with(".json")) readObject(paths.jobs() + "/" + name, "mend it, and start hearthd anew");
+    }
+  }
+  for (const auto source : platform::allCases<KeyValueSource>()) {
+    lookForDamaged(std::filesystem::path(settingsPath(paths, source)).parent_path());
+  }
+  lookForDamaged(paths.hearthd());
+}
+
+void Look::lookForDamaged(const std::string& folder) {
+  const auto names = files.list(folder);
+  if (!names) return;
+  for (const std::string& name : *names) {
+    if (name.find(".json.damaged-") == std::string::npos) continue;
+    add(folder + "/" + name + ": was damaged, and has been moved aside",
+        "mend it, remove its checksum line and move it back, or delete it");
+  }
+}
+
+Dictionary Look::readObject(const std::string& path, const std::string& remedy) {
+  const auto text = platform::linux_::readFile(files, path, fileLimit);
+  if (!text && text.error() == std::errc::no_such_file_or_directory) return {};
+  std::string problem = text ? "" : text.error().message();
+  const auto object = text ? parseObject(*text, problem) : platform::Result<Dictionary>(text.error());
+  if (object) return *object;
+  add(path + ": " + problem, remedy);
+  return {};
+}
+
+// What is no alarm is left out, as there is nothing to compare it with.
+std::vector<Alarm> Look::alarmsFromFile() {
+  const std::string path = paths.hearthd() + "/alarms.json";
+  say("hearthd does not run; the alarms are those of " + path);
+  const Dictionary whole = readObject(path, "mend it before hearthd starts, which would move it aside");
+  const auto* list = field<List>(whole, "alarms");
+  if (!list && !whole.empty()) add(path + ": not a list of alarms", "delete it");
+  std::vector<Alarm> alarms;
+  for (const Value& value : list ? *list : List()) {
+    const auto* entry = value.as<Dictionary>();
+    const auto* date = entry ? field<platform::Date>(*entry, "date") : nullptr;
+    const auto text = [&](const char* key) {
+      const auto* found = field<std::string>(*entry, key);
+      return found ? *found : "";
+    };
+    if (!date) continue;
+    alarms.push_back(
+        {text("job"), text("stream"), text("name"), static_cast<double>(date->nanoseconds) / 1e9});
+  }
+  return alarms;
+}
+
+std::optional<Period> Look::readPeriod(const std::vector<Alarm>& alarms) {
+  std::map<KeyValueSource, Dictionary> contents;
+  for (const auto source : platform::allCases<KeyValueSource>()) {
+    std::string problem;
+    const auto values = Settings(paths, source, files, hearth).values(problem);
+    if (values) {
+      contents[source] = *values;
+    } else {
+      add(settingsPath(paths, source) + ": " + problem,
+          values.error() == Outcome::malformedFile
+              ? "hearthctl settings edit " + std::string(platform::rawValue(source))
+              : "let it be read");
+    }
+  }
+  if (contents.size() < platform::allCases<KeyValueSource>().size()) return std::nullopt;
+  Period period{flagIn(contents[KeyValueSource::root]), flagIn(contents[KeyValueSource::cloud]),
+                endIn(contents[KeyValueSource::cloud]), std::nullopt};
+  for (const Alarm& alarm : alarms) {
+    if (alarm.job == job && alarm.stream == "com.kestrel.alarm" && alarm.name == flagKey)
+      period.alarm = alarm.date;
+  }
+  return period;
+}
+
+void Look::judge(const Period& period) {
+  if (!period.cloudFlag) return judgeOff(period);
+  const std::string restart = hearthdRuns ? "hearthctl jobs restart " + job : "start hearthd";
+  if (!period.rootFlag) add("the cloud flag is on, and the root flag off", restart);
+  if (!period.end) {
+    add("the flag is on without an end time", "pairwellctl logging off");
+  } else if (*period.end < platform::linux_::LinuxClock().now().count()) {
+    add("the end has passed, " + describeTime(*period.end) + ", and the flag is still on",
+        hearthdRuns ? "pairwellctl logging, which ends it" : restart);
+  } else if (!period.alarm) {
+    add("there is no alarm for the end, " + describeTime(*period.end), restart);
+  } else if (*period.alarm != std::trunc(*period.end)) {
+    add("the alarm, " + describeTime(*period.alarm) + ", is not at the end, " + describeTime(*period.end),
+        restart);
+  }
+}
+
+// What a crash between two steps leaves behind, or an absence while another device switched off.
+void Look::judgeOff(const Period& period) {
+  if (period.rootFlag) {
+    add("the root flag is on, and the cloud flag off", "hearthctl settings set root " + flagKey + " false");
+  }
+  if (period.end) {
+    const bool hasPassed = *period.end < platform::linux_::LinuxClock().now().count();
+    add("an end time is left with the flag off, " + describeTime(*period.end) +
+            (hasPassed ? "; the next \"on\" clears it, and a second one is needed"
+                       : "; the next \"on\" takes it up"),
+        "hearthctl settings unset cloud " + endKey);
+  }
+  if (period.alarm) {
+    add("an alarm is left with the flag off, " + describeTime(*period.alarm),
+        hearthdRuns ? "hearthctl alarms cancel " + flagKey
+                    : "start hearthd, then hearthctl alarms cancel " + flagKey);
+  }
+}
+
+}  // namespace
+
+Exit check(Output& output, const Paths& paths, FileSystem& files, Hearth& hearth) {
+  Look look(paths, files, hearth);
+  if (const Exit failure = look.take(); failure != done) return failure;
+  if (!look.findings.empty() && look.hearthdRuns) {
+    // The daemon may be in the middle of a switch: what is wrong for good is still there afterwards.
+    std::this_thread::sleep_for(switchTime);
+    look.findings.clear();
+    if (const Exit failure = look.take(); failure != done) return failure;
+  }
+  for (const Finding& finding : look.findings) {
+    output.add({{"problem", finding.problem}, {"remedy", finding.remedy}},
+               {finding.problem + "\n    remedy: " + finding.remedy});
+  }
+  if (look.findings.empty()) output.add({{"agree", true}}, {"all stores and alarms agree"});
+  output.print();
+  return look.findings.empty() ? done : failed;
+}
+
+}  // namespace hearthctl

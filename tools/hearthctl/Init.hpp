@@ -1,0 +1,27 @@
+// The etc/ of a root: laying it out, and what it grants.
+#pragma once
+
+#include <string>
+
+#include "platform/linux/FileSystem.hpp"
+#include "platform/linux/Paths.hpp"
+#include "tools/hearthctl/Output.hpp"
+
+namespace hearthctl {
+
+struct Device {
+  std::string name;  // empty: the machine's
+  std::string build;
+  bool isInternal = false;
+};
+
+// Device, job and entitlements, for the pairwelld and the pairwellctl that lie beside this program. A file
+// that is there stays as it is.
+Exit init(Output& output, const platform::linux_::Paths& paths, platform::linux_::FileSystem& files,
+          const Device& device);
+
+// Every entitlement file, and if it does not count, why not. Seen as this process's user: the daemon's may
+// trust others.
+Exit listGrants(Output& output, const platform::linux_::Paths& paths, platform::linux_::FileSystem& files);
+
+}  // namespace hearthctl

@@ -1,0 +1,49 @@
+// What hearthctl prints: results on standard output, everything else on standard error.
+#pragma once
+
+#include <string>
+#include <system_error>
+#include <vector>
+
+#include "platform/LogSink.hpp"
+#include "platform/Value.hpp"
+
+namespace hearthctl {
+
+enum Exit { done = 0, failed = 1, wrongUsage = 2, unreachable = 3, refused = 4 };
+
+// Results, each an object for programs and cells of a line for people. Objects are printed at once, lines
+// when all their widths are known.
+class Output {
+ public:
+  explicit Output(bool json_) : json(json_) {}
+  void add(const platform::Dictionary& object, std::vector<std::string> cells);
+  // Prints the lines that were added, in columns.
+  void print();
+
+ private:
+  const bool json;
+  std::vector<std::vector<std::string>> rows;
+};
+
+// One line, "hearthctl: " and the text.
+void say(const std::string& text);
+// Says what went wrong with `what`; the exit code of such an error.
+Exit fail(const std::string& what, std::error_code error);
+
+// Local time as 2026-01-31T23:59:59+0100; a number where no calendar has the moment.
+std::string describeTime(double secondsSince1970);
+
+// Errors of the platform's own pieces, said as ours.
+class SayingLog : public platform::LogSink {
+ public:
+  bool enabled(const platform::LogChannel&, platform::LogLevel level) override {
+    return level == platform::LogLevel::error;
+  }
+  void write(const platform::LogChannel&, platform::LogLevel, std::string_view format,
+             std::span<const platform::LogArgument> arguments) override {
+    say(platform::formatLogMessage(format, arguments, false));
+  }
+};
+
+}  // namespace hearthctl

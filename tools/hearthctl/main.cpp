@@ -1,0 +1,148 @@
+// hearthctl: the operator's command line.
+#include <CLI/CLI.hpp>
+#include <filesystem>
+#include <optional>
+#include <string>
+#include <vector>
+
+#include "platform/linux/LinuxFileSystem.hpp"
+#include "platform/linux/Paths.hpp"
+#include "tools/hearthctl/Check.hpp"
+#include "tools/hearthctl/Hearth.hpp"
+#include "tools/hearthctl/Init.hpp"
+#include "tools/hearthctl/Output.hpp"
+#include "tools/hearthctl/Settings.hpp"
+
+namespace {
+
+using hearthctl::Exit;
+using platform::linux_::HearthOperation;
+
+struct Options {
+  std::string root;
+  bool json = false;
+  hearthctl::Device device{"", "21A5248v", false};
+  std::string source, key, value, type;
+  std::string name, stream;
+  std::vector<std::string> names;
+  std::optional<unsigned> count;
+  std::optional<double> timeout;
+};
+
+void addSettings(CLI::App& app, Options& options) {
+  auto* settings = app.add_subcommand("settings", "read and write the stores")->require_subcommand(1);
+  const auto add = [&](const char* name, const char* text, bool hasKey) {
+    auto* command = settings->add_subcommand(name, text);
+    command->add_option("SOURCE", options.source, "user, root or cloud")
+        ->required()
+        ->check(CLI::IsMember({"user", "root", "cloud"}));
+    if (hasKey) command->add_option("KEY", options.key)->required();
+    return command;
+  };
+  add("list", "print every key with its value", false);
+  add("get", "print a value; exit 1 if there is none", true);
+  auto* set = add("set", "store a value", true);
+  set->add_option("VALUE", options.value)->required();
+  set->add_option("--type", options.type, "what VALUE is; by default what it looks like")
+      ->check(CLI::IsMember({"bool", "int", "double", "string"}));
+  add("unset", "remove a key", true);
+  add("edit", "edit all values in $VISUAL or $EDITOR", false);
+}
+
+void addNotify(CLI::App& app, Options& options) {
+  auto* notify = app.add_subcommand("notify", "named notifications")->require_subcommand(1);
+  notify->add_subcommand("post", "post one")->add_option("NAME", options.name)->required();
+  auto* watch = notify->add_subcommand("watch", "print each name when it is posted");
+  watch->add_option("NAME", options.names)->required();
+  watch->add_option("--count", options.count, "end after so many")->check(CLI::PositiveNumber);
+  watch
+      ->add_option("--timeout", options.timeout,
+                   "end after so many seconds; exit 3 if --count is not reached")
+      ->check(CLI::Range(0.0, 1e6));
+}
+
+void addCommands(CLI::App& app, Options& options) {
+  auto* init = app.add_subcommand("init", "lay out etc/ of a root; files that are there are kept");
+  init->add_option("--device-name", options.device.name, "by default the machine's host name");
+  init->add_option("--build", options.device.build, "the operating system's build")->capture_default_str();
+  init->add_flag("--internal", options.device.isInternal, "an internal build of the operating system");
+  auto* jobs = app.add_subcommand("jobs", "print the jobs, or control one")->require_subcommand(0, 1);
+  for (const char* action : {"start", "stop", "restart"}) {
+    jobs->add_subcommand(action, std::string(action) + " a job")
+        ->add_option("NAME", options.name)
+        ->required();
+  }
+  addSettings(app, options);
+  addNotify(app, options);
+  auto* alarms = app.add_subcommand("alarms", "print the alarms, or cancel some")->require_subcommand(0, 1);
+  alarms->add_subcommand("cancel", "cancel all of a name")->add_option("NAME", options.name)->required();
+  auto* event = app.add_subcommand("event", "deliver an event by hand");
+  event->add_option("STREAM", options.stream)->required();
+  event->add_option("NAME", options.name)->required();
+  app.add_subcommand("grants", "print what is granted to which program, and what does not count");
+  app.add_subcommand("check", "say whether stores and alarms agree; exit 1 if not");
+}
+
+Exit runSettings(const std::string& command, const Options& options, hearthctl::Settings settings,
+                 hearthctl::Output& output) {
+  if (command == "list") return settings.list(output);
+  if (command == "get") return settings.get(output, options.key);
+  if (command == "unset") return settings.set(options.key, std::nullopt);
+  if (command == "edit") return settings.edit();
+  const auto value = hearthctl::valueFromText(options.value, options.type);
+  if (value) return settings.set(options.key, *value);
+  hearthctl::say("\"" + options.value + "\" is no " + options.type);
+  return hearthctl::wrongUsage;
+}
+
+// `part` is the subcommand's own, or empty.
+Exit run(const std::string& command, const std::string& part, const Options& options) {
+  const auto paths = platform::linux_::Paths::under(options.root);
+  platform::linux_::LinuxFileSystem files(nullptr);
+  hearthctl::Hearth hearth(paths);
+  hearthctl::Output output(options.json);
+  if (command == "init") return hearthctl::init(output, paths, files, options.device);
+  if (command == "grants") return hearthctl::listGrants(output, paths, files);
+  if (command == "check") return hearthctl::check(output, paths, files, hearth);
+  if (command == "event")
+    return hearth.perform(HearthOperation::deliverEvent, {options.stream, options.name});
+  if (command == "alarms")
+    return part.empty() ? hearth.listAlarms(output) : hearth.cancelAlarms(output, options.name);
+  if (command == "jobs")
+    return part.empty() ? hearth.listJobs(output)
+                        : hearth.perform(HearthOperation::controlJob, {part, options.name});
+  if (command == "notify") {
+    if (part == "post") return hearth.perform(HearthOperation::post, {options.name});
+    return hearth.watch(output, options.names, options.count, options.timeout);
+  }
+  const auto source = *platform::fromRawValue<pairwell::KeyValueSource>(options.source);
+  return runSettings(part, options, {paths, source, files, hearth}, output);
+}
+
+}  // namespace
+
+int main(int count, char** arguments) {
+  Options options;
+  CLI::App app("Operates hearthd and the settings of a device.", "hearthctl");
+  app.fallthrough();  // --json and --root may come last
+  app.require_subcommand(1);
+  app.add_option("--root", options.root, "the folder of the device; by default the system's")
+      ->envname("HEARTH_ROOT");
+  app.add_flag("--json", options.json, "print one JSON object a line");
+  app.failure_message([](const CLI::App*, const CLI::Error& error) {
+    return "hearthctl: " + std::string(error.what()) + "\n";
+  });
+  addCommands(app, options);
+  try {
+    app.parse(count, arguments);
+  } catch (const CLI::ParseError& error) {
+    return app.exit(error) == 0 ? hearthctl::done : hearthctl::wrongUsage;
+  }
+
+  if (!options.root.empty()) options.root = std::filesystem::absolute(options.root).lexically_normal();
+  hearthctl::SayingLog log;
+  platform::installLogSink(log);
+  const CLI::App& command = *app.get_subcommands().front();
+  const auto parts = command.get_subcommands();
+  return run(command.get_name(), parts.empty() ? "" : parts.front()->get_name(), options);
+}
