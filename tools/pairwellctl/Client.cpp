@@ -46,15 +46,15 @@ platform::Result<platform::List> Client::call(const std::string& operation, cons
                            timeout, what);
 }
 
-std::optional<platform::Time> Client::end() const {
+double Client::end() const {
   platform::linux_::LinuxFileSystem files(nullptr);
   platform::linux_::LinuxClock clock;
   platform::NotificationCentre centre;
   const auto cloud = platform::linux_::ReplicaFileCloudStore::create(files, nullptr, centre, clock,
                                                                      paths.cloudSettings(cloudIdentifier));
-  const platform::Time end(
-      cloud->doubleForKey(platform::rawValue(pairwell::Defaults::velaLogCloudCollectionEnabledExpiration)));
-  return end > clock.now() ? std::optional(end) : std::nullopt;
+  const double end =
+      cloud->doubleForKey(platform::rawValue(pairwell::Defaults::velaLogCloudCollectionEnabledExpiration));
+  return end > clock.now().count() ? end : 0;
 }
 
 std::error_code Client::watch(const std::function<std::error_code()>& changed, std::string& what) const {

@@ -3,7 +3,6 @@
 
 #include <chrono>
 #include <functional>
-#include <optional>
 #include <string>
 
 #include "platform/Result.hpp"
@@ -23,8 +22,8 @@ class Client {
   platform::Result<platform::List> call(const std::string& operation, const platform::List& arguments,
                                         std::string& what) const;
 
-  // When the logging will end, where the caller may read that and it will.
-  std::optional<platform::Time> end() const;
+  // When the logging will end, in seconds since 1970, where the caller may read that; 0 otherwise.
+  double end() const;
 
   // Calls `changed` at each settings-changed notification until it fails, or hearthd ends.
   std::error_code watch(const std::function<std::error_code()>& changed, std::string& what) const;

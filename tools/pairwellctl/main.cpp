@@ -51,8 +51,8 @@ std::string describeSpan(std::int64_t seconds) {
   return text;
 }
 
-std::string describeTime(platform::Time time) {
-  const auto seconds = static_cast<std::time_t>(time.count());
+std::string describeTime(double time) {
+  const auto seconds = static_cast<std::time_t>(time);
   std::tm local{};
   localtime_r(&seconds, &local);
   char text[40];
@@ -93,18 +93,18 @@ std::error_code printLogging(const Client& client, const Options& options, std::
   const auto result = client.call("KestrelAudioAccessoryLimitedLogging", {}, what);
   if (!result) return result.error();
   const bool on = *result->at(0).as<bool>();
-  const auto end = on ? client.end() : std::nullopt;
+  const double end = on ? client.end() : 0;
   const double now =
       std::chrono::duration<double>(std::chrono::system_clock::now().time_since_epoch()).count();
   if (options.json) {
     Dictionary object{{"logging", on}};
-    if (end) object.insert({{"end", end->count()}, {"remaining", end->count() - now}});
+    if (end > 0) object.insert({{"end", end}, {"remaining", end - now}});
     printJson(object);
   } else {
     std::string line = on ? "on" : "off";
-    if (end) {
-      const auto left = static_cast<std::int64_t>(std::ceil(end->count() - now));
-      line += " until " + describeTime(*end) + " (in " + describeSpan(left) + ")";
+    if (end > 0) {
+      const auto left = static_cast<std::int64_t>(std::ceil(end - now));
+      line += " until " + describeTime(end) + " (in " + describeSpan(left) + ")";
     }
     print(line);
   }
