@@ -165,15 +165,27 @@ TEST_F(LastOwnerTest, OfAConnectionAndItsListener) {
     device.keep(listener, [&device, listener, client] {
       device.platform.listeners[0]->clients.clear();
       client->end();
+      if (!listener->serialQueue->isCurrent()) on(listener->serialQueue, [] {});
     });
   };
-  const auto object = [](Device& device) { return device.platform.listeners[0]->clients[0]->exportedObject; };
-  const auto read = [&](Device& device) { object(device)->getDistributedLoggingStatus([](auto, auto) {}); };
-  const auto write = [&](Device& device) {
-    object(device)->setDistributedLoggingStatus(1, [&device](auto) { device.effect(); });
+  using Interface = platform::RadixUserControllerInterface;
+  const auto ask = [](auto operation, bool thenDrop) {
+    return [operation, thenDrop](Device& device) {
+      operation(*device.platform.listeners[0]->clients[0]->exportedObject);
+      if (thenDrop) device.drop();
+    };
   };
-  check(make, {{"on a worker", read, "logging status"},
-               {"on a worker, in the answer", write, "called"},
+  const auto readStatus = [](Interface& object) { object.getDistributedLoggingStatus([](auto, auto) {}); };
+  const auto writeStatus = [](Interface& object) { object.setDistributedLoggingStatus(1, [](auto) {}); };
+  const auto read = [](Interface& object) { object.kestrelAudioAccessoryLimitedLogging([](auto, auto) {}); };
+  const auto write = [](Interface& object) {
+    object.setKestrelAudioAccessoryLimitedLogging(true, [](auto) {});
+  };
+  check(make, {{"before a status read has its turn", ask(readStatus, true), "-"},
+               {"before a status write has its turn", ask(writeStatus, true), "-"},
+               {"before a read has its turn", ask(read, true), "-"},
+               {"before a write has its turn", ask(write, true), "-"},
+               {"on a worker", ask(write, false), "Enable Kestrel"},
                {"on the listener's queue", [](Device& device) { device.offerClient(8, {}); }, "denied, 8"}});
 }
 

@@ -47,7 +47,7 @@ void dropSubscriptions(Publisher& publisher) PW_NO_ANALYSIS {
 struct Subscriber : KeyValueStoreManagerSubscribing, SystemNotificationManagerSubscribing {
   Subscriber(std::string label_, Calls& calls_) : label(std::move(label_)), calls(calls_) {}
   void keyValueChanged(KeyValueSource source, const std::vector<std::string>& keys) override {
-    called(platform::rawValue(source), keys.empty() ? "-" : keys.size() > 1 ? "many" : keys.front());
+    called(platform::rawValue(source), keys.empty() ? "-" : keys.size() == 1 ? keys[0] : "many");
   }
   void didReceiveNotification(SystemNotificationSource source, std::string_view name) override {
     called(platform::rawValue(source), name);
@@ -99,9 +99,7 @@ class World : public testing::Test {
   std::shared_ptr<DebugManager> makeDebugManager() {
     auto kvs = makeManager();
     kvs->activate();
-    return activated(DebugManager::create(kvs));
-  }
-  std::shared_ptr<DebugManager> activated(std::shared_ptr<DebugManager> manager) {
+    auto manager = DebugManager::create(kvs);
     manager->activate();
     platform.cutSubscriptions.push_back([manager] { letGo(*manager); });
     return manager;

@@ -39,7 +39,7 @@ class Device : public World {
     if (draw(4) == 0) return replaceLength();
     for (int burst = draw(3); burst >= 0; --burst) say(draw(2) == 0);
   }
-  // The new length is for the next period: one that runs is ended first, or started anew by the switch.
+  // A length is for the next period, so one that runs is ended first.
   void replaceLength() {
     say(false);
     length = 60 + draw(1000);
