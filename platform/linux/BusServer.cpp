@@ -324,10 +324,8 @@ class BusServer::State : public BusSessionHost, public std::enable_shared_from_t
   std::shared_ptr<BusSession> add(UniqueDescriptor socket, PeerIdentity peer) {
     const std::uint64_t number = nextSession++;
     ++perUser[peer.uid];
-    const int process = peer.process ? peer.process->get() : -1;
     auto session = std::make_shared<BusSession>(*this, number, std::move(socket), std::move(peer));
     sessions[number].session = session;
-    if (process >= 0) control(EPOLL_CTL_ADD, process, EPOLLIN, processTag(number));
     return session;
   }
 
@@ -356,6 +354,9 @@ class BusServer::State : public BusSessionHost, public std::enable_shared_from_t
     Entry& entry = sessions.at(session.number);
     entry.events = session.wantedEvents();
     control(EPOLL_CTL_ADD, session.socket(), entry.events, socketTag(session.number));
+    // Only now, and behind the socket: a client that has gone since it connected still has its say.
+    if (const auto& process = session.peer().process)
+      control(EPOLL_CTL_ADD, process->get(), EPOLLIN, processTag(session.number));
     changed(session.number);
   }
 
