@@ -1,0 +1,141 @@
+// A server on a thread of its own, and clients that write what they like.
+#pragma once
+
+#include <gtest/gtest.h>
+
+#include <chrono>
+#include <condition_variable>
+#include <cstdint>
+#include <functional>
+#include <memory>
+#include <mutex>
+#include <optional>
+#include <string>
+#include <string_view>
+#include <thread>
+#include <vector>
+
+#include "platform/LogSink.hpp"
+#include "platform/linux/BusServer.hpp"
+#include "platform/linux/EventLoop.hpp"
+
+namespace platform::linux_ {
+
+// After this long a condition is taken to be never met.
+inline constexpr std::chrono::seconds deadline{20};
+inline constexpr std::chrono::hours never{1};
+
+// The lines of the whole process.
+class RecordedLog : public LogSink {
+ public:
+  static RecordedLog& installed();
+  bool enabled(const LogChannel&, LogLevel) override { return true; }
+  void write(const LogChannel&, LogLevel, std::string_view format, std::span<const LogArgument>) override;
+  std::size_t count(std::string_view part);
+
+ private:
+  std::mutex mutex;
+  std::vector<std::string> lines;  // guarded by `mutex`
+};
+
+// A folder that is gone with its owner.
+class TemporaryFolder {
+ public:
+  TemporaryFolder();
+  ~TemporaryFolder();
+  const std::string path;
+};
+
+struct CallOptions {
+  std::string path = "/test";
+  std::string interface = "test.Interface";
+  std::uint8_t flags = 0;
+  std::uint32_t serial = 1;
+};
+inline constexpr std::uint8_t noReplyExpected = 1;
+
+// A client's whole handshake, as libraries send it ahead.
+inline constexpr std::string_view handshakeAhead{"\0AUTH EXTERNAL\r\nDATA\r\nBEGIN\r\n", 29};
+
+// A method call with a text as its argument, written by hand: libraries refuse to make bad ones.
+std::string callMessage(const std::string& member, const std::string& text, const CallOptions& options = {});
+
+// What came back: a return, an error with its name, or a signal with its.
+struct Answer {
+  int type = 0;
+  std::uint32_t serial = 0;  // of the call
+  std::string name;
+  std::string text;  // the first result
+};
+
+// A client's end. Reads give up at the deadline, which fails the test.
+class Wire {
+ public:
+  explicit Wire(const std::string& path);
+  int descriptor() const { return socket.get(); }
+  // False once the server has closed.
+  bool send(std::string_view bytes);
+  // Sends the handshake ahead, and waits to be let in.
+  void shakeHands();
+  std::optional<Answer> next();  // absent at the end
+  std::string readToEnd();
+  bool waitForHangUp();  // both directions closed
+  void close() { socket.reset(); }
+  void closeOutput();
+  // Whether a call is answered.
+  bool isServed();
+
+ private:
+  bool fill(std::size_t size);
+
+  UniqueDescriptor socket;
+  std::string received;
+};
+
+UniqueDescriptor listenAt(const std::string& path);
+bool eventually(const std::function<bool()>& condition);  // for what nobody announces
+std::size_t openDescriptors();
+std::size_t residentBytes();
+
+// Operations: Echo answers at once, Hold when the test says so, Wide takes a t. Every client is admitted,
+// unless the test decides.
+class World : public testing::Test {
+ protected:
+  explicit World(limits::Patience patience = {never, never, never, never});
+  ~World() override;
+
+  // On the loop's thread; waits for it.
+  void onLoop(const std::function<void()>& work);
+  bool waitFor(const std::function<bool()>& condition);  // is asked with `mutex` held
+  Wire client();                                         // admitted, and through the handshake
+  void complete(std::size_t index);                      // the held call of that index, with its text
+  BusServer::Admission admission();
+  void endServer();
+
+  struct Held {
+    std::string text;
+    BusCompletion completion;
+  };
+  class Handler;
+
+  RecordedLog& log = RecordedLog::installed();
+  TemporaryFolder folder;
+  const std::string path = folder.path + "/socket";
+  UniqueDescriptor hearthsOwn;  // as a service manager keeps the socket of its job
+
+  std::mutex mutex;  // guards everything below, up to the loop
+  std::condition_variable changed;
+  std::vector<std::string> calls;
+  std::vector<Held> held;
+  std::vector<BusServer::Decide> undecided;
+  bool decides = true;
+  int closed = 0;
+
+  EventLoop loop;
+  std::vector<std::shared_ptr<BusConnection>> connections;  // the loop's thread's, in order of admission
+  std::unique_ptr<BusServer> server;
+  EventSource watch;
+  std::thread thread;
+};
+
+}  // namespace platform::linux_
