@@ -138,10 +138,8 @@ bool CloudBursts::write(Dictionary& entries, const CloudWrite& write) {
   if (!joins(entries, write)) {
     if (isEcho(write)) return false;
     stamp = {std::max(microsecondsOf(write.now), greatestOf(entries).microseconds + 1), 0};
-    keys.clear();
     expiring.clear();
   }
-  keys.insert(write.key);
   lastWrite = write.now;
   return place(entries, write);
 }
@@ -168,7 +166,7 @@ bool CloudBursts::expire(Dictionary& entries, const CloudWrite& write, const std
 bool CloudBursts::joins(const Dictionary& entries, const CloudWrite& write) const {
   if (!lastWrite || write.now < *lastWrite || write.now - *lastWrite > quiet) return false;
   const auto there = CloudEntry::find(entries, write.key);
-  return !keys.contains(write.key) && !(there && there->stamp >= stamp);
+  return !there || there->stamp < stamp;
 }
 
 bool CloudBursts::place(Dictionary& entries, const CloudWrite& write) {

@@ -3,7 +3,6 @@
 
 #include <cstdint>
 #include <optional>
-#include <set>
 #include <string>
 #include <string_view>
 #include <vector>
@@ -86,7 +85,6 @@ class CloudBursts {
 
   CloudStamp stamp;
   std::optional<Time> lastWrite;  // absent: there is no burst that a write could join
-  std::set<std::string> keys;     // written in the burst
   std::string expiring;           // the companion whose removal belongs to the last expiry
 };
 

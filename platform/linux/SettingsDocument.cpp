@@ -5,6 +5,7 @@
 #include <cstdint>
 #include <cstdio>
 #include <optional>
+#include <utility>
 
 #include "platform/linux/Json.hpp"
 
@@ -113,7 +114,9 @@ std::vector<std::string> differingKeys(const Dictionary& a, const Dictionary& b)
   return keys;
 }
 
-void carryOver(const Dictionary& before, const Dictionary& after, Dictionary& into) {
+namespace {
+
+void carryOverEntries(const Dictionary& before, const Dictionary& after, Dictionary& into) {
   for (const std::string& key : differingKeys(before, after)) {
     if (const auto found = after.find(key); found != after.end()) {
       into.insert_or_assign(key, found->second);
@@ -121,6 +124,15 @@ void carryOver(const Dictionary& before, const Dictionary& after, Dictionary& in
       into.erase(key);
     }
   }
+}
+
+}  // namespace
+
+void carryOver(const Dictionary& before, const Dictionary& after, Dictionary& into) {
+  Dictionary values = settingsValues(std::as_const(into));
+  carryOverEntries(settingsValues(before), settingsValues(after), values);
+  carryOverEntries(before, after, into);
+  if (into.contains(valuesEntry)) into[valuesEntry] = std::move(values);
 }
 
 }  // namespace platform::linux_

@@ -32,7 +32,7 @@ bool sameValue(const Value& a, const Value& b);
 // The keys that only one of the two has, or whose values differ; sorted.
 std::vector<std::string> differingKeys(const Dictionary& a, const Dictionary& b);
 
-// Makes the changes that lead from `before` to `after` in `into`, too.
+// Makes the changes that lead from one document to another in a third, too; those of "values" key by key.
 void carryOver(const Dictionary& before, const Dictionary& after, Dictionary& into);
 
 }  // namespace platform::linux_

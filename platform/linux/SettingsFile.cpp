@@ -190,13 +190,10 @@ void SettingsFile::finishWrite(const Dictionary& before, const Dictionary& next,
 bool SettingsFile::recordOwnChange(const Dictionary& before, const Dictionary& next, bool written) {
   if (written || sameValue(*document, next)) {
     Dictionary known = *reported;
-    Dictionary values = settingsValues(std::as_const(known));
-    carryOver(settingsValues(before), settingsValues(next), values);
     carryOver(before, next, known);
-    settingsValues(known) = std::move(values);
     reported = std::make_shared<const Dictionary>(std::move(known));
   }
-  return std::exchange(lookAfterwards, false) || !sameValue(*reported, *document);
+  return !sameValue(*reported, *document);
 }
 
 Result<void> SettingsFile::setValue(std::string_view key, const std::optional<Value>& value) {
@@ -240,8 +237,7 @@ void SettingsFile::look() {
   Document before, after;
   {
     std::lock_guard lock(mutex);
-    // The file may hold an own change that is not recorded yet; its writer looks when it is.
-    lookAfterwards = writing;
+    // The file may hold an own change that is not recorded yet. Its writer looks for others' when it is.
     if (writing || !reported) return;
     before = std::exchange(reported, document);
     after = document;

@@ -78,9 +78,8 @@ class SettingsFile : public std::enable_shared_from_this<SettingsFile> {
   bool lastGoodInForce = false;  // the file is missing because it was damaged
   std::error_code failure;       // of the last read
   bool writing = false;
-  bool lookAfterwards = false;  // an event came while writing
-  bool unsynced = false;        // the last write failed, perhaps after its rename
-  Document reported;            // what `changed` has heard of, own writes included; null without a watch
+  bool unsynced = false;  // the last write failed, perhaps after its rename
+  Document reported;      // what `changed` has heard of, own writes included; null without a watch
 
   std::unique_ptr<FolderWatch> watch;  // ends first
 };
