@@ -33,6 +33,7 @@ class MemoryFileSystem : public platform::linux_::FileSystem {
   int calls = 0;
   int failFrom = std::numeric_limits<int>::max();
   int failure = EIO;
+  std::function<void()> onFolderSync;  // where another thread gets its chance: a file has just been replaced
   std::set<std::string> unreadable, immovable;  // paths that cannot be opened; or renamed
 
   // Everything that was not synced is gone, and all works again. Objects of before belong to a dead process.
@@ -98,6 +99,7 @@ class MemoryFileSystem : public platform::linux_::FileSystem {
     return {};
   }
   Result<void> syncFolder(const std::string& path) override {
+    if (onFolderSync) onFolderSync();
     if (const int error = check(path)) return code(error);
     const auto inFolder = [&](const auto& entry) { return parentOf(entry.first) == path; };
     std::erase_if(durable, inFolder);

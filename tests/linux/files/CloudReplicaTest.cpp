@@ -18,6 +18,7 @@ struct Device {
     const bool news = bursts.write(
         entries,
         {key, value, known == lastKnown.end() ? std::nullopt : std::optional(known->second), now, name});
+    now += disk;
     bursts.finished(now);
     lastKnown[key] = value;
     return news;
@@ -43,7 +44,7 @@ struct Device {
   }
 
   std::string name;
-  Time now{1000};
+  Time now{1000}, disk{0};  // the clock, and how long a write takes
   Dictionary entries;
   CloudBursts bursts;
   std::map<std::string, std::optional<Value>> lastKnown;
@@ -87,9 +88,12 @@ TEST(CloudReplicaTest, WhatIsWrittenTogetherSharesOneTimestamp) {
   EXPECT_GT(second, first) << "a second value";
   device.write("end", 1);
   EXPECT_EQ(device.stamp("end"), second);
+  device.disk = Time(5);
   device.now += Time(0.026);
   device.write("third", 2);
   EXPECT_GT(device.stamp("third"), second);
+  device.write("end", 2);
+  EXPECT_EQ(device.stamp("end"), device.stamp("third")) << "a slow disk parts nothing";
 
   Device neighbour("d");
   neighbour.entries = device.entries;
@@ -98,7 +102,7 @@ TEST(CloudReplicaTest, WhatIsWrittenTogetherSharesOneTimestamp) {
   EXPECT_GT(neighbour.stamp("flag"), device.stamp("third")) << "though its clock is behind";
   device.entries = neighbour.entries;
   EXPECT_TRUE(device.write("flag", 7)) << "not lost on what has overtaken the burst";
-  EXPECT_EQ(device.values(), R"(["end": 1, "flag": 7, "third": 2])");
+  EXPECT_EQ(device.values(), R"(["end": 2, "flag": 7, "third": 2])");
 }
 
 TEST(CloudReplicaTest, ExpiryRanksRightAfterTheSwitchThatItEnds) {
@@ -134,6 +138,10 @@ TEST(CloudReplicaTest, ExpiryRanksRightAfterTheSwitchThatItEnds) {
   EXPECT_EQ(away.stamp("flag").tick, 0);
   home.exchange(away);
   EXPECT_EQ(home.values(), R"(["flag": false, "other": 1])");
+
+  away.switchOn(20000);
+  away.now += Time(60);
+  EXPECT_TRUE(away.write("flagExpiration", std::nullopt)) << "the last expiry is over";
 }
 
 TEST(CloudReplicaTest, MergingTakesTheGreaterInWhateverOrder) {

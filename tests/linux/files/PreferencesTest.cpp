@@ -74,7 +74,9 @@ TEST_F(PreferencesTest, OutsideChangeIsReportedOnceWithExactlyTheKeysThatDiffer)
 TEST_F(PreferencesTest, ForeignChangeFirstMetInAnOwnWriteIsReportedLaterAndOnce) {
   neighbour->setValue(1, "a");
   neighbour->setValue(1, "b");
+  files.onFolderSync = [&] { files.deliverEvents(); };
   store->setValue(2, "b");
+  files.onFolderSync = nullptr;
   EXPECT_THAT(observer->take(), ElementsAre("b")) << "the own one, from inside the write";
   device.runAll();
   EXPECT_THAT(observer->take(), ElementsAre("a")) << "without any event";

@@ -38,6 +38,9 @@ class ReplicaFileCloudStoreTest : public World {
 };
 
 TEST_F(ReplicaFileCloudStoreTest, OutsideChangeIsAnnouncedOnceAndAnOwnOneNever) {
+  EXPECT_FALSE(store->boolForKey("never"));
+  store->setValue(std::nullopt, "never");
+  EXPECT_TRUE(device.delivery->isEmpty()) << "an echo gives nobody work";
   store->setValue(true, "flag");
   EXPECT_THAT(announced(), IsEmpty());
   neighbour->setValue(5.5, "end");
@@ -84,6 +87,10 @@ TEST_F(ReplicaFileCloudStoreTest, EchoOfATypedReadLeavesTheEntry) {
   store->setValue(true, "flag");
   EXPECT_EQ(entry("flag"), before);
   EXPECT_TRUE(store->synchronise());
+  store->setValue(1, "written");
+  neighbour->setValue(2, "written");
+  store->setValue(1, "written");
+  EXPECT_EQ(neighbour->doubleForKey("written"), 2) << "an echo of what it wrote";
   const auto other = open(nullptr);
   static_cast<void>(other->dictionaryRepresentation());
   other->setValue(true, "flag");

@@ -58,14 +58,18 @@ TEST_F(SettingsFileTest, DamageIsMovedAsideWhileTheLastGoodContentsStayInForce) 
 }
 
 TEST_F(SettingsFileTest, DamageThatCannotBeMovedIsNotOverwritten) {
+  const auto file = open();
+  ASSERT_TRUE(file->setValue("good", 1));
   files.put(path, "?");
   files.immovable.insert(path);
-  const auto file = open();
-  EXPECT_EQ(stored(*file), Dictionary{});
-  EXPECT_EQ(stored(*file), Dictionary{});
+  EXPECT_EQ(stored(*file), (Dictionary{{"good", 1}}));
+  EXPECT_EQ(stored(*file), (Dictionary{{"good", 1}}));
   EXPECT_EQ(logged().size(), 1u) << "not at each read";
   EXPECT_EQ(file->setValue("a", 1).error(), Outcome::malformedFile);
   EXPECT_EQ(files.bytes(path), "?");
+  files.immovable.clear();
+  EXPECT_EQ(stored(*open()), Dictionary{});
+  EXPECT_EQ(stored(*file), (Dictionary{{"good", 1}})) << "though another process has moved it";
 }
 
 TEST_F(SettingsFileTest, NoSingleFlippedBitChangesWhatIsServed) {
@@ -129,10 +133,12 @@ TEST_F(SettingsFileTest, NeighboursWriteIsReadThoughItsEventsAreHeldBack) {
   }
   files.put(path, R"({"values": {}})");
   EXPECT_EQ(stored(*ours), Dictionary{});
-  ASSERT_TRUE(files.remove(path));
-  ASSERT_TRUE(theirs->setValue("key", 1));
-  ASSERT_TRUE(files.remove(path));
-  EXPECT_EQ(stored(*ours), Dictionary{}) << "a missing file is an empty one";
+  for (int value = 1; value < 4; ++value) {
+    ASSERT_TRUE(theirs->setValue("key", value));
+    EXPECT_EQ(stored(*ours), (Dictionary{{"key", value}}));
+    ASSERT_TRUE(files.remove(path) && files.syncFolder("/var/settings"));
+    EXPECT_EQ(stored(*ours), Dictionary{}) << "a missing file is an empty one";
+  }
 }
 
 // Cuts a write at every call that it makes; then its process ends, or loses its power, or tries again.
