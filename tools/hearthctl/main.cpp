@@ -140,6 +140,7 @@ int main(int count, char** arguments) {
   }
 
   if (!options.root.empty()) options.root = std::filesystem::absolute(options.root).lexically_normal();
+  if (options.root.size() > 1 && options.root.ends_with('/')) options.root.pop_back();
   hearthctl::SayingLog log;
   platform::installLogSink(log);
   const CLI::App& command = *app.get_subcommands().front();
