@@ -58,7 +58,8 @@ class HearthctlTest : public testing::Test {
     for (const char* program : {"hearthctl", "hearthd", "pairwelld", "pairwellctl"}) {
       fs::copy_file(fs::path(PROGRAMS) / program, root / "bin" / program);
     }
-    ::setenv("TZ", "UTC", 1);
+    ::setenv("TZ", "EAST-1", 1);
+    ::setenv("EDITOR", "false", 1);
   }
   ~HearthctlTest() override {
     if (hearthd > 0) {
@@ -188,7 +189,7 @@ TEST_F(HearthctlTest, CheckNamesEachResidueWithItsRemedy) {
       {"true", "false", "", "", "root flag is on, and the cloud",
        "hearthctl settings set root " + flag + " false"},
       {"false", "true", "4000000000.5", "4000000000", "cloud flag is on, and the root", "start hearthd"},
-      {"false", "false", "4000000000.5", "", "2096-10-02T07:06:40+0000; the next \"on\" takes it up",
+      {"false", "false", "4000000000.5", "", "2096-10-02T08:06:40+0100; the next \"on\" takes it up",
        "hearthctl settings unset cloud " + end},
       {"false", "false", "1000000000", "", "a second one is needed", "hearthctl settings unset cloud " + end},
       {"false", "false", "", "4000000000", "alarm is left", "hearthctl alarms cancel " + flag},
@@ -253,17 +254,23 @@ TEST_F(HearthctlTest, RunningDeviceIsOperated) {
   run({"init", "--device-name", "test"});
   start();
   EXPECT_THAT(run({"jobs"}).output, HasSubstr("com.kestrel.pairwelld  running  "));
-  const auto watch =
-      spawn("hearthctl", {"notify", "watch", "other", "com.kestrel.bluetooth.prefsChanged", "--count", "1"},
-            "watch");
-  // The watch has begun once it prints.
+  const std::string name = "com.kestrel.bluetooth.prefsChanged";
+  const auto endless = spawn("hearthctl", {"notify", "watch", name}, "endless");
+  const auto counted = spawn("hearthctl", {"notify", "watch", "other", name, "--count", "1"}, "counted");
+  // A watch has begun once it prints.
   EXPECT_TRUE(eventually([&] {
     EXPECT_EQ(run({"settings", "set", "root", "key", "1"}).errors, "");
-    return contents(root / "watch.out") != "";
+    return contents(root / "counted.out") != "" && contents(root / "endless.out") != "";
   }));
-  EXPECT_EQ(finish(watch, "watch").output, "com.kestrel.bluetooth.prefsChanged\n");
+  ::kill(endless, SIGTERM);
+  EXPECT_EQ(finish(endless, "endless").status, -1);
+  const Outcome watched = finish(counted, "counted");
+  EXPECT_EQ(watched.status, 0);
+  EXPECT_EQ(watched.output, name + "\n");
   EXPECT_EQ(run({"notify", "watch", "never", "--count", "1", "--timeout", "0.01"}).status, 3);
-  EXPECT_EQ(run({"event", "com.kestrel.nobody", "x"}).status, 1);
+  const Outcome unknown = run({"event", "com.kestrel.nobody", "x"});
+  EXPECT_EQ(unknown.status, 1);
+  EXPECT_THAT(unknown.errors, HasSubstr("hearthd.sock: no job consumes com.kestrel.nobody\n"));
 
   EXPECT_EQ(finish(spawn("pairwellctl", {"logging", "on"}, "client"), "client").status, 0);
   EXPECT_TRUE(eventually([&] { return run({"alarms"}).output != ""; }));
