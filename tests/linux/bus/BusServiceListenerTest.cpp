@@ -118,12 +118,12 @@ TEST_F(BusServiceListenerTest, TheClientsOperationsAreCalledAndItsEndIsToldOnce)
 }
 
 TEST_F(BusServiceListenerTest, EveryClientThatIsRefusedIsToldSo) {
+  const std::size_t before = openDescriptors();
   resumes = false;
   EXPECT_EQ(refusal(), Outcome::notPermitted) << "accepted, but never resumed";
   resumes = true;
   accepts = false;
   EXPECT_EQ(refusal(), Outcome::notPermitted);
-  const std::size_t before = openDescriptors();
   for (int count = 0; count < 600; ++count) ASSERT_EQ(refusal(), Outcome::notPermitted) << count;
   const std::string refused = "REJECTED EXTERNAL\r\nREJECTED EXTERNAL\r\nREJECTED EXTERNAL\r\n";
   for (unsigned count = 0; count < 400; ++count) {

@@ -3,6 +3,7 @@
 
 #include <gtest/gtest.h>
 
+#include <atomic>
 #include <chrono>
 #include <condition_variable>
 #include <cstdint>
@@ -128,7 +129,7 @@ class World : public testing::Test {
   std::vector<std::string> calls;
   std::vector<Held> held;
   std::vector<BusServer::Decide> undecided;
-  bool decides = true;
+  std::atomic<bool> decides = true;
   int closed = 0;
 
   EventLoop loop;
