@@ -278,6 +278,25 @@ TEST_F(BusServerTest, AtTheDescriptorLimitClientsWaitUntilOthersEnd) {
   EXPECT_EQ(::setrlimit(RLIMIT_NOFILE, &limit), 0);
 }
 
+TEST_F(BusServerTest, OneUsersConnectionsAreLimitedAndOneThatEndsMakesRoom) {
+  rlimit limit{};
+  ASSERT_EQ(::getrlimit(RLIMIT_NOFILE, &limit), 0);
+  if (limit.rlim_max < 4 * limits::connectionsPerUser) GTEST_SKIP() << "takes more descriptors";
+  const rlimit high{limit.rlim_max, limit.rlim_max};
+  ASSERT_EQ(::setrlimit(RLIMIT_NOFILE, &high), 0);
+  Wire first = client();
+  decides = false;
+  std::vector<Wire> wires;
+  while (wires.size() < limits::connectionsPerUser - 1) wires.emplace_back(path);
+  EXPECT_EQ(Wire(path).readToEnd(), "");
+  EXPECT_TRUE(first.isServed());
+  first.close();
+  ASSERT_TRUE(waitFor([&] { return closed == 1; }));
+  decides = true;
+  EXPECT_TRUE(client().isServed());
+  EXPECT_EQ(::setrlimit(RLIMIT_NOFILE, &limit), 0);
+}
+
 // Without patience.
 class HastyBusServerTest : public World {
  protected:
