@@ -262,6 +262,7 @@ TEST_F(HearthctlTest, RunningDeviceIsOperated) {
     EXPECT_EQ(run({"settings", "set", "root", "key", "1"}).errors, "");
     return contents(root / "counted.out") != "" && contents(root / "endless.out") != "";
   }));
+  EXPECT_TRUE(contents(root / "endless.out").ends_with(name + "\n")) << "a full buffer ends anywhere";
   ::kill(endless, SIGTERM);
   EXPECT_EQ(finish(endless, "endless").status, -1);
   const Outcome watched = finish(counted, "counted");
