@@ -90,8 +90,9 @@ void PairwellDaemon::registerForFirstUnlock() {
 void PairwellDaemon::activateServices() {
   keyValueStoreManager->activate();
   debugManager()->activate();
-  conduitListener()->debugManager = debugManager();
-  conduitListener()->activate();
+  const auto listener = conduitListener();
+  listener->debugManager = debugManager();
+  listener->activate();
 }
 
 const std::optional<std::string>& serviceName() {

@@ -19,7 +19,8 @@ class TarnNotificationHelper {
   // The names, compared exactly, and what runs for each.
   std::map<std::string, Callback> notificationHandlers;
 
-  // Stops the process when the platform has no centre.
+  // Stops the process when the platform has no centre. The platform's names are texts, so one construction
+  // serves both kinds of key.
   static std::shared_ptr<TarnNotificationHelper> create(std::map<std::string, Callback> notificationHandlers);
   TarnNotificationHelper(const TarnNotificationHelper&) = delete;
   TarnNotificationHelper& operator=(const TarnNotificationHelper&) = delete;

@@ -24,7 +24,8 @@ class NamedNotifications {
   using Handler = std::function<void(std::int32_t token)>;
   virtual std::uint32_t registerHandler(std::string_view name, std::int32_t& token,
                                         std::shared_ptr<WorkQueue> queue, Handler handler) = 0;
-  // A call already queued may still come. A token that is not registered is ignored.
+  // A call already queued still comes, but for one on the main queue: what runs there relies on it that a
+  // registration which it has cancelled is done with. A token that is not registered is ignored.
   virtual void cancel(std::int32_t token) = 0;
 };
 

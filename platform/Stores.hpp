@@ -15,7 +15,8 @@ namespace platform {
 class KeyObserver {
  public:
   virtual ~KeyObserver() = default;
-  // A value at `keyPath` of `object`, the store, has changed; old and new values are not delivered.
+  // A value at `keyPath` of `object`, the store, has changed; old and new values are not delivered, and
+  // there is no context.
   virtual void observeValue(const std::optional<std::string>& keyPath, const void* object) = 0;
 };
 

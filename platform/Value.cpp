@@ -57,8 +57,8 @@ std::string describe(double value) {
   if (std::isinf(value)) return value < 0 ? "-inf" : "inf";
   const double magnitude = std::fabs(value);
   // Plain shortest output would write 100000.0 as 1e+05, so the notation is chosen here.
-  const bool exponent = magnitude >= 1e16 || (magnitude != 0 && magnitude < 1e-4);
-  char buffer[64];
+  const bool exponent = magnitude >= 1e16;
+  char buffer[400];  // the least double has some 340 characters
   const auto [end, error] =
       std::to_chars(buffer, buffer + sizeof buffer, value,
                     exponent ? std::chars_format::scientific : std::chars_format::fixed);

@@ -28,6 +28,8 @@ DebugManager::DebugManager(std::shared_ptr<KeyValueStoreManager> kvs_)
       serialQueue(platform::current().queues().serial("com.kestrel.pairwell.kvs.serialQueue",
                                                       platform::QueueRank::state)) {}
 
+// The subscription to alarms is not given back: its handle, as the other, holds this object, so that the
+// destructor runs only where both lists have let go already; and its publisher lives as long as the process.
 DebugManager::~DebugManager() {
   if (!kvsSubscription) return;
   kvsSubscription->unsubscribe([](const std::optional<std::error_code>& error) {

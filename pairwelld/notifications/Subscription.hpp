@@ -46,7 +46,8 @@ class Subscription {
   }
 
  private:
-  std::shared_ptr<Subscriber> _subscriber;
+  std::shared_ptr<Subscriber>
+      _subscriber;  // read through subscriber(): a list assigns handles, others do not
   platform::UUID identifier;
   UnsubscribeBlock unsubscribeBlock;
 };

@@ -39,7 +39,8 @@ class SystemNotificationManager : public std::enable_shared_from_this<SystemNoti
   virtual ~SystemNotificationManager() = default;
 
   // Any thread. The fraction of a second is dropped, so an alarm may fire up to a second early. A time
-  // without an alarm date is rejected with a logged error, and an earlier alarm of the name stays as it was.
+  // without an alarm date is rejected with a logged error, and an earlier alarm of the name stays as it was:
+  // a clamped date would fire at a moment that nobody asked for.
   virtual void scheduleAlarm(std::string_view name, platform::Time date);
   virtual void scheduleAlarm(std::string_view name, double secondsSince1970);
   virtual void cancelAlarm(std::string_view name);

@@ -23,7 +23,8 @@ std::optional<std::vector<std::string>> changedKeys(const platform::Dictionary& 
   return value ? platform::toTexts(*value) : std::nullopt;
 }
 
-// Missing or no integer, it is one of those that are ignored.
+// Missing or no integer, it is one of those that are ignored: whoever posted it has not said that values
+// changed.
 bool reportsValues(const platform::Dictionary& userInfo) {
   const auto value = entry(userInfo, CloudStore::changeReasonKey);
   const auto reason = value ? platform::toInteger(*value) : std::nullopt;

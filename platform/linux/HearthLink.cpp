@@ -24,7 +24,8 @@ void logError(const BusReply& reply, const BusOperation& operation) {
 // order in which the registrations changed; nothing of others is called, or destroyed, under it.
 class HearthLink::State : public std::enable_shared_from_this<State> {
  public:
-  State(EventLoop& io_, std::function<void()> lost_) : io(io_), lost(std::move(lost_)) {}
+  State(EventLoop& io_, std::shared_ptr<WorkQueue> mainQueue_, std::function<void()> lost_)
+      : io(io_), mainQueue(std::move(mainQueue_)), lost(std::move(lost_)) {}
 
   void open(UniqueDescriptor socket) {
     auto shared =
@@ -153,15 +154,16 @@ class HearthLink::State : public std::enable_shared_from_this<State> {
     for (const auto& [token, registration] : registrations) {
       if (registration->name != name || registration->queued) continue;
       registration->queued = true;
-      registration->queue->async([weak = weak_from_this(), weakRegistration = std::weak_ptr(registration)] {
+      registration->queue->async([weak = weak_from_this(), registration = registration] {
         auto self = weak.lock();
-        auto live = weakRegistration.lock();
-        if (!self || !live) return;
+        if (!self) return;
         {
           std::lock_guard lock(self->mutex);
-          live->queued = false;
+          registration->queued = false;
+          const bool isCancelled = !self->registrations.contains(registration->token);
+          if (isCancelled && registration->queue == self->mainQueue) return;
         }
-        live->handler(live->token);
+        registration->handler(registration->token);
       });
     }
   }
@@ -206,6 +208,7 @@ class HearthLink::State : public std::enable_shared_from_this<State> {
   }
 
   EventLoop& io;
+  const std::shared_ptr<WorkQueue> mainQueue;
   const std::function<void()> lost;
   std::unique_ptr<AsyncBusClient> client;  // the loop's thread's
 
@@ -225,7 +228,9 @@ Result<std::unique_ptr<HearthLink>> HearthLink::inherit(EventLoop& io, std::shar
 
 HearthLink::HearthLink(EventLoop& io_, UniqueDescriptor socket, std::shared_ptr<WorkQueue> mainQueue_,
                        std::function<void()> lost_)
-    : io(io_), mainQueue(std::move(mainQueue_)), state(std::make_shared<State>(io_, std::move(lost_))) {
+    : io(io_),
+      mainQueue(std::move(mainQueue_)),
+      state(std::make_shared<State>(io_, mainQueue, std::move(lost_))) {
   state->open(std::move(socket));
 }
 

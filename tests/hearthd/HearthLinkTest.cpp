@@ -244,9 +244,17 @@ TEST_F(HearthLinkTest, PostsMergeUntilHandledAndStopAfterCancel) {
   emit(HearthSignal::notification, {"n"});
   settle();
   EXPECT_THAT(service->seen(), testing::Not(testing::Contains("Unwatch n")));
-  link->cancel(second);  // its call is queued
+  const auto elsewhere = std::make_shared<ManualQueue>();
+  std::int32_t third = 0;
+  EXPECT_EQ(link->registerHandler("n", third, elsewhere, record), 0u);
+  emit(HearthSignal::notification, {"n"});
+  settle();
+  link->cancel(second);
+  link->cancel(third);
   queue->run();
-  EXPECT_EQ(calls.size(), 2u);
+  EXPECT_EQ(calls.size(), 2u) << "on the main queue a cancelled one is done with";
+  elsewhere->run();
+  EXPECT_EQ(calls.back(), third) << "elsewhere a queued call still comes";
   EXPECT_TRUE(service->waitFor("Unwatch n"));
 }
 
