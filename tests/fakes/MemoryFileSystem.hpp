@@ -47,39 +47,35 @@ class MemoryFileSystem : public platform::linux_::FileSystem {
     pending.clear();
     failFrom = std::numeric_limits<int>::max();
   }
-  // The file has these bytes, durably, as a new file put in the old one's place.
+  // The file has these bytes, as a new file put in the old one's place; all names are durable.
   void put(const std::string& path, std::string_view bytes) {
-    for (std::string folder = parentOf(path); !hasFolder(folder); folder = parentOf(folder)) {
-      now[folder] = durable[folder] = std::make_shared<Node>(inodes);
-    }
-    const auto node = std::make_shared<Node>(inodes);
-    node->bytes = node->synced = bytes;
-    now[path] = durable[path] = node;
-    happened(path);
+    makeFolders(parentOf(path));
+    now[path] = std::make_shared<Node>(inodes);
+    now[path]->bytes = now[path]->synced = bytes;
+    durable = now;
+    pending.push_back(path);
   }
   std::string bytes(const std::string& path) const { return now.at(path)->bytes; }
   bool exists(const std::string& path) const { return now.contains(path); }
   // Events are held back until now.
   void deliverEvents() {
     for (const std::string& path : std::exchange(pending, {})) {
-      const auto current = watches;
-      for (const Watched& watch : current) {
-        if (!watch.token.expired() && watch.folder == parentOf(path))
-          watch.changed(path.substr(watch.folder.size() + 1));
+      for (const Watched& watch : std::vector(watches)) {
+        if (watch.token.expired() || watch.folder != parentOf(path)) continue;
+        watch.changed(path.substr(watch.folder.size() + 1));
       }
     }
   }
 
   Result<std::unique_ptr<File>> openToRead(const std::string& path) override {
     if (const int error = unreadable.contains(path) ? EACCES : check(path)) return code(error);
-    return std::unique_ptr<File>(std::make_unique<OpenFile>(*this, path, now[path]));
+    return open(path);
   }
   Result<std::unique_ptr<File>> create(const std::string& path) override {
     const int error = check(path);
-    if (error != ENOENT) return code(error != 0 ? error : EEXIST);
-    if (!hasFolder(parentOf(path))) return code(ENOENT);
+    if (error != ENOENT || !hasFolder(parentOf(path))) return code(error != 0 ? error : EEXIST);
     now[path] = std::make_shared<Node>(inodes);
-    return std::unique_ptr<File>(std::make_unique<OpenFile>(*this, path, now[path]));
+    return open(path);
   }
   Result<FileIdentity> identity(const std::string& path) override {
     if (const int error = check(path)) return code(error);
@@ -89,13 +85,13 @@ class MemoryFileSystem : public platform::linux_::FileSystem {
     if (const int error = immovable.contains(from) ? EPERM : check(from)) return code(error);
     now[to] = now[from];
     now.erase(from);
-    happened(to);
+    pending.push_back(to);
     return {};
   }
   Result<void> remove(const std::string& path) override {
     if (const int error = check(path)) return code(error);
     now.erase(path);
-    happened(path);
+    pending.push_back(path);
     return {};
   }
   Result<void> syncFolder(const std::string& path) override {
@@ -110,9 +106,7 @@ class MemoryFileSystem : public platform::linux_::FileSystem {
   }
   Result<void> makeFolder(const std::string& path) override {
     if (const int error = check(path); error != ENOENT) return code(error);
-    for (std::string folder = path; !hasFolder(folder); folder = parentOf(folder)) {
-      now[folder] = std::make_shared<Node>(inodes);
-    }
+    makeFolders(path);
     return {};
   }
   Result<std::vector<std::string>> list(const std::string& folder) override {
@@ -126,19 +120,18 @@ class MemoryFileSystem : public platform::linux_::FileSystem {
   // One that is held cannot be waited for on a single thread.
   Result<std::unique_ptr<FileLock>> lock(const std::string& path) override {
     const int error = check(path);
-    if (error != 0 && error != ENOENT) return code(error);
-    if (!hasFolder(parentOf(path))) return code(ENOENT);
-    if (!now.contains(path)) now[path] = std::make_shared<Node>(inodes);
+    if (error != 0 && (error != ENOENT || !hasFolder(parentOf(path)))) return code(error);
+    if (error != 0) now[path] = std::make_shared<Node>(inodes);
     if (!locks[path].expired()) return code(EDEADLK);
-    const auto token = std::make_shared<int>();
-    locks[path] = token;
-    return std::unique_ptr<FileLock>(std::make_unique<Held<FileLock>>(token));
+    auto held = std::make_unique<Held<FileLock>>();
+    locks[path] = held->token;
+    return std::unique_ptr<FileLock>(std::move(held));
   }
   Result<std::unique_ptr<FolderWatch>> watch(const std::string& folder, Changed changed) override {
     if (const int error = check(folder)) return code(error);
-    const auto token = std::make_shared<int>();
-    watches.push_back({token, folder, std::move(changed)});
-    return std::unique_ptr<FolderWatch>(std::make_unique<Held<FolderWatch>>(token));
+    auto held = std::make_unique<Held<FolderWatch>>();
+    watches.push_back({held->token, folder, std::move(changed)});
+    return std::unique_ptr<FolderWatch>(std::move(held));
   }
 
  private:
@@ -153,8 +146,7 @@ class MemoryFileSystem : public platform::linux_::FileSystem {
     std::uint64_t inode = 1;
   };
   struct OpenFile : File {
-    OpenFile(MemoryFileSystem& owner_, std::string path_, std::shared_ptr<Node> node_)
-        : owner(owner_), path(std::move(path_)), node(std::move(node_)) {}
+    OpenFile(MemoryFileSystem& owner_, std::shared_ptr<Node> node_) : owner(owner_), node(std::move(node_)) {}
     Result<FileIdentity> identity() override {
       if (const int error = owner.count()) return code(error);
       return node->identity();
@@ -166,9 +158,7 @@ class MemoryFileSystem : public platform::linux_::FileSystem {
     }
     Result<void> writeAll(std::string_view bytes) override {
       const int error = owner.count();
-      // What fails has got half of its way.
-      node->bytes += error != 0 ? bytes.substr(0, bytes.size() / 2) : bytes;
-      owner.happened(path);
+      node->bytes += error != 0 ? bytes.substr(0, bytes.size() / 2) : bytes;  // a failure got half of its way
       return code(error);
     }
     Result<void> sync() override {
@@ -177,21 +167,17 @@ class MemoryFileSystem : public platform::linux_::FileSystem {
       return {};
     }
     MemoryFileSystem& owner;
-    const std::string path;
     const std::shared_ptr<Node> node;
   };
-  // Lasts as long as its token lives.
   template <class Registration>
   struct Held : Registration {
-    explicit Held(std::shared_ptr<int> token_) : token(std::move(token_)) {}
-    const std::shared_ptr<int> token;
+    const std::shared_ptr<int> token = std::make_shared<int>();
   };
   struct Watched {
     std::weak_ptr<int> token;
     std::string folder;
     Changed changed;
   };
-  using Names = std::map<std::string, std::shared_ptr<Node>>;
 
   static std::error_code code(int error) { return {error, std::system_category()}; }
   static std::string parentOf(const std::string& path) {
@@ -201,16 +187,21 @@ class MemoryFileSystem : public platform::linux_::FileSystem {
   bool hasFolder(const std::string& path) const {
     return path == "/" || (now.contains(path) && hasFolder(parentOf(path)));
   }
+  void makeFolders(const std::string& path) {
+    if (hasFolder(path)) return;
+    makeFolders(parentOf(path));
+    now[path] = std::make_shared<Node>(inodes);
+  }
+  std::unique_ptr<File> open(const std::string& path) { return std::make_unique<OpenFile>(*this, now[path]); }
   int count() { return ++calls >= failFrom ? failure : 0; }
   int check(const std::string& path) {
     const int error = count();
     return error != 0 ? error : path == "/" || now.contains(path) ? 0 : ENOENT;
   }
-  void happened(const std::string& path) { pending.push_back(path); }
 
   const std::shared_ptr<std::set<std::uint64_t>> inodes = std::make_shared<std::set<std::uint64_t>>();
+  std::map<std::string, std::shared_ptr<Node>> now, durable;  // folders are entries, too
   std::map<std::string, std::weak_ptr<int>> locks;
-  Names now, durable;  // folders are entries, too
   std::vector<Watched> watches;
   std::vector<std::string> pending;
 };

@@ -78,8 +78,8 @@ TEST_F(SharedFilesTest, NeighboursWritesAreReportedOnceWhileOneWritesOneself) {
   const auto counter = std::make_shared<Counter>();
   std::thread delivery([&] { loop.run(); });
   auto store = FileUserPreferences::create(watched, &loop, path);
-  for (int number = 0; number < 25; ++number) store->addObserver(counter, "other" + std::to_string(number));
   store->addObserver(counter, "last");
+  for (int number = 0; number < 25; ++number) store->addObserver(counter, "other" + std::to_string(number));
   std::thread neighbour([this] { writeKeys("other"); });
   for (int number = 0; number < 25; ++number) store->setValue(number, "own" + std::to_string(number));
   neighbour.join();
