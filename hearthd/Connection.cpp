@@ -11,6 +11,7 @@ namespace hearth {
 namespace {
 
 using platform::List;
+using platform::Value;
 using platform::linux_::BusError;
 using platform::linux_::BusReply;
 using platform::linux_::HearthOperation;
@@ -168,7 +169,7 @@ BusReply Connection::listJobs() const {
     rows.push_back(
         List{job->description().name, describe(job->state()), std::int64_t{job->pid()}, job->detail()});
   }
-  return List{std::move(rows)};
+  return List{Value(std::move(rows))};  // clang 14 takes a bare list for the whole
 }
 
 BusReply Connection::listAlarms() const {
@@ -176,7 +177,7 @@ BusReply Connection::listAlarms() const {
   for (const Alarm& alarm : manager.listAlarms()) {
     rows.push_back(List{alarm.key.job, alarm.key.stream, alarm.key.name, alarm.date.nanoseconds});
   }
-  return List{std::move(rows)};
+  return List{Value(std::move(rows))};  // clang 14 takes a bare list for the whole
 }
 
 }  // namespace hearth
