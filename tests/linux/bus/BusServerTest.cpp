@@ -243,10 +243,16 @@ TEST_F(BusServerTest, WhatComesTooLateIsHarmless) {
   Wire last = client();
   ASSERT_TRUE(last.send(callMessage("Hold", "")));
   ASSERT_TRUE(waitFor([&] { return held.size() == 1; }));
-  endServer();
-  EXPECT_EQ(closed, 3);
-  complete(0);
+  decides = false;
+  const Wire undecidedToTheEnd(path);
+  ASSERT_TRUE(waitFor([&] { return undecided.size() == 3; }));
+  onLoop([&] { server->drain([] {}); });
   undecided[1](admission());
+  EXPECT_TRUE(waitFor([&] { return closed == 3; })) << "of the client that draining closed";
+  endServer();
+  EXPECT_EQ(closed, 4);
+  complete(0);
+  undecided[2](admission());
   EXPECT_EQ(last.readToEnd(), "");
 }
 
