@@ -13,7 +13,7 @@
 #include "platform/linux/LinuxEnvironment.hpp"
 #include "tools/hearthctl/Settings.hpp"
 
-namespace hearthctl {
+namespace tools {
 namespace {
 
 using pairwell::Defaults;
@@ -242,4 +242,4 @@ Exit check(Output& output, const Paths& paths, FileSystem& files, Hearth& hearth
   return look.findings.empty() ? done : failed;
 }
 
-}  // namespace hearthctl
+}  // namespace tools

@@ -6,7 +6,7 @@
 #include <cstdint>
 #include <utility>
 
-namespace hearthctl {
+namespace tools {
 namespace {
 
 using platform::Dictionary;
@@ -106,7 +106,7 @@ void Hearth::announceRootChange() {
 }
 
 Exit Hearth::fail(std::error_code error) const {
-  if (answer.empty()) return hearthctl::fail(socket, error);
+  if (answer.empty()) return tools::fail(socket, error);
   say(socket + ": " + answer);
   return error == Outcome::notPermitted ? refused : failed;
 }
@@ -131,4 +131,4 @@ Exit Hearth::watch(Output& output, const std::vector<std::string>& names, std::o
   return done;
 }
 
-}  // namespace hearthctl
+}  // namespace tools

@@ -12,9 +12,9 @@
 #include "platform/linux/BusClient.hpp"
 #include "platform/linux/HearthInterface.hpp"
 #include "platform/linux/Paths.hpp"
-#include "tools/hearthctl/Output.hpp"
+#include "tools/Output.hpp"
 
-namespace hearthctl {
+namespace tools {
 
 struct Alarm {
   std::string job;
@@ -52,4 +52,4 @@ class Hearth {
   std::string answer;  // the error that hearthd answered, if it was that
 };
 
-}  // namespace hearthctl
+}  // namespace tools

@@ -10,7 +10,7 @@
 #include "platform/linux/Entitlements.hpp"
 #include "platform/linux/Json.hpp"
 
-namespace hearthctl {
+namespace tools {
 namespace {
 
 namespace fs = std::filesystem;
@@ -109,4 +109,4 @@ Exit listGrants(Output& output, const platform::linux_::Paths& paths, FileSystem
   return done;
 }
 
-}  // namespace hearthctl
+}  // namespace tools

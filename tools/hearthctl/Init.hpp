@@ -5,9 +5,9 @@
 
 #include "platform/linux/FileSystem.hpp"
 #include "platform/linux/Paths.hpp"
-#include "tools/hearthctl/Output.hpp"
+#include "tools/Output.hpp"
 
-namespace hearthctl {
+namespace tools {
 
 struct Device {
   std::string name;  // empty: the machine's
@@ -24,4 +24,4 @@ Exit init(Output& output, const platform::linux_::Paths& paths, platform::linux_
 // trust others.
 Exit listGrants(Output& output, const platform::linux_::Paths& paths, platform::linux_::FileSystem& files);
 
-}  // namespace hearthctl
+}  // namespace tools

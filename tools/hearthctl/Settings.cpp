@@ -18,7 +18,7 @@
 #include "platform/linux/SettingsDocument.hpp"
 #include "platform/linux/SettingsFile.hpp"
 
-namespace hearthctl {
+namespace tools {
 namespace {
 
 using pairwell::KeyValueSource;
@@ -214,4 +214,4 @@ Result<void> Settings::installWhole(const Dictionary& document) {
   });
 }
 
-}  // namespace hearthctl
+}  // namespace tools

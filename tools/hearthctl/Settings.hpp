@@ -10,10 +10,10 @@
 #include "platform/Value.hpp"
 #include "platform/linux/FileSystem.hpp"
 #include "platform/linux/Paths.hpp"
+#include "tools/Output.hpp"
 #include "tools/hearthctl/Hearth.hpp"
-#include "tools/hearthctl/Output.hpp"
 
-namespace hearthctl {
+namespace tools {
 
 std::string settingsPath(const platform::linux_::Paths& paths, pairwell::KeyValueSource source);
 
@@ -56,4 +56,4 @@ class Settings {
   Hearth& hearth;
 };
 
-}  // namespace hearthctl
+}  // namespace tools

@@ -7,21 +7,21 @@
 
 #include "platform/linux/LinuxFileSystem.hpp"
 #include "platform/linux/Paths.hpp"
+#include "tools/Output.hpp"
 #include "tools/hearthctl/Check.hpp"
 #include "tools/hearthctl/Hearth.hpp"
 #include "tools/hearthctl/Init.hpp"
-#include "tools/hearthctl/Output.hpp"
 #include "tools/hearthctl/Settings.hpp"
 
 namespace {
 
-using hearthctl::Exit;
 using platform::linux_::HearthOperation;
+using tools::Exit;
 
 struct Options {
   std::string root;
   bool json = false;
-  hearthctl::Device device{"", "21A5248v", false};
+  tools::Device device{"", "21A5248v", false};
   std::string source, key, value, type;
   std::string name, stream;
   std::vector<std::string> names;
@@ -83,27 +83,27 @@ void addCommands(CLI::App& app, Options& options) {
   app.add_subcommand("check", "say whether stores and alarms agree; exit 1 if not");
 }
 
-Exit runSettings(const std::string& command, const Options& options, hearthctl::Settings settings,
-                 hearthctl::Output& output) {
+Exit runSettings(const std::string& command, const Options& options, tools::Settings settings,
+                 tools::Output& output) {
   if (command == "list") return settings.list(output);
   if (command == "get") return settings.get(output, options.key);
   if (command == "unset") return settings.set(options.key, std::nullopt);
   if (command == "edit") return settings.edit();
-  const auto value = hearthctl::valueFromText(options.value, options.type);
+  const auto value = tools::valueFromText(options.value, options.type);
   if (value) return settings.set(options.key, *value);
-  hearthctl::say("\"" + options.value + "\" is no " + options.type);
-  return hearthctl::wrongUsage;
+  tools::say("\"" + options.value + "\" is no " + options.type);
+  return tools::wrongUsage;
 }
 
 // `part` is the subcommand's own, or empty.
 Exit run(const std::string& command, const std::string& part, const Options& options) {
   const auto paths = platform::linux_::Paths::under(options.root);
   platform::linux_::LinuxFileSystem files(nullptr);
-  hearthctl::Hearth hearth(paths);
-  hearthctl::Output output(options.json);
-  if (command == "init") return hearthctl::init(output, paths, files, options.device);
-  if (command == "grants") return hearthctl::listGrants(output, paths, files);
-  if (command == "check") return hearthctl::check(output, paths, files, hearth);
+  tools::Hearth hearth(paths);
+  tools::Output output(options.json);
+  if (command == "init") return tools::init(output, paths, files, options.device);
+  if (command == "grants") return tools::listGrants(output, paths, files);
+  if (command == "check") return tools::check(output, paths, files, hearth);
   if (command == "event")
     return hearth.perform(HearthOperation::deliverEvent, {options.stream, options.name});
   if (command == "alarms")
@@ -136,12 +136,12 @@ int main(int count, char** arguments) {
   try {
     app.parse(count, arguments);
   } catch (const CLI::ParseError& error) {
-    return app.exit(error) == 0 ? hearthctl::done : hearthctl::wrongUsage;
+    return app.exit(error) == 0 ? tools::done : tools::wrongUsage;
   }
 
   if (!options.root.empty()) options.root = std::filesystem::absolute(options.root).lexically_normal();
   if (options.root.size() > 1 && options.root.ends_with('/')) options.root.pop_back();
-  hearthctl::SayingLog log;
+  tools::SayingLog log;
   platform::installLogSink(log);
   const CLI::App& command = *app.get_subcommands().front();
   const auto parts = command.get_subcommands();

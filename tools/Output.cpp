@@ -1,6 +1,7 @@
-#include "tools/hearthctl/Output.hpp"
+#include "tools/Output.hpp"
 
 #include <algorithm>
+#include <cerrno>
 #include <cmath>
 #include <cstdio>
 #include <ctime>
@@ -8,7 +9,7 @@
 #include "platform/Result.hpp"
 #include "platform/linux/Json.hpp"
 
-namespace hearthctl {
+namespace tools {
 namespace {
 
 void printLine(const std::string& line) {
@@ -51,7 +52,9 @@ void Output::print() {
   rows.clear();
 }
 
-void say(const std::string& text) { std::fprintf(stderr, "hearthctl: %s\n", text.c_str()); }
+void say(const std::string& text) {
+  std::fprintf(stderr, "%s: %s\n", ::program_invocation_short_name, text.c_str());
+}
 
 Exit fail(const std::string& what, std::error_code error) {
   say(what + ": " + error.message());
@@ -72,4 +75,4 @@ std::string describeTime(double secondsSince1970) {
   return text;
 }
 
-}  // namespace hearthctl
+}  // namespace tools

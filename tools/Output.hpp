@@ -1,4 +1,4 @@
-// What hearthctl prints: results on standard output, everything else on standard error.
+// What the command lines print: results on standard output, everything else on standard error.
 #pragma once
 
 #include <string>
@@ -8,7 +8,7 @@
 #include "platform/LogSink.hpp"
 #include "platform/Value.hpp"
 
-namespace hearthctl {
+namespace tools {
 
 enum Exit { done = 0, failed = 1, wrongUsage = 2, unreachable = 3, refused = 4 };
 
@@ -26,7 +26,7 @@ class Output {
   std::vector<std::vector<std::string>> rows;
 };
 
-// One line, "hearthctl: " and the text.
+// One line, the program's name and the text.
 void say(const std::string& text);
 // Says what went wrong with `what`; the exit code of such an error.
 Exit fail(const std::string& what, std::error_code error);
@@ -46,4 +46,4 @@ class SayingLog : public platform::LogSink {
   }
 };
 
-}  // namespace hearthctl
+}  // namespace tools
