@@ -32,7 +32,8 @@ class SettingsFile : public std::enable_shared_from_this<SettingsFile> {
   // `files` outlives the object.
   static std::shared_ptr<SettingsFile> create(FileSystem& files, std::string path);
 
-  // What is stored at this moment. Takes no lock of the file's; an error only where it cannot be read at all.
+  // What is stored at this moment. Takes the file's lock only to move damage aside; an error only where the
+  // file cannot be read at all.
   Result<Document> read();
   // The same, but a failure is logged (once, until it is another) and the last good contents answer.
   Document contents();
