@@ -268,13 +268,14 @@ TEST_F(BusServerTest, NothingWakesAServerThatNoLongerListens) {
 
 TEST_F(BusServerTest, AtTheDescriptorLimitClientsWaitUntilOthersEnd) {
   constexpr std::size_t clients = 30;
+  const std::size_t before = log.count("accepting rests");
   rlimit limit{};
   ASSERT_EQ(::getrlimit(RLIMIT_NOFILE, &limit), 0);
   const rlimit low{openDescriptors() + clients + limits::spareDescriptors + 20, limit.rlim_max};
   std::vector<Wire> wires;
   ASSERT_EQ(::setrlimit(RLIMIT_NOFILE, &low), 0);
   while (wires.size() < clients) wires.emplace_back(path);
-  EXPECT_TRUE(eventually([&] { return log.count("accepting rests") == 1; }));
+  EXPECT_TRUE(eventually([&] { return log.count("accepting rests") > before; }));
   // Each one that ends lets the next one in.
   for (Wire& wire : wires) {
     wire.shakeHands();
