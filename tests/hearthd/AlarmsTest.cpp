@@ -150,7 +150,8 @@ TEST_F(AlarmsTest, ReadsBackWhatItWroteWithGenerationsGoingOn) {
   entry["date"] = "soon";
   for (const platform::Value& bad :
        {platform::Value(), with("lastGeneration", "x"), with("lastGeneration", 0), with("alarms", 1),
-        with("alarms", platform::List{platform::List()}), with("alarms", platform::List{entry})}) {
+        with("alarms", platform::List{platform::Value(platform::List())}),
+        with("alarms", platform::List{entry})}) {
     EXPECT_FALSE(Alarms::fromValue(bad)) << platform::describe(bad);
   }
 }
