@@ -20,74 +20,13 @@ const Logger& log() {
   return logger;
 }
 
-// What stock clients ask of a bus before their first call; they are content with these answers.
-int answerHello(sd_bus_message* message, void* self, sd_bus_error*) {
-  const std::string name = ":1." + std::to_string(static_cast<BusSession*>(self)->number);
-  return sd_bus_reply_method_return(message, "s", name.c_str());
-}
-int answerNothing(sd_bus_message* message, void*, sd_bus_error*) {
-  return sd_bus_reply_method_return(message, "");
-}
-int answerOwner(sd_bus_message* message, void*, sd_bus_error*) {
-  return sd_bus_reply_method_return(message, "s", ":1.0");
-}
-int answerRunning(sd_bus_message* message, void*, sd_bus_error*) {
-  constexpr std::uint32_t alreadyRunning = 2;
-  return sd_bus_reply_method_return(message, "u", alreadyRunning);
-}
-const sd_bus_vtable busTable[] = {
-    SD_BUS_VTABLE_START(0),
-    SD_BUS_METHOD("Hello", "", "s", answerHello, SD_BUS_VTABLE_UNPRIVILEGED),
-    SD_BUS_METHOD("AddMatch", "s", "", answerNothing, SD_BUS_VTABLE_UNPRIVILEGED),
-    SD_BUS_METHOD("RemoveMatch", "s", "", answerNothing, SD_BUS_VTABLE_UNPRIVILEGED),
-    SD_BUS_METHOD("GetNameOwner", "s", "s", answerOwner, SD_BUS_VTABLE_UNPRIVILEGED),
-    SD_BUS_METHOD("StartServiceByName", "su", "u", answerRunning, SD_BUS_VTABLE_UNPRIVILEGED),
-    SD_BUS_VTABLE_END,
-};
-
 bool sendAll(int socket, std::string_view bytes) {
   // A fresh socket takes a handshake whole, and one that does not is not read by anyone.
   return ::send(socket, bytes.data(), bytes.size(), MSG_NOSIGNAL | MSG_DONTWAIT) ==
          static_cast<ssize_t>(bytes.size());
 }
 
-std::vector<sd_bus_vtable> makeTable(const BusInterface& interface) {
-  std::vector<sd_bus_vtable> table{SD_BUS_VTABLE_START(0)};
-  for (const BusOperation& operation : interface.operations) {
-    table.push_back(SD_BUS_METHOD("", "", "", nullptr, SD_BUS_VTABLE_UNPRIVILEGED));
-    auto& method = table.back().x.method;
-    method.member = operation.name.c_str();
-    method.signature = operation.arguments.c_str();
-    method.result = operation.results.c_str();
-    method.handler = [](sd_bus_message* message, void* session, sd_bus_error*) {
-      return static_cast<BusSession*>(session)->call(message);
-    };
-  }
-  for (const BusSignal& signal : interface.signals) {
-    table.push_back(SD_BUS_SIGNAL("", "", 0));
-    table.back().x.signal.member = signal.name.c_str();
-    table.back().x.signal.signature = signal.arguments.c_str();
-  }
-  table.push_back(SD_BUS_VTABLE_END);
-  return table;
-}
-
-std::string randomIdentifier() {
-  sd_id128_t identifier{};
-  sd_id128_randomize(&identifier);
-  char text[SD_ID128_STRING_MAX];
-  return sd_id128_to_string(identifier, text);
-}
-
 }  // namespace
-
-BusService::BusService(BusInterface interface_, limits::Patience patience_)
-    : interface(std::move(interface_)),
-      patience(patience_),
-      table(makeTable(interface)),
-      identifier(randomIdentifier()) {}
-
-BusService::~BusService() = default;
 
 void BusSession::Unreference::operator()(sd_bus_message* message) const { sd_bus_message_unref(message); }
 
@@ -219,7 +158,7 @@ bool BusSession::beginMessages() {
   UniqueDescriptor output(::fcntl(inner.get(), F_DUPFD_CLOEXEC, 0));
   const int outputNumber = output.get();
   if (!output || !sendAll(feed.get(), std::string_view("\0AUTH ANONYMOUS\r\nBEGIN\r\n", 24))) return false;
-  int result = openBus(std::move(inner), std::move(output));
+  int result = host.service().open(*this, std::move(inner), std::move(output), bus);
   while (result > 0) result = sd_bus_process(bus, nullptr);
   if (result < 0 || sd_bus_is_ready(bus) <= 0) return false;
 
@@ -230,36 +169,6 @@ bool BusSession::beginMessages() {
   ownSocket.reset();
   sendSignals();
   return true;
-}
-
-// sd_bus_process()'s convention: more than 0, go on.
-int BusSession::openBus(UniqueDescriptor in, UniqueDescriptor out) {
-  const BusService& service = host.service();
-  int result = sd_bus_new(&bus);
-  if (result >= 0) result = sd_bus_set_fd(bus, in.get(), out.get());
-  if (result < 0) return result;
-  in.release();  // the library closes both
-  out.release();
-  sd_id128_t identifier{};
-  result = sd_id128_from_string(service.identifier.c_str(), &identifier);
-  if (result >= 0) result = sd_bus_set_server(bus, 1, identifier);
-  if (result >= 0) result = sd_bus_set_anonymous(bus, 1);
-  if (result >= 0) result = sd_bus_negotiate_fds(bus, 0);
-  if (result >= 0) {
-    const auto count = [](sd_bus_message*, void* self, sd_bus_error*) {
-      ++static_cast<BusSession*>(self)->dispatched;
-      return 0;
-    };
-    result = sd_bus_add_filter(bus, nullptr, count, this);
-  }
-  if (result >= 0)
-    result = sd_bus_add_object_vtable(bus, nullptr, service.interface.path.c_str(),
-                                      service.interface.name.c_str(), service.table.data(), this);
-  if (result >= 0)
-    result = sd_bus_add_object_vtable(bus, nullptr, "/org/freedesktop/DBus", "org.freedesktop.DBus", busTable,
-                                      this);
-  if (result >= 0) result = sd_bus_start(bus);
-  return result < 0 ? result : 1;
 }
 
 bool BusSession::handleMessage(std::string_view message) {
@@ -283,42 +192,42 @@ int BusSession::call(sd_bus_message* message) {
   if (phase != Phase::running) return 1;
   const auto& operations = host.service().interface.operations;
   const std::string_view member = sd_bus_message_get_member(message);
-  const auto operation =
-      std::find_if(operations.begin(), operations.end(),
-                   [&](const BusOperation& candidate) { return candidate.name == member; });
-  auto arguments = readValues(message, operation->arguments);  // the library has found name and types to fit
+  std::size_t operation = 0;  // the library has found name and types to fit
+  while (operations.at(operation).name != member) ++operation;
+  auto arguments = readValues(message, operations[operation].arguments);
   if (!arguments) return -arguments.error().value();
   const std::uint64_t identifier = ++lastCall;
-  unanswered.emplace(identifier, Message(sd_bus_message_ref(message)));
-  handler->call(static_cast<std::size_t>(operation - operations.begin()), std::move(*arguments),
-                host.completion(number, identifier));
+  unanswered.emplace(identifier, Call{operation, Message(sd_bus_message_ref(message))});
+  handler->call(operation, std::move(*arguments), host.completion(number, identifier));
   return 1;
 }
 
 void BusSession::complete(std::uint64_t identifier, BusReply reply) {
   const auto found = unanswered.find(identifier);
   if (found == unanswered.end() || phase != Phase::running) return;
-  const Message message = std::move(found->second);
+  const Call answered = std::move(found->second);
   unanswered.erase(found);
-  const auto& operations = host.service().interface.operations;
-  const std::string_view member = sd_bus_message_get_member(message.get());
-  const auto operation =
-      std::find_if(operations.begin(), operations.end(),
-                   [&](const BusOperation& candidate) { return candidate.name == member; });
+  Message answer = makeAnswer(answered, reply);
+  if (!answer) return fail("an answer cannot be made");
+  if (sd_bus_message_get_expect_reply(answered.message.get()) > 0) send(std::move(answer));
+  if (!input.empty() || inputEnded) handleInput();  // which may have been held up
+}
+
+BusSession::Message BusSession::makeAnswer(const Call& call, const BusReply& reply) const {
   sd_bus_message* answer = nullptr;
   if (const auto* error = std::get_if<BusError>(&reply)) {
     const sd_bus_error description{error->name.c_str(), error->message.c_str(), 0};
-    sd_bus_message_new_method_error(message.get(), &answer, &description);
-  } else if (sd_bus_message_new_method_return(message.get(), &answer) >= 0) {
-    if (const auto appended = appendValues(answer, operation->results, std::get<List>(reply)); !appended) {
-      log().error("%s: the answer does not fit: %s", member, appended.error().message());
-      answer = sd_bus_message_unref(answer);
-    }
+    sd_bus_message_new_method_error(call.message.get(), &answer, &description);
+    return Message(answer);
   }
-  if (!answer) return fail("an answer cannot be made");
+  if (sd_bus_message_new_method_return(call.message.get(), &answer) < 0) return nullptr;
   Message owned(answer);
-  if (sd_bus_message_get_expect_reply(message.get()) > 0) send(std::move(owned));
-  if (!input.empty() || inputEnded) handleInput();  // which may have been held up
+  const BusOperation& operation = host.service().interface.operations[call.operation];
+  if (const auto appended = appendValues(answer, operation.results, std::get<List>(reply)); !appended) {
+    log().error("%s: the answer does not fit: %s", operation.name, appended.error().message());
+    return nullptr;
+  }
+  return owned;
 }
 
 void BusSession::stopReading() {

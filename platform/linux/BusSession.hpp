@@ -14,23 +14,12 @@
 
 #include "platform/linux/BusHandshake.hpp"
 #include "platform/linux/BusServer.hpp"
+#include "platform/linux/BusService.hpp"
 
 struct sd_bus;
 struct sd_bus_message;
-struct sd_bus_vtable;
 
 namespace platform::linux_ {
-
-// What the sessions of one server share.
-struct BusService {
-  BusService(BusInterface interface, limits::Patience patience);
-  ~BusService();
-
-  const BusInterface interface;
-  const limits::Patience patience;
-  const std::vector<sd_bus_vtable> table;  // of `interface`, whose texts it points to
-  const std::string identifier;            // of the server, in handshakes
-};
 
 // What a session asks of its server.
 class BusSessionHost {
@@ -75,7 +64,8 @@ class BusSession : public BusConnection {
   std::optional<TimePoint> deadline() const { return end; }
   bool hasEnded() const { return phase == Phase::ended; }
   bool isDrained() const { return phase != Phase::running || outstanding() == 0; }
-  // An operation's message, from the library; the answer is one of its handlers'.
+  // From the library: any message; an operation's, whose answer is that of the library's handlers.
+  void countMessage() { ++dispatched; }
   int call(sd_bus_message* message);
   // After it has ended: closes the socket and tells the handler.
   void finish();
@@ -90,6 +80,10 @@ class BusSession : public BusConnection {
     void operator()(sd_bus_message* message) const;
   };
   using Message = std::unique_ptr<sd_bus_message, Unreference>;
+  struct Call {
+    std::size_t operation;
+    Message message;
+  };
   struct Signal {
     std::string mergeKey;
     std::size_t signal;
@@ -100,9 +94,9 @@ class BusSession : public BusConnection {
   void handleInput();
   std::size_t shakeHands();
   bool beginMessages();
-  int openBus(UniqueDescriptor input, UniqueDescriptor output);
   bool handleMessage(std::string_view message);
-  void send(Message answer);
+  Message makeAnswer(const Call& call, const BusReply& reply) const;
+  void send(Message message);
   void flush();
   void sendSignals();
   std::size_t unsent() const;
@@ -129,7 +123,7 @@ class BusSession : public BusConnection {
   UniqueDescriptor feed;
   std::size_t dispatched = 0;
   std::uint64_t lastCall = 0;
-  std::map<std::uint64_t, Message> unanswered;
+  std::map<std::uint64_t, Call> unanswered;
   std::vector<Signal> signals;
 };
 
