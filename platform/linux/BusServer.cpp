@@ -5,7 +5,6 @@
 #include <sys/eventfd.h>
 #include <sys/resource.h>
 #include <sys/socket.h>
-#include <sys/timerfd.h>
 #include <systemd/sd-bus.h>
 
 #include <algorithm>
@@ -13,12 +12,12 @@
 #include <cstring>
 #include <map>
 #include <mutex>
-#include <set>
 
 #include "platform/LogSink.hpp"
 #include "platform/Platform.hpp"
 #include "platform/linux/BusLimits.hpp"
 #include "platform/linux/BusSession.hpp"
+#include "platform/linux/DeadlineTimer.hpp"
 
 namespace platform::linux_ {
 namespace {
@@ -42,11 +41,11 @@ class BusServer::State : public BusSessionHost, public std::enable_shared_from_t
   State(BusInterface interface, limits::Patience patience)
       : epoll(::epoll_create1(EPOLL_CLOEXEC)),
         _service(std::move(interface), patience),
-        wakeUp(::eventfd(0, EFD_CLOEXEC | EFD_NONBLOCK)),
-        timer(::timerfd_create(CLOCK_MONOTONIC, TFD_CLOEXEC | TFD_NONBLOCK)) {
-    if (!epoll || !wakeUp || !timer) platform::stop(std::string("bus server: ") + std::strerror(errno));
+        wakeUp(::eventfd(0, EFD_CLOEXEC | EFD_NONBLOCK)) {
+    if (!epoll || !wakeUp || deadlines.descriptor() < 0)
+      platform::stop(std::string("bus server: ") + std::strerror(errno));
     control(EPOLL_CTL_ADD, wakeUp.get(), EPOLLIN, wakeUpTag);
-    control(EPOLL_CTL_ADD, timer.get(), EPOLLIN, timerTag);
+    control(EPOLL_CTL_ADD, deadlines.descriptor(), EPOLLIN, timerTag);
   }
 
   void dispatch() {
@@ -76,7 +75,8 @@ class BusServer::State : public BusSessionHost, public std::enable_shared_from_t
     // come later would wake the loop for ever.
     if (listener) ::epoll_ctl(epoll.get(), EPOLL_CTL_DEL, listener.get(), nullptr);
     listener.reset();
-    resumeAccepting.reset();
+    deadlines.set(listenerTag, std::nullopt);
+    paused = false;
   }
 
   std::shared_ptr<BusConnection> adopt(UniqueDescriptor socket, PeerIdentity peer,
@@ -124,7 +124,6 @@ class BusServer::State : public BusSessionHost, public std::enable_shared_from_t
   struct Entry {
     std::shared_ptr<BusSession> session;
     std::uint32_t events = 0;  // what epoll watches for
-    std::optional<Clock::time_point> deadline;
   };
   using Work = std::function<void()>;
 
@@ -138,7 +137,8 @@ class BusServer::State : public BusSessionHost, public std::enable_shared_from_t
 
   void handle(std::uint64_t tag, std::uint32_t events) {
     if (tag == wakeUpTag) {
-      clear(wakeUp);
+      eventfd_t ignored;
+      eventfd_read(wakeUp.get(), &ignored);
       runHandedOver();
     } else if (tag == timerTag) {
       handleTimer();
@@ -173,12 +173,6 @@ class BusServer::State : public BusSessionHost, public std::enable_shared_from_t
       work();
       settleChanged();
     }
-  }
-
-  // An event or timer descriptor: both count in eight bytes.
-  static void clear(const UniqueDescriptor& counter) {
-    eventfd_t ignored;
-    eventfd_read(counter.get(), &ignored);
   }
 
   template <class Call>
@@ -227,55 +221,30 @@ class BusServer::State : public BusSessionHost, public std::enable_shared_from_t
       entry.events = wanted;
       control(EPOLL_CTL_MOD, entry.session->socket(), wanted, socketTag(number));
     }
-    setDeadline(entry, entry.session->deadline());
-  }
-
-  void setDeadline(Entry& entry, std::optional<Clock::time_point> deadline) {
-    if (deadline == entry.deadline) return;
-    if (entry.deadline) deadlines.erase({*entry.deadline, entry.session->number});
-    if (deadline) deadlines.insert({*deadline, entry.session->number});
-    entry.deadline = deadline;
-    armTimer();
+    deadlines.set(number, entry.session->deadline());
   }
 
   void remove(std::uint64_t number) {
     const auto found = sessions.find(number);
-    Entry entry = std::move(found->second);
-    setDeadline(entry, std::nullopt);
+    const Entry entry = std::move(found->second);
     sessions.erase(found);
+    deadlines.set(number, std::nullopt);
     ::epoll_ctl(epoll.get(), EPOLL_CTL_DEL, entry.session->socket(), nullptr);
     const PeerIdentity& peer = entry.session->peer();
     if (peer.process) ::epoll_ctl(epoll.get(), EPOLL_CTL_DEL, peer.process->get(), nullptr);
     if (--perUser[peer.uid] == 0) perUser.erase(peer.uid);
     entry.session->finish();
-    if (resumeAccepting) resume();
+    if (paused) resume();
   }
 
   void handleTimer() {
-    clear(timer);
-    armed.reset();
-    const auto now = Clock::now();
-    for (const auto& [time, number] : deadlines) {
-      if (time > now) break;
-      withSession(number, [](BusSession& session) { session.deadlinePassed(); });
+    for (const std::uint64_t number : deadlines.takePassed()) {
+      if (number == listenerTag) {
+        resume();
+      } else {
+        withSession(number, [](BusSession& session) { session.deadlinePassed(); });
+      }
     }
-    if (resumeAccepting && *resumeAccepting <= now) resume();
-    armTimer();
-  }
-
-  // For the earliest deadline; with none, nothing wakes.
-  void armTimer() {
-    std::optional<Clock::time_point> next = resumeAccepting;
-    if (!deadlines.empty() && (!next || deadlines.begin()->first < *next)) next = deadlines.begin()->first;
-    if (next == armed) return;
-    armed = next;
-    itimerspec spec{};
-    if (next) {
-      const auto since =
-          std::chrono::duration_cast<std::chrono::nanoseconds>(next->time_since_epoch()).count();
-      spec.it_value = {since / 1'000'000'000, since % 1'000'000'000};
-    }
-    ::timerfd_settime(timer.get(), TFD_TIMER_ABSTIME, &spec, nullptr);
   }
 
   void acceptSome() {
@@ -363,14 +332,14 @@ class BusServer::State : public BusSessionHost, public std::enable_shared_from_t
   void pause() {
     if (!std::exchange(exhausted, true)) log().error("at the limit of descriptors: accepting rests");
     control(EPOLL_CTL_MOD, listener.get(), 0, listenerTag);
-    resumeAccepting = Clock::now() + _service.patience.accept;
-    armTimer();
+    paused = true;
+    deadlines.set(listenerTag, Clock::now() + _service.patience.accept);
   }
 
   void resume() {
-    resumeAccepting.reset();
+    paused = false;
+    deadlines.set(listenerTag, std::nullopt);
     if (listener) control(EPOLL_CTL_MOD, listener.get(), EPOLLIN, listenerTag);
-    armTimer();
   }
 
   static inline thread_local const State* dispatching = nullptr;
@@ -378,12 +347,11 @@ class BusServer::State : public BusSessionHost, public std::enable_shared_from_t
   const UniqueDescriptor epoll;
   const BusService _service;
   const UniqueDescriptor wakeUp;
-  const UniqueDescriptor timer;
-  std::optional<Clock::time_point> armed;
+  DeadlineTimer deadlines;  // of sessions, and of the listener's rest
 
   UniqueDescriptor listener;
   Admitter admitter;
-  std::optional<Clock::time_point> resumeAccepting;
+  bool paused = false;
   bool exhausted = false;
   bool full = false;
 
@@ -392,7 +360,6 @@ class BusServer::State : public BusSessionHost, public std::enable_shared_from_t
   std::function<void()> whenDrained;
   std::vector<std::uint64_t> changedSessions;  // to be settled
   std::map<uid_t, std::size_t> perUser;
-  std::set<std::pair<Clock::time_point, std::uint64_t>> deadlines;
 
   std::mutex mutex;
   std::vector<Work> handedOver;  // guarded by `mutex`
