@@ -95,6 +95,7 @@ class EntitlementsTest : public testing::Test {
   std::string problem() { return readGrants(files, paths).front().problem; }
   std::string granted(const PeerIdentity& peer) { return describe(entitlements.of(peer)); }
 
+  RecordedLog& log = RecordedLog::installed();
   TemporaryFolder folder;
   const std::string root = folder.path;
   const Paths paths = Paths::under(root);
@@ -182,7 +183,7 @@ TEST_F(EntitlementsTest, BelongToTheProgramOfTheUserThatTheyName) {
   EXPECT_EQ(granted(peer), R"(["name": "b.json"])");
   add("f.json", "nonsense");
   EXPECT_EQ(granted(peer), granted(peer));
-  EXPECT_EQ(RecordedLog::installed().count(paths.entitlements() + "/f.json does not count"), 1u);
+  EXPECT_EQ(log.count(paths.entitlements() + "/f.json does not count"), 1u);
 }
 
 }  // namespace
