@@ -7,12 +7,9 @@
 #include <sys/socket.h>
 #include <sys/wait.h>
 
-#include <algorithm>
 #include <cerrno>
 #include <future>
 #include <random>
-#include <string>
-#include <vector>
 
 #include "platform/linux/BusClient.hpp"
 #include "tests/linux/bus/BusWorld.hpp"
@@ -26,7 +23,16 @@ using testing::HasSubstr;
 
 constexpr std::size_t mebibyte = 1024 * 1024;
 
-class BusServerTest : public World {};
+class BusServerTest : public World {
+ protected:
+  BusServerTest() { EXPECT_EQ(::getrlimit(RLIMIT_NOFILE, &original), 0); }
+  ~BusServerTest() override { EXPECT_EQ(limitDescriptors(original.rlim_cur), 0); }
+  int limitDescriptors(rlim_t count) const {
+    const rlimit limit{count, original.rlim_max};
+    return ::setrlimit(RLIMIT_NOFILE, &limit);
+  }
+  rlimit original{};
+};
 
 TEST_F(BusServerTest, CallsThatDoNotFitGetAnErrorAndNoMore) {
   std::string unended = callMessage("Echo", "text");
@@ -56,18 +62,21 @@ TEST_F(BusServerTest, CallsThatDoNotFitGetAnErrorAndNoMore) {
   }
   auto library = BusClient::connect(path, deadline);
   ASSERT_TRUE(library);
-  const BusInterface peer{"/test", "org.freedesktop.DBus.Peer", {{"Ping", "", ""}}, {}};
-  const auto ping = (*library)->call(peer, "Ping", {}, deadline);
-  ASSERT_TRUE(ping);
-  EXPECT_TRUE(std::holds_alternative<List>(*ping));
-  const BusInterface introspectable{
-      "/test", "org.freedesktop.DBus.Introspectable", {{"Introspect", "", "s"}}, {}};
-  const auto description = (*library)->call(introspectable, "Introspect", {}, deadline);
-  ASSERT_TRUE(description);
-  EXPECT_THAT(describe(std::get<List>(*description).front()), HasSubstr("<method name=\"Hold\">"));
-  const BusInterface wide{"/test", "test.Interface", {{"Wide", "t", ""}}, {}};
-  ASSERT_TRUE((*library)->call(wide, "Wide", {std::int64_t{1}}, deadline));
+  const auto answer = [&](const char* interface, const BusOperation& operation, const List& arguments) {
+    const auto reply =
+        (*library)->call({"/test", interface, {operation}, {}}, operation.name, arguments, deadline);
+    return reply && std::holds_alternative<List>(*reply) ? describe(Value(std::get<List>(*reply))) : "none";
+  };
+  EXPECT_EQ(answer("org.freedesktop.DBus.Peer", {"Ping", "", ""}, {}), "[]");
+  EXPECT_THAT(answer("org.freedesktop.DBus.Introspectable", {"Introspect", "", "s"}, {}),
+              HasSubstr("<method name=\"Hold\">"));
+  EXPECT_EQ(answer("test.Interface", {"Wide", "t", ""}, {std::int64_t{1}}), "[]");
   EXPECT_THAT(calls, ElementsAre("text", ""));
+
+  ASSERT_TRUE(wire.send(callMessage("Echo", "", {.flags = noReplyExpected}) +
+                        callMessage("Missing", "", {.flags = noReplyExpected}) +
+                        callMessage("Echo", "", {.serial = 3})));
+  EXPECT_EQ(wire.next()->serial, 3u) << "only calls that expect an answer get one";
 }
 
 TEST_F(BusServerTest, DamageEndsItsClientAloneAndHoldsNoMemory) {
@@ -80,10 +89,7 @@ TEST_F(BusServerTest, DamageEndsItsClientAloneAndHoldsNoMemory) {
   std::string giant = good.substr(0, 16);
   giant[7] = 0x07;  // a body of 120 MiB
   giant[6] = static_cast<char>(0x80);
-  const struct {
-    const char* name;
-    std::string bytes;
-  } rows[] = {
+  const std::pair<const char*, std::string> rows[] = {
       {"giant", giant},
       {"damaged, then giant", damaged(17, 9) + giant},
       {"no byte order", damaged(0, 'x')},
@@ -94,16 +100,17 @@ TEST_F(BusServerTest, DamageEndsItsClientAloneAndHoldsNoMemory) {
   Wire witness = client();
   const std::size_t before = residentBytes();
   int ended = 0;
-  for (const auto& row : rows) {
+  for (const auto& [name, bytes] : rows) {
+    SCOPED_TRACE(name);
     Wire wire = client();
-    std::size_t sent = row.bytes.size();
+    std::size_t sent = bytes.size();
     // Until the server has had enough; what is not damaged in itself it would go on reading.
-    for (bool taken = wire.send(row.bytes + good); taken && sent < 8 * mebibyte; sent += 4096)
+    for (bool taken = wire.send(bytes + good); taken && sent < 8 * mebibyte; sent += 4096)
       taken = wire.send(std::string(4096, '\0'));
-    EXPECT_LT(sent, mebibyte) << row.name;  // what sockets hold, mostly
-    EXPECT_EQ(wire.readToEnd(), "") << row.name;
-    EXPECT_TRUE(waitFor([&, expected = ++ended] { return closed == expected; })) << row.name;
-    EXPECT_TRUE(witness.isServed()) << row.name;
+    EXPECT_LT(sent, mebibyte);  // what sockets hold, mostly
+    EXPECT_EQ(wire.readToEnd(), "");
+    EXPECT_TRUE(waitFor([&, expected = ++ended] { return closed == expected; }));
+    EXPECT_TRUE(witness.isServed());
   }
   EXPECT_LT(residentBytes(), before + 4 * mebibyte);
   EXPECT_THAT(calls, testing::Not(testing::Contains("good")));
@@ -183,14 +190,6 @@ TEST_F(BusServerTest, TheLastCallOfAClientThatHasGoneIsHandled) {
   EXPECT_THAT(calls, ElementsAre("from here", "and another", "from a child"));
 }
 
-TEST_F(BusServerTest, CallsThatExpectNoReplyGetNone) {
-  Wire wire = client();
-  ASSERT_TRUE(wire.send(callMessage("Echo", "", {.flags = noReplyExpected}) +
-                        callMessage("Missing", "", {.flags = noReplyExpected}) +
-                        callMessage("Echo", "", {.serial = 3})));
-  EXPECT_EQ(wire.next()->serial, 3u);
-}
-
 TEST_F(BusServerTest, UnreadSignalsMergeByKeyAndKeepTheirOrder) {
   Wire wire = client();
   constexpr int count = 2000;
@@ -229,9 +228,8 @@ TEST_F(BusServerTest, WhatComesTooLateIsHarmless) {
   complete(0);
 
   decides = false;
-  const std::string path_ = path;
   const pid_t child = ::fork();
-  if (child == 0) ::_exit(Wire(path_).descriptor() < 0);
+  if (child == 0) ::_exit(Wire(path).descriptor() < 0);
   ASSERT_TRUE(waitFor([&] { return undecided.size() == 1; }));
   ::waitpid(child, nullptr, 0);
   const Wire waiting(path);
@@ -269,11 +267,8 @@ TEST_F(BusServerTest, NothingWakesAServerThatNoLongerListens) {
 TEST_F(BusServerTest, AtTheDescriptorLimitClientsWaitUntilOthersEnd) {
   constexpr std::size_t clients = 30;
   const std::size_t before = log.count("accepting rests");
-  rlimit limit{};
-  ASSERT_EQ(::getrlimit(RLIMIT_NOFILE, &limit), 0);
-  const rlimit low{openDescriptors() + clients + limits::spareDescriptors + 20, limit.rlim_max};
   std::vector<Wire> wires;
-  ASSERT_EQ(::setrlimit(RLIMIT_NOFILE, &low), 0);
+  ASSERT_EQ(limitDescriptors(openDescriptors() + clients + limits::spareDescriptors + 20), 0);
   while (wires.size() < clients) wires.emplace_back(path);
   EXPECT_TRUE(eventually([&] { return log.count("accepting rests") > before; }));
   // Each one that ends lets the next one in.
@@ -282,15 +277,11 @@ TEST_F(BusServerTest, AtTheDescriptorLimitClientsWaitUntilOthersEnd) {
     EXPECT_TRUE(wire.isServed());
     wire.close();
   }
-  EXPECT_EQ(::setrlimit(RLIMIT_NOFILE, &limit), 0);
 }
 
 TEST_F(BusServerTest, OneUsersConnectionsAreLimitedAndOneThatEndsMakesRoom) {
-  rlimit limit{};
-  ASSERT_EQ(::getrlimit(RLIMIT_NOFILE, &limit), 0);
-  if (limit.rlim_max < 4 * limits::connectionsPerUser) GTEST_SKIP() << "takes more descriptors";
-  const rlimit high{limit.rlim_max, limit.rlim_max};
-  ASSERT_EQ(::setrlimit(RLIMIT_NOFILE, &high), 0);
+  if (original.rlim_max < 4 * limits::connectionsPerUser) GTEST_SKIP() << "takes more descriptors";
+  ASSERT_EQ(limitDescriptors(original.rlim_max), 0);
   Wire first = client();
   decides = false;
   std::vector<Wire> wires;
@@ -301,7 +292,6 @@ TEST_F(BusServerTest, OneUsersConnectionsAreLimitedAndOneThatEndsMakesRoom) {
   ASSERT_TRUE(waitFor([&] { return closed == 1; }));
   decides = true;
   EXPECT_TRUE(client().isServed());
-  EXPECT_EQ(::setrlimit(RLIMIT_NOFILE, &limit), 0);
 }
 
 // Without patience.

@@ -3,11 +3,6 @@
 
 #include <gmock/gmock.h>
 
-#include <array>
-#include <atomic>
-#include <string>
-#include <thread>
-
 #include "platform/linux/BusClient.hpp"
 #include "platform/linux/LinuxFileSystem.hpp"
 #include "platform/linux/ThreadPool.hpp"

@@ -2,13 +2,9 @@
 
 #include <poll.h>
 #include <sys/epoll.h>
-#include <sys/socket.h>
-#include <sys/un.h>
 
 #include <algorithm>
 #include <cstring>
-#include <filesystem>
-#include <fstream>
 #include <future>
 
 namespace platform::linux_ {
@@ -33,22 +29,13 @@ void addField(std::string& fields, char code, char type, const std::string& valu
   fields += std::string{code, 1, type, 0} + value;
 }
 
-sockaddr_un addressOf(const std::string& path) {
-  sockaddr_un address{};
-  address.sun_family = AF_UNIX;
-  path.copy(address.sun_path, sizeof address.sun_path - 1);
-  return address;
-}
-
 }  // namespace
 
 RecordedLog& RecordedLog::installed() {
-  static RecordedLog* const log = [] {
-    auto* made = new RecordedLog;
-    installLogSink(*made);
-    return made;
-  }();
-  return *log;
+  static auto& log = *new RecordedLog;
+  static const bool once = (installLogSink(log), true);
+  static_cast<void>(once);
+  return log;
 }
 
 void RecordedLog::write(const LogChannel&, LogLevel, std::string_view format,
@@ -62,13 +49,6 @@ std::size_t RecordedLog::count(std::string_view part) {
   return static_cast<std::size_t>(std::count_if(
       lines.begin(), lines.end(), [&](const auto& line) { return line.find(part) != line.npos; }));
 }
-
-TemporaryFolder::TemporaryFolder()
-    : path([] {
-        char name[] = "/tmp/bus_tests.XXXXXX";
-        return std::string(::mkdtemp(name));
-      }()) {}
-TemporaryFolder::~TemporaryFolder() { std::filesystem::remove_all(path); }
 
 std::string callMessage(const std::string& member, const std::string& argument, const CallOptions& options) {
   std::string fields;
@@ -84,11 +64,9 @@ std::string callMessage(const std::string& member, const std::string& argument, 
   return message + body;
 }
 
-Wire::Wire(const std::string& path) : socket(::socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0)) {
+Wire::Wire(const std::string& path) : socket(fakes::socketAt(path, ::connect)) {
   const timeval limit{deadline.count(), 0};
-  ::setsockopt(socket.get(), SOL_SOCKET, SO_RCVTIMEO, &limit, sizeof limit);
-  const sockaddr_un address = addressOf(path);
-  EXPECT_EQ(::connect(socket.get(), reinterpret_cast<const sockaddr*>(&address), sizeof address), 0);
+  EXPECT_EQ(::setsockopt(socket.get(), SOL_SOCKET, SO_RCVTIMEO, &limit, sizeof limit), 0);
 }
 
 bool Wire::send(std::string_view bytes) {
@@ -128,13 +106,12 @@ std::optional<Answer> Wire::next() {
   if (!fill(size)) return std::nullopt;
   Answer answer;
   answer.type = received[1];
-  bool hasText = false;
   for (std::size_t at = 16; at < end;) {
     at = aligned(at, 8);
     const char code = received[at], type = received[at + 2];
     at += 4;
     if (type == 'g') {
-      hasText = received[at + 1] == 's';
+      if (received[at + 1] == 's') answer.text = received.substr(body + 4, numberAt(received, body));
       at += 2u + static_cast<unsigned char>(received[at]);
       continue;
     }
@@ -144,7 +121,6 @@ std::optional<Answer> Wire::next() {
     if (code == 3 || code == 4) answer.name = received.substr(at, value);
     if (type != 'u') at += value + 1;
   }
-  if (hasText) answer.text = received.substr(body + 4, numberAt(received, body));
   received.erase(0, size);
   return answer;
 }
@@ -169,20 +145,9 @@ bool Wire::isServed() {
 }
 
 UniqueDescriptor listenAt(const std::string& path) {
-  UniqueDescriptor socket(::socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0));
-  const sockaddr_un address = addressOf(path);
-  EXPECT_EQ(::bind(socket.get(), reinterpret_cast<const sockaddr*>(&address), sizeof address), 0);
+  UniqueDescriptor socket = fakes::socketAt(path, ::bind);
   EXPECT_EQ(::listen(socket.get(), 128), 0);
   return socket;
-}
-
-bool eventually(const std::function<bool()>& condition) {
-  const auto end = std::chrono::steady_clock::now() + deadline;
-  while (!condition()) {
-    if (std::chrono::steady_clock::now() > end) return false;
-    std::this_thread::yield();
-  }
-  return true;
 }
 
 std::size_t openDescriptors() {

@@ -4,26 +4,24 @@
 #include <gtest/gtest.h>
 
 #include <atomic>
-#include <chrono>
 #include <condition_variable>
-#include <cstdint>
-#include <functional>
 #include <memory>
 #include <mutex>
 #include <optional>
 #include <string>
 #include <string_view>
-#include <thread>
 #include <vector>
 
 #include "platform/LogSink.hpp"
 #include "platform/linux/BusServer.hpp"
 #include "platform/linux/EventLoop.hpp"
+#include "tests/fakes/RealFiles.hpp"
 
 namespace platform::linux_ {
 
-// After this long a condition is taken to be never met.
-inline constexpr std::chrono::seconds deadline{20};
+using fakes::deadline;
+using fakes::eventually;
+using fakes::TemporaryFolder;
 inline constexpr std::chrono::hours never{1};
 
 // The lines of the whole process.
@@ -37,14 +35,6 @@ class RecordedLog : public LogSink {
  private:
   std::mutex mutex;
   std::vector<std::string> lines;  // guarded by `mutex`
-};
-
-// A folder that is gone with its owner.
-class TemporaryFolder {
- public:
-  TemporaryFolder();
-  ~TemporaryFolder();
-  const std::string path;
 };
 
 struct CallOptions {
@@ -94,7 +84,6 @@ class Wire {
 };
 
 UniqueDescriptor listenAt(const std::string& path);
-bool eventually(const std::function<bool()>& condition);  // for what nobody announces
 std::size_t openDescriptors();
 std::size_t residentBytes();
 

@@ -3,11 +3,6 @@
 
 #include <gtest/gtest.h>
 
-#include <cstdint>
-#include <cstring>
-#include <string>
-#include <string_view>
-
 #include "platform/linux/BusLimits.hpp"
 
 namespace platform::linux_ {
@@ -26,37 +21,26 @@ std::string repeated(const std::string& text, std::size_t times) {
   return all;
 }
 
-struct Shaken {
-  std::string result;  // "going", "done" or "failed", and what is left of the input
-  std::string output;
-};
-
-// Feeds `input` in pieces, as sockets cut it.
-Shaken shakeHands(const std::string& input, std::size_t pieceSize) {
+// Feeds `input` in pieces, as sockets cut it. "going", "done" or "failed", and what is left of the input.
+std::string shakeHands(const std::string& input, std::size_t pieceSize, std::string& output) {
   BusHandshake handshake(1000, "server");
   std::string pending;
-  Shaken run;
   for (std::size_t at = 0; at < input.size(); at += pieceSize) {
     pending += input.substr(at, pieceSize);
     std::string_view rest = pending;
-    const auto progress = handshake.advance(rest, run.output);
+    const auto progress = handshake.advance(rest, output);
     pending = rest;
-    if (progress == BusHandshake::Progress::failed) return {"failed", run.output};
-    if (progress == BusHandshake::Progress::done) {
-      if (at + pieceSize < input.size()) pending += input.substr(at + pieceSize);
-      return {"done " + pending, run.output};
-    }
+    if (progress == BusHandshake::Progress::failed) return "failed";
+    if (progress == BusHandshake::Progress::done)
+      return "done " + pending + input.substr(std::min(at + pieceSize, input.size()));
   }
-  run.result = "going";
-  return run;
+  return "going";
 }
 
 TEST(BusHandshakeTest, AnswersAreTheSameInWhateverPiecesItComes) {
   const struct {
     const char* name;
-    std::string input;
-    std::string result;
-    std::string output;
+    std::string input, result, output;
   } rows[] = {
       {"user named", start + "BEGIN\r\n", "done ", ok},
       {"user asked for", "\0AUTH EXTERNAL\r\nDATA\r\nBEGIN\r\n"s, "done ", "DATA\r\n" + ok},
@@ -86,9 +70,9 @@ TEST(BusHandshakeTest, AnswersAreTheSameInWhateverPiecesItComes) {
   };
   for (const auto& row : rows) {
     for (const std::size_t pieceSize : {std::size_t{1}, std::size_t{7}, row.input.size()}) {
-      const Shaken run = shakeHands(row.input, pieceSize);
-      EXPECT_EQ(run.result, row.result) << row.name << " by " << pieceSize;
-      EXPECT_EQ(run.output, row.output) << row.name << " by " << pieceSize;
+      std::string output;
+      EXPECT_EQ(shakeHands(row.input, pieceSize, output), row.result) << row.name << " by " << pieceSize;
+      EXPECT_EQ(output, row.output) << row.name << " by " << pieceSize;
     }
   }
 }
@@ -105,8 +89,7 @@ std::string header(char order, std::uint32_t body, std::uint32_t fields, char ve
 TEST(BusMessageLengthTest, IsKnownFromTheFixedHeaderAlone) {
   const struct {
     const char* name;
-    std::string bytes;
-    std::string result;
+    std::string bytes, result;
   } rows[] = {
       {"nothing", "", "unknown"},
       {"all but one byte", header('l', 0, 0).substr(0, 15), "unknown"},
