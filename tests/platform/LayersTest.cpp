@@ -2,12 +2,9 @@
 // folder against what that folder may include.
 #include <gtest/gtest.h>
 
-#include <algorithm>
 #include <filesystem>
 #include <fstream>
 #include <regex>
-#include <string>
-#include <vector>
 
 namespace {
 
@@ -38,38 +35,30 @@ const std::vector<Layer> layers = {
       "pairwelld/service/RadixDistributedDebugLogging.hpp", "<CLI/", "<sys/", "<POSIX>"}},
 };
 
-const std::vector<std::string> posixHeaders = {"<unistd.h>", "<fcntl.h>",     "<poll.h>", "<signal.h>",
-                                               "<dirent.h>", "<pwd.h>",       "<grp.h>",  "<spawn.h>",
-                                               "<sched.h>",  "<netinet/in.h>"};
-
-bool startsWith(const std::string& text, const std::string& prefix) {
-  return text.compare(0, prefix.size(), prefix) == 0;
-}
+const std::string posixHeaders =
+    "<unistd.h> <fcntl.h> <poll.h> <signal.h> <dirent.h> <pwd.h> <grp.h> <spawn.h> <sched.h> <netinet/in.h>";
 
 const Layer* layerOf(const std::string& path) {
   const Layer* best = nullptr;
   for (const Layer& layer : layers) {
-    if (startsWith(path, layer.folder) && (!best || layer.folder.size() > best->folder.size())) best = &layer;
+    if (path.starts_with(layer.folder) && (!best || layer.folder.size() > best->folder.size())) best = &layer;
   }
   return best;
 }
 
 bool isAllowed(const Layer& layer, const std::string& path, const std::string& include) {
-  if (path == "pairwelld/main.cpp" && startsWith(include, "platform/linux/")) return true;
+  if (path == "pairwelld/main.cpp" && include.starts_with("platform/linux/")) return true;
   // The interfaces' layer knows nothing of Linux.
-  if (startsWith(include, "platform/linux/") &&
-      (layer.folder == "platform/" || startsWith(layer.folder, "pairwelld/") ||
+  if (include.starts_with("platform/linux/") &&
+      (layer.folder == "platform/" || layer.folder.starts_with("pairwelld/") ||
        layer.folder == "hearthd/core/")) {
     return false;
   }
-  if (include.front() == '<' && include.find('.') == std::string::npos &&
-      include.find('/') == std::string::npos) {
-    return true;  // the standard library's
-  }
+  if (include.front() == '<' && include.find_first_of("./") == include.npos) return true;  // the standard's
   for (const std::string& prefix : layer.allowed) {
     if (prefix == "<POSIX>") {
-      if (std::find(posixHeaders.begin(), posixHeaders.end(), include) != posixHeaders.end()) return true;
-    } else if (startsWith(include, prefix)) {
+      if (posixHeaders.find(include) != posixHeaders.npos) return true;
+    } else if (include.starts_with(prefix)) {
       return true;
     }
   }

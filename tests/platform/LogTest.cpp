@@ -1,10 +1,7 @@
 #include <fcntl.h>
+#include <gmock/gmock.h>
 #include <gtest/gtest.h>
 #include <unistd.h>
-
-#include <algorithm>
-#include <cstdlib>
-#include <string>
 
 #include "platform/linux/UnifiedLog.hpp"
 
@@ -26,9 +23,8 @@ class CapturedStandardError {
   std::string read() {
     std::string text;
     char buffer[4096];
-    for (ssize_t count; (count = ::read(ends[0], buffer, sizeof buffer)) > 0;) {
+    for (ssize_t count; (count = ::read(ends[0], buffer, sizeof buffer)) > 0;)
       text.append(buffer, static_cast<std::size_t>(count));
-    }
     return text;
   }
 
@@ -37,8 +33,9 @@ class CapturedStandardError {
   int ends[2];
 };
 
-const LogChannel channel{"com.kestrel.pairwell", "daemon", true};
-const LogChannel clear{"com.kestrel.hearth", "files", false};
+using testing::HasSubstr;
+
+const LogChannel channel{"com.kestrel.pairwell", "daemon", true}, clear{"com.kestrel.hearth", "files", false};
 
 void write(UnifiedLog& log, const LogChannel& to, std::string_view format, const std::string& text) {
   const LogArgument arguments[] = {text};
@@ -51,10 +48,8 @@ TEST(UnifiedLogTest, OneLineAnEventWithTextsHiddenAndControlsEscaped) {
   write(log, channel, "Launching pairwelld (%s)", "secret");
   write(log, clear, "cannot read %s", "a\nb\x1b");
   const std::string text = output.read();
-  EXPECT_NE(text.find("Z default com.kestrel.pairwell:daemon Launching pairwelld (<private>)\n"),
-            std::string::npos)
-      << text;
-  EXPECT_NE(text.find("com.kestrel.hearth:files cannot read a\\nb\\x1b\n"), std::string::npos) << text;
+  EXPECT_THAT(text, HasSubstr("Z default com.kestrel.pairwell:daemon Launching pairwelld (<private>)\n"));
+  EXPECT_THAT(text, HasSubstr("com.kestrel.hearth:files cannot read a\\nb\\x1b\n"));
 }
 
 TEST(UnifiedLogTest, EnvironmentSetsLevelAndPrivacy) {
@@ -67,7 +62,7 @@ TEST(UnifiedLogTest, EnvironmentSetsLevelAndPrivacy) {
   EXPECT_FALSE(log.enabled(channel, LogLevel::default_));
   EXPECT_TRUE(log.enabled(channel, LogLevel::error));
   write(log, channel, "%s", "shown");
-  EXPECT_NE(output.read().find("daemon shown\n"), std::string::npos);
+  EXPECT_THAT(output.read(), HasSubstr("daemon shown\n"));
 }
 
 TEST(UnifiedLogTest, AReaderThatStopsLosesLinesAndIsToldHowMany) {
@@ -81,8 +76,8 @@ TEST(UnifiedLogTest, AReaderThatStopsLosesLinesAndIsToldHowMany) {
   EXPECT_EQ(kept.back(), '\n') << "no line is cut";
   write(log, clear, "%s", "after");
   const std::string text = output.read();
-  EXPECT_NE(text.find(std::to_string(200 - lines) + " lines were dropped"), std::string::npos) << text;
-  EXPECT_NE(text.find("after\n"), std::string::npos);
+  EXPECT_THAT(text, HasSubstr(std::to_string(200 - lines) + " lines were dropped"));
+  EXPECT_THAT(text, HasSubstr("after\n"));
 }
 
 }  // namespace

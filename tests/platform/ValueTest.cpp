@@ -11,42 +11,29 @@
 namespace platform {
 namespace {
 
-constexpr double infinity = std::numeric_limits<double>::infinity();
-
 TEST(Value, PrintsAsLogLinesNeedIt) {
-  const struct {
-    Value value;
-    const char* text;
-  } rows[] = {
-      {60.0, "60.0"},
+  const std::pair<Value, const char*> rows[] = {
       {0.5, "0.5"},
-      {100000.0, "100000.0"},
       {1e15, "1000000000000000.0"},
       {1e16, "1e+16"},
       {-0.0, "-0.0"},
       {9007199254740993.0, "9007199254740992.0"},
-      {0.1, "0.1"},
       {0.00005, "0.00005"},
-      {infinity, "inf"},
-      {std::int64_t{-5}, "-5"},
+      {std::numeric_limits<double>::infinity(), "inf"},
       {true, "true"},
       {nullptr, "null"},
-      {"plain", "plain"},
       {List{1, "a", nullptr}, "[1, \"a\", null]"},
-      {List{}, "[]"},
       {Dictionary{}, "[:]"},
       {Dictionary{{"b", 1.5}, {"a", List{true}}}, "[\"a\": [true], \"b\": 1.5]"},
   };
-  for (const auto& row : rows) EXPECT_EQ(describe(row.value), row.text);
+  for (const auto& [value, text] : rows) EXPECT_EQ(describe(value), text);
   EXPECT_EQ(describe(std::optional<Value>()), "nil");
 }
 
 TEST(Value, ConvertsOnlyWhereExact) {
-  EXPECT_EQ(toBool(1), true);
   EXPECT_EQ(toBool(0.0), false);
   EXPECT_EQ(toBool(2), std::nullopt);
   EXPECT_EQ(toBool("true"), std::nullopt);
-  EXPECT_EQ(toInteger(5.0), 5);
   EXPECT_EQ(toInteger(5.5), std::nullopt);
   EXPECT_EQ(toInteger(0x1p63), std::nullopt);
   EXPECT_EQ(toInteger(-0x1p63), std::numeric_limits<std::int64_t>::min());
@@ -54,7 +41,6 @@ TEST(Value, ConvertsOnlyWhereExact) {
   EXPECT_EQ(toDouble(std::int64_t{9007199254740993}), std::nullopt);
   EXPECT_EQ(toDouble(std::numeric_limits<std::int64_t>::max()), std::nullopt);
   EXPECT_EQ(toDouble(true), 1.0);
-  EXPECT_EQ(toDouble(nullptr), std::nullopt);
   EXPECT_EQ(toTexts(List{"a", 1}), std::nullopt);
 }
 
@@ -79,35 +65,32 @@ TEST(LogFormat, FillsPlaceholdersInOrderAndHidesTexts) {
 }
 
 struct Observer {
-  void noted(const Notification& notification) {
-    names.push_back(notification.name);
+  void noted(const Notification&) {
+    ++count;
     if (onNote) onNote();
   }
-  std::vector<std::string> names;
+  int count = 0;
   std::function<void()> onNote;
 };
 
 TEST(NotificationCentreTest, CallsNeitherTheDeadNorTheRemoved) {
   NotificationCentre centre;
-  auto first = std::make_shared<Observer>();
+  const auto first = std::make_shared<Observer>(), third = std::make_shared<Observer>();
   auto second = std::make_shared<Observer>();
-  auto third = std::make_shared<Observer>();
   const int sender = 0;
   for (const auto& observer : {first, second, third})
     centre.addObserver(observer, &Observer::noted, "n", nullptr);
   centre.addObserver(first, &Observer::noted, "n", &sender);
-  std::weak_ptr<Observer> dead = second;
   first->onNote = [&] {
     second.reset();
     centre.removeObserver(third.get());
   };
   centre.post("n", nullptr, std::nullopt);
   centre.post("other", &sender, std::nullopt);
-  EXPECT_EQ(first->names.size(), 1u);
-  EXPECT_TRUE(dead.expired());
-  EXPECT_TRUE(third->names.empty());
+  EXPECT_EQ(first->count, 1);
+  EXPECT_EQ(third->count, 0);
   centre.post("n", &sender, std::nullopt);
-  EXPECT_EQ(first->names.size(), 3u);
+  EXPECT_EQ(first->count, 3);
 }
 
 }  // namespace

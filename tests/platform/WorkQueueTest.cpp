@@ -3,14 +3,10 @@
 #include <gtest/gtest.h>
 
 #include <atomic>
-#include <chrono>
 #include <deque>
 #include <future>
-#include <memory>
 #include <stdexcept>
-#include <string>
 #include <thread>
-#include <vector>
 
 #include "platform/linux/ThreadPool.hpp"
 
@@ -19,8 +15,7 @@ namespace {
 
 using linux_::ThreadPool;
 
-class HeldPool : public WorkQueue {
- public:
+struct HeldPool : WorkQueue {
   void async(Work work) override { jobs.push_back(std::move(work)); }
   void runOne() {
     Work job = std::move(jobs.front());
@@ -94,8 +89,6 @@ TEST(SerialQueueTest, TheLastReferenceMayGoInsideAnItem) {
   EXPECT_TRUE(weak.expired());
 }
 
-using SerialQueueDeathTest = testing::Test;
-
 TEST(SerialQueueDeathTest, StopsWhereItWouldDeadlock) {
   testing::FLAGS_gtest_death_test_style = "threadsafe";
   Queues queues(std::make_shared<HeldPool>());
@@ -124,21 +117,16 @@ TEST_P(SerialQueueStress, KeepsOrderAndLosesNothing) {
     const auto state = queues.serial("state", QueueRank::state);
     const auto leaf = queues.serial("leaf", QueueRank::list);
     std::vector<std::thread> threads;
-    for (int caller = 0; caller < callers; ++caller) {
-      threads.emplace_back([&, caller] {
+    for (int& own : last) {
+      threads.emplace_back([&] {
         for (int round = 0; round < rounds; ++round) {
-          state->async([&, caller, round] {
-            if (last[static_cast<std::size_t>(caller)] != round - 1) ADD_FAILURE() << "out of order";
-            last[static_cast<std::size_t>(caller)] = round;
+          state->async([&, round] {
+            EXPECT_EQ(std::exchange(own, round), round - 1);
             ++total;
             leaf->sync([&] { ++inner; });
           });
-          if (round % 3 == 0) {
-            state->sync([&, caller, round] { EXPECT_EQ(last[static_cast<std::size_t>(caller)], round); });
-          }
-          if (round % 5 == 0) {
-            outer->async([&] { state->sync([&] { leaf->sync([&] { ++nested; }); }); });
-          }
+          if (round % 3 == 0) state->sync([&] { EXPECT_EQ(own, round); });
+          if (round % 5 == 0) outer->async([&] { state->sync([&] { leaf->sync([&] { ++nested; }); }); });
           // Readers that live in the pool itself, as client operations do.
           if (round % 7 == 0) queues.workers()->async([&] { state->sync([&] { ++nested; }); });
         }
