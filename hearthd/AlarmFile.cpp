@@ -49,11 +49,12 @@ platform::Result<void> AlarmFile::save(const Alarms& alarms) {
 }
 
 void AlarmFile::moveAside(const std::string& problem) {
-  int number = 1;
-  const auto aside = [&] { return path + ".damaged-" + std::to_string(number); };
-  while (files.identity(aside())) ++number;
-  const auto moved = files.rename(path, aside());
-  log().error("%s: %s; moved to %s%s", path, problem, aside(), moved ? "" : ", which failed");
+  const auto moved = platform::linux_::moveAside(files, path);
+  if (moved) {
+    log().error("%s: %s; moved to %s", path, problem, *moved);
+  } else {
+    log().error("%s: %s; cannot be moved aside: %s", path, problem, moved.error().message());
+  }
 }
 
 }  // namespace hearth

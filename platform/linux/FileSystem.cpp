@@ -29,6 +29,17 @@ Result<std::string> readFile(FileSystem& files, const std::string& path, std::si
   return (*file)->readAll(limit);
 }
 
+Result<std::string> moveAside(FileSystem& files, const std::string& path) {
+  for (int number = 1;; ++number) {
+    const std::string aside = path + ".damaged-" + std::to_string(number);
+    const auto there = files.identity(aside);
+    if (there) continue;
+    if (there.error() != std::errc::no_such_file_or_directory) return there.error();
+    if (const auto moved = files.rename(path, aside); !moved) return moved.error();
+    return aside;
+  }
+}
+
 Result<void> replaceFile(FileSystem& files, const std::string& path, std::string_view bytes) {
   const std::string temporary = path + ".new";
   auto result = writeNew(files, temporary, bytes);

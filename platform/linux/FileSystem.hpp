@@ -1,4 +1,5 @@
-// The file layer that all stores stand on: Linux's own, and in tests one in memory that loses what was not synced.
+// The file layer that all stores stand on: Linux's own, and in tests one in memory that loses what was not
+// synced.
 #pragma once
 
 #include <sys/types.h>
@@ -14,8 +15,8 @@
 
 namespace platform::linux_ {
 
-// Tells whether a path still is the file that was loaded. The kernel reuses an inode as soon as the old file is
-// gone, so identity means something only while the loaded file is held open.
+// Tells whether a path still is the file that was loaded. The kernel reuses an inode as soon as the old file
+// is gone, so identity means something only while the loaded file is held open.
 struct FileIdentity {
   std::uint64_t device = 0;
   std::uint64_t inode = 0;
@@ -47,8 +48,8 @@ class FolderWatch {
   virtual ~FolderWatch() = default;
 };
 
-// Paths are absolute or relative to the process's folder. Errors of the system pass through with errno's category.
-// Any thread.
+// Paths are absolute or relative to the process's folder. Errors of the system pass through with errno's
+// category. Any thread.
 class FileSystem {
  public:
   virtual ~FileSystem() = default;
@@ -63,21 +64,24 @@ class FileSystem {
   virtual Result<void> makeFolder(const std::string& path) = 0;
   // Names, sorted.
   virtual Result<std::vector<std::string>> list(const std::string& folder) = 0;
-  // Waits for the lock on `path`, a file of its own that is made if need be. Opened read-only, or every release
-  // would wake the watchers of its folder.
+  // Waits for the lock on `path`, a file of its own that is made if need be. Opened read-only, or every
+  // release would wake the watchers of its folder.
   virtual Result<std::unique_ptr<FileLock>> lock(const std::string& path) = 0;
-  // `changed` gets the name of each file in `folder` that was replaced, written or deleted, and an empty name when
-  // everything may have changed (an overflow, the folder itself renamed or made anew). It is called on the delivery
-  // thread; after the watch has been destroyed it is not.
-  virtual Result<std::unique_ptr<FolderWatch>> watch(const std::string& folder,
-                                                     std::function<void(const std::string& name)> changed) = 0;
+  // `changed` gets the name of each file in `folder` that was replaced, written or deleted, and an empty name
+  // when everything may have changed (an overflow, the folder itself renamed or made anew). It is called on
+  // the delivery thread; after the watch has been destroyed it is not.
+  virtual Result<std::unique_ptr<FolderWatch>> watch(
+      const std::string& folder, std::function<void(const std::string& name)> changed) = 0;
 };
 
 // The whole of a file.
 Result<std::string> readFile(FileSystem& files, const std::string& path, std::size_t limit);
 
-// Replaces `path`, durably and in one step: temporary file beside it, sync, rename, sync of the folder. On failure
-// the old file is as it was and the temporary one is gone.
+// Moves a damaged file aside, under a name that is new; the name.
+Result<std::string> moveAside(FileSystem& files, const std::string& path);
+
+// Replaces `path`, durably and in one step: temporary file beside it, sync, rename, sync of the folder. On
+// failure the old file is as it was and the temporary one is gone.
 Result<void> replaceFile(FileSystem& files, const std::string& path, std::string_view bytes);
 
 }  // namespace platform::linux_

@@ -108,22 +108,14 @@ void SettingsFile::clearDamage() {
 }
 
 void SettingsFile::moveAside() {
-  int number = 0;
-  std::string aside;
-  std::error_code taken;
-  do {
-    aside = path + ".damaged-" + std::to_string(++number);
-    const auto there = files.identity(aside);
-    taken = there ? std::error_code() : there.error();
-  } while (!taken);
-  const auto moved = isMissing(taken) ? files.rename(path, aside) : Result<void>(taken);
+  const auto moved = linux_::moveAside(files, path);
   damageStays = !moved;
   if (!moved) {
     log().error("%s: %s; cannot be moved aside: %s", path, damage, moved.error().message());
     return;
   }
   log().error("%s: %s; moved to %s. To use it, mend it, remove its checksum line, and move it back", path,
-              damage, aside);
+              damage, *moved);
   damage.clear();
   held.reset();
   lastGoodInForce = true;
