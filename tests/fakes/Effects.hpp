@@ -7,7 +7,11 @@
 #include <utility>
 #include <vector>
 
+#include "platform/Value.hpp"
+
 namespace fakes {
+
+using namespace platform;  // which the fakes stand for
 
 class Effects {
  public:
@@ -26,7 +30,6 @@ class Effects {
     onMoment();
     inMoment = false;
   }
-
   void mark() { start = list.size(); }
   std::vector<std::string> sinceMark(unsigned kinds) const {
     std::vector<std::string> texts;
@@ -40,13 +43,7 @@ class Effects {
   static std::string shortKey(std::string_view key) {
     if (key == "VelaLogCloudCollectionEnabled") return "flag";
     if (key == "VelaLogCloudCollectionEnabledExpiration") return "end";
-    if (key == "VelaLogCloudCollectionExpirationIntervalOverride") return "override";
-    return std::string(key);
-  }
-  // Notification names without their common start.
-  static std::string shortName(std::string_view name) {
-    constexpr std::string_view prefix = "com.kestrel.";
-    return std::string(name.substr(0, prefix.size()) == prefix ? name.substr(prefix.size()) : name);
+    return std::string(key == "VelaLogCloudCollectionExpirationIntervalOverride" ? "override" : key);
   }
 
   std::function<void()> onMoment;

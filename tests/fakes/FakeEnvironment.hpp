@@ -1,97 +1,119 @@
-// Environment, clock, kernel values, device properties and log of a device that a test makes up.
+// A process's surroundings, as a test makes them up: queues, environment, clock, kernel, device and log.
 #pragma once
 
 #include <cerrno>
 #include <cstring>
+#include <deque>
 #include <map>
+#include <memory>
 #include <optional>
+#include <random>
 #include <string>
-#include <string_view>
 #include <utility>
-#include <vector>
 
 #include "platform/Environment.hpp"
 #include "platform/LogSink.hpp"
+#include "platform/Platform.hpp"
+#include "platform/RunLoop.hpp"
 #include "tests/fakes/Effects.hpp"
 
 namespace fakes {
 
-class FakeEnvironment : public platform::ProcessEnvironment {
+// Unlike a real pool it has no thread: work runs on that of the test, one item at a time, with the platform
+// current; in the order in which it came or, once seeded, in an order drawn from the seed.
+class ManualPool : public WorkQueue {
  public:
+  explicit ManualPool(Platform& owner_) : owner(owner_) {}
+
+  void async(Work work) override { items.push_back(std::move(work)); }
+  void seed(std::uint64_t value) { random.emplace(value); }
+  bool isEmpty() const { return items.empty(); }
+  // The pool must not be empty.
+  void runOne() {
+    const std::size_t index =
+        random ? std::uniform_int_distribution<std::size_t>(0, items.size() - 1)(*random) : 0;
+    const Work work = std::move(items[index]);
+    items.erase(items.begin() + static_cast<std::ptrdiff_t>(index));
+    const PlatformScope scope(owner);
+    work();
+  }
+  // What is dropped may queue more as it dies.
+  void drop() {
+    while (!items.empty()) std::exchange(items, {}).clear();
+  }
+
+ private:
+  Platform& owner;
+  std::deque<Work> items;
+  std::optional<std::mt19937_64> random;
+};
+
+// Unlike a real loop, run() returns when stop() was called or nothing is left to do: a test cannot wait.
+struct ManualRunLoop : RunLoop {
+  explicit ManualRunLoop(Platform& owner) : queue(std::make_shared<ManualPool>(owner)) {}
+  void run() override {
+    while (!stopped && !queue->isEmpty()) queue->runOne();
+  }
+  void stop() override { stopped = true; }
+  std::shared_ptr<WorkQueue> mainQueue() override { return queue; }
+
+  const std::shared_ptr<ManualPool> queue;
+  bool stopped = false;
+};
+
+struct FakeEnvironment : ProcessEnvironment {
   std::optional<std::string> variable(std::string_view name) override {
-    ++reads;
     const auto found = variables.find(name);
     return found == variables.end() ? std::nullopt : std::optional(found->second);
   }
-  std::map<std::string, std::string, std::less<>> all() override {
-    ++reads;
-    return variables;
-  }
-
+  std::map<std::string, std::string, std::less<>> all() override { return variables; }
   std::map<std::string, std::string, std::less<>> variables;
-  int reads = 0;
 };
 
 // Time passes only in FakePlatform::advance().
-class ManualClock : public platform::Clock {
- public:
-  platform::Time now() override { return time; }
-  platform::Time time{1'000'000};
+struct ManualClock : Clock {
+  Time now() override { return time; }
+  Time time{1'000'000};
 };
 
 // Knows one name. Fails, with `failure` in errno, when that is not 0.
-class FakeSystemControl : public platform::SystemControl {
- public:
+struct FakeSystemControl : SystemControl {
   int sysctlbyname(const char* name, void* buffer, std::size_t* length) override {
-    const std::size_t needed = bootSession.size() + 1;
-    errno = failure                                            ? failure
-            : std::string_view(name) != "kern.bootsessionuuid" ? ENOENT
-            : *length < needed                                 ? ENOMEM
-                                                               : 0;
+    errno = std::string_view(name) == "kern.bootsessionuuid" ? failure : ENOENT;
+    if (errno == 0 && *length <= bootSession.size()) errno = ENOMEM;
     if (errno != 0) return -1;
-    std::memcpy(buffer, bootSession.c_str(), needed);
-    *length = needed;
+    *length = bootSession.size() + 1;
+    std::memcpy(buffer, bootSession.c_str(), *length);
     return 0;
   }
-
   std::string bootSession = "01234567-89AB-CDEF-0123-456789ABCDEF";
   int failure = 0;
 };
 
-class FakeDeviceProperties : public platform::DeviceProperties {
- public:
-  std::optional<platform::Value> copyAnswerWithError(std::string_view key, std::int32_t& error) override {
+struct FakeDeviceProperties : DeviceProperties {
+  std::optional<Value> copyAnswerWithError(std::string_view key, std::int32_t& error) override {
     if (const auto found = errors.find(key); found != errors.end()) error = found->second;
     const auto found = answers.find(key);
     return found == answers.end() ? std::nullopt : std::optional(found->second);
   }
   int isInternalBuild() override { return internalBuild; }
-
-  platform::Dictionary answers{{"BuildVersion", "21A5248v"}};
+  Dictionary answers{{"BuildVersion", "21A5248v"}};
   std::map<std::string, std::int32_t, std::less<>> errors;
   int internalBuild = 0;
 };
 
-// Keeps what a log would print, private texts shown, as "category level: message"; the error level is marked,
-// since that is what an operator filters by.
-class FakeLogSink : public platform::LogSink {
- public:
+// Keeps what a log would print, private texts shown, as "category level: message"; a channel whose texts are
+// not private is marked.
+struct FakeLogSink : LogSink {
   explicit FakeLogSink(Effects& effects_) : effects(effects_) {}
-
-  bool enabled(const platform::LogChannel&, platform::LogLevel level) override { return level >= minimum; }
-  void write(const platform::LogChannel& channel, platform::LogLevel level, std::string_view format,
-             std::span<const platform::LogArgument> arguments) override {
+  bool enabled(const LogChannel&, LogLevel) override { return true; }
+  void write(const LogChannel& channel, LogLevel level, std::string_view format,
+             std::span<const LogArgument> arguments) override {
     static constexpr const char* names[] = {" info: ", " default: ", " error: "};
-    const std::string line = channel.category + names[static_cast<int>(level)] +
-                             platform::formatLogMessage(format, arguments, false);
-    channels.push_back(channel);
-    effects.record(Effects::log, line);
+    effects.record(Effects::log, (channel.textIsPrivate ? "" : "public ") + channel.category +
+                                     names[static_cast<int>(level)] +
+                                     formatLogMessage(format, arguments, false));
   }
-
-  platform::LogLevel minimum = platform::LogLevel::info;
-  std::vector<platform::LogChannel> channels;  // one for each line
-
- private:
   Effects& effects;
 };
 

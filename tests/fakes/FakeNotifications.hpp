@@ -1,25 +1,20 @@
 // Named notifications and event streams, without a service manager behind them.
 #pragma once
 
-#include <algorithm>
-#include <limits>
 #include <map>
 #include <memory>
 #include <optional>
 #include <string>
-#include <string_view>
 #include <utility>
 #include <vector>
 
 #include "platform/EventStreams.hpp"
 #include "platform/NamedNotifications.hpp"
-#include "tests/fakes/Effects.hpp"
-#include "tests/fakes/ManualPool.hpp"
+#include "tests/fakes/FakeEnvironment.hpp"
 
 namespace fakes {
 
-class FakeNamedNotificationCentre : public platform::NamedNotificationCentre {
- public:
+struct FakeNamedNotificationCentre : NamedNotificationCentre {
   explicit FakeNamedNotificationCentre(std::shared_ptr<ManualPool> mainQueue_)
       : mainQueue(std::move(mainQueue_)) {}
 
@@ -28,18 +23,14 @@ class FakeNamedNotificationCentre : public platform::NamedNotificationCentre {
     observers.push_back({std::move(observer), address, callback, std::string(name)});
   }
   void removeObserver(const void* observer, std::string_view name) override {
-    std::erase_if(observers,
-                  [&](const auto& entry) { return entry.address == observer && entry.name == name; });
+    std::erase_if(observers, [&](const auto& each) { return each.address == observer && each.name == name; });
   }
   // One call for each observer; a call under way reaches an observer that was removed but lives.
   void deliver(std::string_view name) {
     for (const Observation& entry : observers) {
       if (entry.name != name) continue;
-      mainQueue->async([this, entry] {
-        const auto observer = entry.observer.lock();
-        if (!observer) return;
-        entry.callback(losesObserver ? nullptr : observer,
-                       losesName ? std::nullopt : std::optional(entry.name));
+      mainQueue->async([entry] {
+        if (const auto observer = entry.observer.lock()) entry.callback(observer, entry.name);
       });
     }
   }
@@ -51,18 +42,18 @@ class FakeNamedNotificationCentre : public platform::NamedNotificationCentre {
     std::string name;
   };
   std::vector<Observation> observers;
-  bool losesObserver = false;
-  bool losesName = false;
   const std::shared_ptr<ManualPool> mainQueue;
 };
 
-class FakeNamedNotifications : public platform::NamedNotifications {
+class FakeNamedNotifications : public NamedNotifications {
  public:
   FakeNamedNotifications(Effects& effects_, FakeNamedNotificationCentre& centre_)
       : effects(effects_), centre(centre_) {}
 
+  // The common start of names is not recorded.
   void post(std::string_view name) override {
-    effects.record(Effects::post, "post " + Effects::shortName(name));
+    effects.record(Effects::post,
+                   "post " + std::string(name.substr(std::string_view("com.kestrel.").size())));
     postFromElsewhere(name);
   }
   // Another process posts.
@@ -77,10 +68,9 @@ class FakeNamedNotifications : public platform::NamedNotifications {
     }
     centre.deliver(name);
   }
-  std::uint32_t registerHandler(std::string_view name, std::int32_t& token,
-                                std::shared_ptr<platform::WorkQueue> queue, Handler handler) override {
-    token = failing ? -1 : ++lastToken;
-    if (failing) return 1;
+  std::uint32_t registerHandler(std::string_view name, std::int32_t& token, std::shared_ptr<WorkQueue> queue,
+                                Handler handler) override {
+    token = ++lastToken;
     registrations[token] = std::make_shared<Registration>(
         Registration{std::string(name), std::move(queue), std::move(handler), false});
     return 0;
@@ -92,13 +82,12 @@ class FakeNamedNotifications : public platform::NamedNotifications {
 
   struct Registration {
     std::string name;
-    std::shared_ptr<platform::WorkQueue> queue;
+    std::shared_ptr<WorkQueue> queue;
     Handler handler;
     bool pending;
   };
   std::map<std::int32_t, std::shared_ptr<Registration>> registrations;
   std::vector<std::int32_t> cancelled;
-  bool failing = false;
 
  private:
   Effects& effects;
@@ -106,61 +95,53 @@ class FakeNamedNotifications : public platform::NamedNotifications {
   std::int32_t lastToken = 0;
 };
 
-// Alarms of any stream whose descriptors have a "Date"; they come due as FakePlatform::advance() moves the
-// clock. Unlike the service manager it delivers what is overdue at once, and keeps alarms only as long as it
-// lives.
-class FakeEventStreams : public platform::EventStreams {
+// Alarms of any stream; they come due as FakePlatform::advance() moves the clock. Unlike the service manager
+// it delivers what is overdue at once, and keeps alarms only as long as it lives.
+class FakeEventStreams : public EventStreams {
  public:
   explicit FakeEventStreams(Effects& effects_) : effects(effects_) {}
 
-  void setHandler(std::string_view stream, std::shared_ptr<platform::WorkQueue> queue,
-                  Handler handler) override {
+  void setHandler(std::string_view stream, std::shared_ptr<WorkQueue> queue, Handler handler) override {
     handlers[std::string(stream)] =
         std::make_shared<Installed>(Installed{std::move(queue), std::move(handler)});
-    for (const auto& event : std::exchange(early[std::string(stream)], {})) deliver(stream, event);
   }
   void setEvent(std::string_view stream, std::string_view name,
-                const std::optional<platform::Dictionary>& descriptor) override {
-    const Key key{stream, name};
+                const std::optional<Dictionary>& descriptor) override {
+    if (isCut && isCut()) return;
     const std::string text = Effects::shortKey(name) == "flag" ? "alarm" : "alarm " + std::string(name);
-    if (!descriptor) {
-      alarms.erase(key);
-      return effects.record(Effects::alarm, text + " cleared");
-    }
-    const auto date = descriptor->find("Date");
-    const auto* due = date == descriptor->end() ? nullptr : date->second.as<platform::Date>();
-    if (!due) return effects.record(Effects::alarm, text + " refused");
-    alarms[key] = {due->nanoseconds, ++lastGeneration, false};
-    effects.record(Effects::alarm, text + " at " + std::to_string(due->nanoseconds) + " ns");
+    alarms.erase({std::string(stream), std::string(name)});
+    if (!descriptor) return effects.record(Effects::alarm, text + " cleared");
+    const std::int64_t due = descriptor->at("Date").as<Date>()->nanoseconds;
+    alarms[{std::string(stream), std::string(name)}] = {due, ++lastGeneration, false};
+    effects.record(Effects::alarm, text + " at " + std::to_string(due) + " ns");
   }
 
-  void deliver(std::string_view stream, const platform::Dictionary& event) {
-    const auto found = handlers.find(stream);
-    if (found == handlers.end()) return early[std::string(stream)].push_back(event);
-    found->second->queue->async([installed = found->second, event] { installed->handler(event); });
+  void deliver(std::string_view stream, const Dictionary& event) {
+    const auto installed = handlers.find(stream)->second;
+    installed->queue->async([installed, event] { installed->handler(event); });
   }
   // When the next alarm comes due that is not on its way yet.
-  std::optional<platform::Time> nextDue() const {
-    std::optional<platform::Time> next;
+  std::optional<Time> nextDue() const {
+    std::optional<Time> next;
     for (const auto& [key, alarm] : alarms) {
-      if (!alarm.sent && handlers.count(key.first) && (!next || alarm.due() < *next)) next = alarm.due();
+      if (!alarm.sent && handlers.contains(key.first) && (!next || alarm.due() < *next)) next = alarm.due();
     }
     return next;
   }
   // An alarm goes when its handler has returned, unless it was set anew; replaced or cleared before its event
   // was handled, it does not come.
-  void deliverDue(platform::Time now) {
+  void deliverDue(Time now) {
     for (auto& [key, alarm] : alarms) {
       const auto found = handlers.find(key.first);
       if (alarm.sent || alarm.due() > now || found == handlers.end()) continue;
       alarm.sent = true;
-      found->second->queue->async(
-          [this, installed = found->second, key = key, generation = alarm.generation] {
-            const auto isCurrent = [&] { return alarms.count(key) && alarms[key].generation == generation; };
-            if (!isCurrent()) return;
-            installed->handler({{std::string(nameKey), key.second}});
-            if (isCurrent()) alarms.erase(key);
-          });
+      found->second->queue->async([this, installed = found->second, key = key,
+                                   generation = alarm.generation] {
+        const auto isCurrent = [&] { return alarms.contains(key) && alarms[key].generation == generation; };
+        if (!isCurrent()) return;
+        installed->handler({{std::string(nameKey), key.second}});
+        if (isCurrent()) alarms.erase(key);
+      });
     }
   }
 
@@ -169,18 +150,18 @@ class FakeEventStreams : public platform::EventStreams {
     std::int64_t nanoseconds;
     std::uint64_t generation;
     bool sent;
-    platform::Time due() const { return platform::Time(static_cast<double>(nanoseconds) / 1e9); }
+    Time due() const { return Time(static_cast<double>(nanoseconds) / 1e9); }
   };
   struct Installed {
-    std::shared_ptr<platform::WorkQueue> queue;
+    std::shared_ptr<WorkQueue> queue;
     Handler handler;
   };
   std::map<Key, Alarm> alarms;
+  std::function<bool()> isCut;  // whether the process's calls reach nobody any more
   std::map<std::string, std::shared_ptr<Installed>, std::less<>> handlers;
 
  private:
   Effects& effects;
-  std::map<std::string, std::vector<platform::Dictionary>, std::less<>> early;
   std::uint64_t lastGeneration = 0;
 };
 

@@ -3,7 +3,6 @@
 #include <gtest/gtest.h>
 
 #include <algorithm>
-#include <iostream>
 
 namespace fakes {
 
@@ -32,14 +31,12 @@ bool FakePlatform::runOne() {
 }
 
 void FakePlatform::runAll() {
-  for (int count = 0; count < 10'000; ++count) {
-    if (!runOne()) return;
-  }
-  ADD_FAILURE() << "the device does not come to rest";
+  int count = 0;
+  while (runOne()) ASSERT_LT(++count, 10'000) << "the device does not come to rest";
 }
 
-void FakePlatform::advance(platform::Time duration) {
-  const platform::Time target = manualClock.time + duration;
+void FakePlatform::advance(Time duration) {
+  const Time target = manualClock.time + duration;
   runAll();
   while (const auto due = streams.nextDue()) {
     if (*due > target) break;
@@ -51,19 +48,8 @@ void FakePlatform::advance(platform::Time duration) {
   runAll();
 }
 
-std::shared_ptr<platform::CloudStore> FakePlatform::makeCloudStore(std::string_view identifier,
-                                                                   int typeCode) {
-  cloudStoresMade.push_back(std::string(identifier) + " " + std::to_string(typeCode));
-  return cloud;
-}
-
-std::shared_ptr<platform::ServiceListener> FakePlatform::makeServiceListener(std::string_view serviceName) {
-  listeners.push_back(std::make_shared<FakeServiceListener>(serviceName));
-  return listeners.back();
-}
-
 void FakePlatform::teardown() {
-  const platform::PlatformScope scope(*this);
+  const PlatformScope scope(*this);
   effects.onMoment = nullptr;
   named.registrations.clear();
   streams.handlers.clear();
@@ -73,9 +59,7 @@ void FakePlatform::teardown() {
   for (const auto& cut : std::exchange(cutSubscriptions, {})) cut();
   const auto dropWork = [this] {
     while (!pool->isEmpty() || !loop.queue->isEmpty() || !delivery->isEmpty()) {
-      pool->drop();
-      loop.queue->drop();
-      delivery->drop();
+      for (const auto& queue : {pool, loop.queue, delivery}) queue->drop();
     }
   };
   dropWork();

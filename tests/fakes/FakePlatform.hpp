@@ -1,22 +1,15 @@
 // One device made of fakes, moved by hand.
 #pragma once
 
-#include <cstdint>
-#include <functional>
 #include <memory>
 #include <optional>
 #include <random>
 #include <string>
-#include <string_view>
 #include <vector>
 
-#include "platform/Platform.hpp"
-#include "tests/fakes/Effects.hpp"
-#include "tests/fakes/FakeEnvironment.hpp"
 #include "tests/fakes/FakeNotifications.hpp"
 #include "tests/fakes/FakeService.hpp"
 #include "tests/fakes/FakeStores.hpp"
-#include "tests/fakes/ManualPool.hpp"
 
 namespace fakes {
 
@@ -39,47 +32,50 @@ class FakePlatform : public platform::Platform {
   // Everything that is queued and what that queues. Fails the test if that does not end.
   void runAll();
   // Lets time pass, with a stop at every date on the way at which an alarm comes due.
-  void advance(platform::Time duration);
+  void advance(Time duration);
 
   // Run by teardown() when the handlers are gone: lists that hold their members strongly are emptied here.
   std::vector<std::function<void()>> cutSubscriptions;
   // Handlers, subscriptions, queued work, slots, while the platform is current; the destructor does it too.
   void teardown();
 
-  platform::RunLoop& runLoop() override { return loop; }
-  platform::Queues& queues() override { return queueMaker; }
-  platform::LogSink& logSink() override { return log; }
-  platform::ProcessEnvironment& environment() override { return variables; }
-  platform::Clock& clock() override { return manualClock; }
-  platform::SystemControl& systemControl() override { return kernel; }
-  platform::DeviceProperties& deviceProperties() override { return device; }
-  platform::NamedNotifications& namedNotifications() override { return named; }
-  platform::NamedNotificationCentre* namedNotificationCentre() override {
-    return hasNamedCentre ? &namedCentre : nullptr;
+  RunLoop& runLoop() override { return loop; }
+  Queues& queues() override { return queueMaker; }
+  LogSink& logSink() override { return log; }
+  ProcessEnvironment& environment() override { return variables; }
+  Clock& clock() override { return manualClock; }
+  SystemControl& systemControl() override { return kernel; }
+  DeviceProperties& deviceProperties() override { return device; }
+  NamedNotifications& namedNotifications() override { return named; }
+  NamedNotificationCentre* namedNotificationCentre() override { return &namedCentre; }
+  NotificationCentre& notificationCentre() override { return centre; }
+  std::shared_ptr<UserPreferences> userPreferences() override { return user; }
+  std::shared_ptr<CloudStore> makeCloudStore(std::string_view identifier, int typeCode) override {
+    cloudStoresMade.push_back(std::string(identifier) + " " + std::to_string(typeCode));
+    return cloud;
   }
-  platform::NotificationCentre& notificationCentre() override { return centre; }
-  std::shared_ptr<platform::UserPreferences> userPreferences() override { return user; }
-  std::shared_ptr<platform::CloudStore> makeCloudStore(std::string_view identifier, int typeCode) override;
-  platform::RadixController& radixController() override { return radix; }
-  platform::EventStreams& eventStreams() override { return streams; }
-  std::shared_ptr<platform::ServiceListener> makeServiceListener(std::string_view serviceName) override;
+  RadixController& radixController() override { return radix; }
+  EventStreams& eventStreams() override { return streams; }
+  std::shared_ptr<ServiceListener> makeServiceListener(std::string_view) override {
+    return listeners.emplace_back(std::make_shared<FakeServiceListener>());
+  }
   void willStop(std::string_view text) override { throw Stopped{std::string(text)}; }
 
   Effects effects;
   const std::shared_ptr<ManualPool> pool = std::make_shared<ManualPool>(*this);
   const std::shared_ptr<ManualPool> delivery = std::make_shared<ManualPool>(*this);
   ManualRunLoop loop{*this};
-  platform::Queues queueMaker{pool};
+  Queues queueMaker{pool};
   FakeLogSink log{effects};
   FakeEnvironment variables;
   ManualClock manualClock;
   FakeSystemControl kernel;
   FakeDeviceProperties device;
   FakeNamedNotificationCentre namedCentre{loop.queue};
-  bool hasNamedCentre = true;
   FakeNamedNotifications named{effects, namedCentre};
-  platform::NotificationCentre centre;
-  const std::shared_ptr<FakeUserPreferences> user = std::make_shared<FakeUserPreferences>(effects, delivery);
+  NotificationCentre centre;
+  const std::shared_ptr<FakeUserPreferences> user =
+      std::make_shared<FakeUserPreferences>("user", effects, delivery);
   const std::shared_ptr<FakeCloudStore> cloud = std::make_shared<FakeCloudStore>(effects, delivery, centre);
   std::vector<std::string> cloudStoresMade;  // "identifier typeCode"
   FakeRadixController radix{effects};
@@ -87,11 +83,12 @@ class FakePlatform : public platform::Platform {
   std::vector<std::shared_ptr<FakeServiceListener>> listeners;
 
  private:
-  // Records the one post that the in-process centre carries besides the cloud store's own.
+  // Records the one post that the in-process centre carries besides the cloud store's own:
+  // com.kestrel.pairwell.…
   struct PostRecorder {
     Effects& effects;
-    void record(const platform::Notification& notification) {
-      effects.record(Effects::post, "post " + Effects::shortName(notification.name).substr(9));
+    void record(const Notification& notification) {
+      effects.record(Effects::post, "post " + notification.name.substr(21));
     }
   };
 

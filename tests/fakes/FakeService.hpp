@@ -1,37 +1,32 @@
 // The client service, with clients that a test makes up.
 #pragma once
 
-#include <cstdint>
-#include <functional>
 #include <memory>
 #include <optional>
 #include <string>
-#include <string_view>
 #include <utility>
 #include <vector>
 
-#include "platform/Platform.hpp"
 #include "platform/ServiceListener.hpp"
-#include "tests/fakes/Effects.hpp"
+#include "tests/fakes/FakeEnvironment.hpp"
 
 namespace fakes {
 
-class FakeClientConnection : public platform::ClientConnection {
+class FakeClientConnection : public ClientConnection {
  public:
-  FakeClientConnection(Effects& effects_, std::int32_t process_, platform::Dictionary entitlements_)
-      : entitlements(std::move(entitlements_)), effects(effects_), process(process_) {}
+  FakeClientConnection(Effects& effects_, std::int32_t process_, Dictionary entitlements_)
+      : effects(effects_), process(process_), entitlements(std::move(entitlements_)) {}
 
   std::int32_t processIdentifier() const override { return process; }
-  std::optional<platform::Value> valueForEntitlement(std::string_view name) override {
-    lookedUp.emplace_back(name);
+  std::optional<Value> valueForEntitlement(std::string_view name) override {
     const auto found = entitlements.find(name);
     return found == entitlements.end() ? std::nullopt : std::optional(found->second);
   }
-  void setExportedInterface(std::shared_ptr<const platform::InterfaceDescription> description) override {
+  void setExportedInterface(std::shared_ptr<const InterfaceDescription> description) override {
     exportedInterface = std::move(description);
     effects.record(Effects::client, "exported interface");
   }
-  void setExportedObject(std::shared_ptr<platform::RadixUserControllerInterface> object) override {
+  void setExportedObject(std::shared_ptr<RadixUserControllerInterface> object) override {
     exportedObject = std::move(object);
     effects.record(Effects::client, "exported object");
   }
@@ -39,14 +34,11 @@ class FakeClientConnection : public platform::ClientConnection {
     invalidationHandler = std::move(handler);
     effects.record(Effects::client, "invalidation handler");
   }
-  void setRemoteObjectInterface(std::shared_ptr<const platform::InterfaceDescription> description) override {
+  void setRemoteObjectInterface(std::shared_ptr<const InterfaceDescription> description) override {
     remoteInterface = std::move(description);
     effects.record(Effects::client, "remote interface");
   }
-  void resume() override {
-    resumed = true;
-    effects.record(Effects::client, "resumed");
-  }
+  void resume() override { effects.record(Effects::client, "resumed"); }
 
   // The client goes. Runs the handler at once, on the caller's thread, and then lets go of what was held.
   void end() {
@@ -54,39 +46,28 @@ class FakeClientConnection : public platform::ClientConnection {
     if (const auto handler = std::exchange(invalidationHandler, nullptr)) handler();
   }
 
-  platform::Dictionary entitlements;
-  std::vector<std::string> lookedUp;
-  std::shared_ptr<const platform::InterfaceDescription> exportedInterface;
-  std::shared_ptr<const platform::InterfaceDescription> remoteInterface;
-  std::shared_ptr<platform::RadixUserControllerInterface> exportedObject;
-  std::function<void()> invalidationHandler;
-  bool resumed = false;
+  std::shared_ptr<const InterfaceDescription> exportedInterface, remoteInterface;
+  std::shared_ptr<RadixUserControllerInterface> exportedObject;
   std::optional<bool> admitted;
 
  private:
   Effects& effects;
   const std::int32_t process;
+  const Dictionary entitlements;
+  std::function<void()> invalidationHandler;
 };
 
-class FakeServiceListener : public platform::ServiceListener,
-                            public std::enable_shared_from_this<FakeServiceListener> {
- public:
-  explicit FakeServiceListener(std::string_view serviceName_) : serviceName(serviceName_) {}
-
-  void setDelegate(std::weak_ptr<platform::ServiceListenerDelegate> newDelegate) override {
+struct FakeServiceListener : ServiceListener, std::enable_shared_from_this<FakeServiceListener> {
+  void setDelegate(std::weak_ptr<ServiceListenerDelegate> newDelegate) override {
     delegate = std::move(newDelegate);
   }
-  void setQueue(std::shared_ptr<platform::WorkQueue> newQueue) override { queue = std::move(newQueue); }
-  void resume() override {
-    resumed = true;
-    for (auto& connection : std::exchange(waiting, {})) offer(std::move(connection));
-  }
+  void setQueue(std::shared_ptr<WorkQueue> newQueue) override { queue = std::move(newQueue); }
+  void resume() override { resumed = true; }
   void invalidate() override { invalidated = true; }
 
   // A client comes. One that comes after invalidate() is left without an answer.
   void offer(std::shared_ptr<FakeClientConnection> connection) {
-    if (invalidated) return;
-    if (!resumed) return waiting.push_back(std::move(connection));
+    if (invalidated || !resumed) return;
     queue->async([self = shared_from_this(), connection = std::move(connection)] {
       const auto decider = self->delegate.lock();
       connection->admitted = decider && decider->listenerShouldAcceptNewConnection(self, connection);
@@ -94,15 +75,10 @@ class FakeServiceListener : public platform::ServiceListener,
     });
   }
 
-  const std::string serviceName;
-  std::shared_ptr<platform::WorkQueue> queue;
-  std::weak_ptr<platform::ServiceListenerDelegate> delegate;
+  std::shared_ptr<WorkQueue> queue;
+  std::weak_ptr<ServiceListenerDelegate> delegate;
   std::vector<std::shared_ptr<FakeClientConnection>> clients;
-  bool resumed = false;
-  bool invalidated = false;
-
- private:
-  std::vector<std::shared_ptr<FakeClientConnection>> waiting;
+  bool resumed = false, invalidated = false;
 };
 
 }  // namespace fakes

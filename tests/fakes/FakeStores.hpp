@@ -1,18 +1,17 @@
 // The three stores, in memory. Any write fails, and leaves what was there, once a test says so.
 #pragma once
 
+#include <algorithm>
 #include <memory>
 #include <optional>
 #include <string>
-#include <string_view>
 #include <system_error>
 #include <utility>
 #include <vector>
 
 #include "platform/NotificationCentre.hpp"
 #include "platform/Stores.hpp"
-#include "tests/fakes/Effects.hpp"
-#include "tests/fakes/ManualPool.hpp"
+#include "tests/fakes/FakeEnvironment.hpp"
 
 namespace fakes {
 
@@ -20,53 +19,46 @@ namespace fakes {
 template <class Interface>
 class FakeKeyValueStore : public Interface {
  public:
-  FakeKeyValueStore(std::string name_, Effects& effects_) : effects(effects_), name(std::move(name_)) {}
+  FakeKeyValueStore(std::string name_, Effects& effects_, std::shared_ptr<ManualPool> delivery_)
+      : delivery(std::move(delivery_)), effects(effects_), name(std::move(name_)) {}
 
-  bool boolForKey(std::string_view key) override { return converted(key, platform::toBool).value_or(false); }
-  double doubleForKey(std::string_view key) override {
-    return converted(key, platform::toDouble).value_or(0.0);
-  }
-  std::optional<std::string> textForKey(std::string_view key) override {
-    return converted(key, platform::toText);
-  }
-  void setValue(const std::optional<platform::Value>& value, std::string_view key) override {
+  bool boolForKey(std::string_view key) override { return converted(key, toBool).value_or(false); }
+  double doubleForKey(std::string_view key) override { return converted(key, toDouble).value_or(0.0); }
+  std::optional<std::string> textForKey(std::string_view key) override { return converted(key, toText); }
+  void setValue(const std::optional<Value>& value, std::string_view key) override {
     if (!failing) store(key, value);
-    effects.record(Effects::store, name + " " + Effects::shortKey(key) + "=" + platform::describe(value) +
-                                       (failing ? " failed" : ""));
+    effects.record(Effects::store,
+                   name + " " + Effects::shortKey(key) + "=" + describe(value) + (failing ? " failed" : ""));
   }
-  void addObserver(std::weak_ptr<platform::KeyObserver> observer, std::string_view key) override {
-    const platform::KeyObserver* address = observer.lock().get();
+  void addObserver(std::weak_ptr<KeyObserver> observer, std::string_view key) override {
+    const KeyObserver* address = observer.lock().get();
     observers.push_back({std::move(observer), address, std::string(key)});
   }
-  void removeObserver(const platform::KeyObserver* observer, std::string_view key) override {
-    std::erase_if(observers,
-                  [&](const auto& entry) { return entry.address == observer && entry.key == key; });
+  void removeObserver(const KeyObserver* observer, std::string_view key) override {
+    std::erase_if(observers, [&](const auto& each) { return each.address == observer && each.key == key; });
   }
 
   // Puts a value there as if it had always been: no effect, no observer.
-  void store(std::string_view key, const std::optional<platform::Value>& value) {
-    if (value) {
-      contents.insert_or_assign(std::string(key), *value);
-    } else if (const auto found = contents.find(key); found != contents.end()) {
-      contents.erase(found);
-    }
+  void store(std::string_view key, const std::optional<Value>& value) {
+    contents.erase(std::string(key));
+    if (value) contents.emplace(key, *value);
   }
-  std::optional<platform::Value> value(std::string_view key) const {
+  std::optional<Value> value(std::string_view key) const {
     const auto found = contents.find(key);
     return found == contents.end() ? std::nullopt : std::optional(found->second);
   }
 
   struct Observation {
-    std::weak_ptr<platform::KeyObserver> observer;
-    const platform::KeyObserver* address;
+    std::weak_ptr<KeyObserver> observer;
+    const KeyObserver* address;
     std::string key;
   };
-  platform::Dictionary contents;
+  Dictionary contents;
   std::vector<Observation> observers;
   bool failing = false;
 
  protected:
-  Effects& effects;
+  const std::shared_ptr<ManualPool> delivery;
 
  private:
   template <class Convert>
@@ -76,96 +68,81 @@ class FakeKeyValueStore : public Interface {
     return found ? convert(*found) : std::nullopt;
   }
 
+  Effects& effects;
   const std::string name;
 };
 
-class FakeUserPreferences : public FakeKeyValueStore<platform::UserPreferences> {
+class FakeUserPreferences : public FakeKeyValueStore<UserPreferences> {
  public:
-  FakeUserPreferences(Effects& recorder, std::shared_ptr<ManualPool> delivery_)
-      : FakeKeyValueStore("user", recorder), delivery(std::move(delivery_)) {}
+  using FakeKeyValueStore::FakeKeyValueStore;
 
-  void setValue(const std::optional<platform::Value>& newValue, std::string_view key) override {
+  void setValue(const std::optional<Value>& newValue, std::string_view key) override {
     FakeKeyValueStore::setValue(newValue, key);
     if (!failing) report(std::string(key));
   }
   // Another process writes. Observers hear of it on the delivery thread.
-  void changeFromElsewhere(std::string_view key, const std::optional<platform::Value>& newValue) {
+  void changeFromElsewhere(std::string_view key, const std::optional<Value>& newValue) {
     store(key, newValue);
     delivery->async([this, key = std::string(key)] { report(key); });
   }
 
  private:
   void report(const std::string& key) {
-    const auto snapshot = observers;
-    for (const Observation& entry : snapshot) {
-      if (entry.key != key) continue;
-      if (const auto observer = entry.observer.lock()) observer->observeValue(key, this);
+    for (const Observation& entry : std::vector(observers)) {
+      const auto observer = entry.observer.lock();
+      if (entry.key == key && observer) observer->observeValue(key, this);
     }
   }
-
-  const std::shared_ptr<ManualPool> delivery;
 };
 
-class FakeCloudStore : public FakeKeyValueStore<platform::CloudStore> {
+class FakeCloudStore : public FakeKeyValueStore<CloudStore> {
  public:
-  FakeCloudStore(Effects& recorder, std::shared_ptr<ManualPool> delivery_,
-                 platform::NotificationCentre& centre_)
-      : FakeKeyValueStore("cloud", recorder), delivery(std::move(delivery_)), centre(centre_) {}
+  FakeCloudStore(Effects& recorder, std::shared_ptr<ManualPool> delivery_, NotificationCentre& centre_)
+      : FakeKeyValueStore("cloud", recorder, std::move(delivery_)), centre(centre_) {}
 
   bool synchronise() override { return !failing; }
-  platform::Dictionary dictionaryRepresentation() override {
-    ++representations;
-    return contents;
-  }
+  Dictionary dictionaryRepresentation() override { return contents; }
 
   // Another device writes.
-  void changeFromElsewhere(const platform::Dictionary& changes) {
-    platform::List keys;
+  void changeFromElsewhere(const Dictionary& changes) {
+    List keys;
     for (const auto& [key, newValue] : changes) {
-      store(key, newValue == platform::Value() ? std::nullopt : std::optional(newValue));
+      store(key, newValue);
       keys.emplace_back(key);
     }
-    announce(platform::Dictionary{{std::string(changeReasonKey), 0}, {std::string(changedKeysKey), keys}});
+    announce(Dictionary{{std::string(changeReasonKey), 0}, {std::string(changedKeysKey), keys}});
   }
-  void announce(std::optional<platform::Dictionary> userInfo) {
+  void announce(std::optional<Dictionary> userInfo) {
     delivery->async([this, userInfo = std::move(userInfo)] {
-      centre.post(externalChangeNotification, static_cast<platform::CloudStore*>(this), userInfo);
+      centre.post(externalChangeNotification, static_cast<CloudStore*>(this), userInfo);
     });
   }
 
-  int representations = 0;
-
  private:
-  const std::shared_ptr<ManualPool> delivery;
-  platform::NotificationCentre& centre;
+  NotificationCentre& centre;
 };
 
-class FakeRadixController : public platform::RadixController {
- public:
+struct FakeRadixController : RadixController {
   explicit FakeRadixController(Effects& effects_) : effects(effects_) {}
 
-  platform::Result<platform::Dictionary> readPrefKeys(const std::vector<std::string>& keys) override {
+  Result<Dictionary> readPrefKeys(const std::vector<std::string>& keys) override {
     if (failure) return failure;
-    platform::Dictionary found;
-    for (const auto& [key, value] : contents) {
-      if (std::find(keys.begin(), keys.end(), key) != keys.end()) found.emplace(key, value);
-    }
+    Dictionary found = contents;
+    std::erase_if(found, [&](const auto& entry) { return std::ranges::count(keys, entry.first) == 0; });
     return found;
   }
-  platform::Result<void> writePrefKey(std::string_view key, const platform::Value& value) override {
+  Result<void> writePrefKey(std::string_view key, const Value& value) override {
     if (!failure) {
       contents.erase(std::string(key));
-      if (!(value == platform::Value())) contents.emplace(key, value);
+      if (!(value == Value())) contents.emplace(key, value);
     }
-    effects.record(Effects::store, "root " + Effects::shortKey(key) + "=" + platform::describe(value) +
-                                       (failure ? " failed" : ""));
+    effects.record(Effects::store,
+                   "root " + Effects::shortKey(key) + "=" + describe(value) + (failure ? " failed" : ""));
     return failure;
   }
 
-  platform::Dictionary contents;
+  Dictionary contents;
   std::error_code failure;
-
- private:
   Effects& effects;
 };
 

@@ -10,25 +10,18 @@
 #include <memory>
 #include <set>
 #include <string>
-#include <string_view>
-#include <system_error>
 #include <utility>
 #include <vector>
 
 #include "platform/linux/FileSystem.hpp"
+#include "tests/fakes/Effects.hpp"
 
 namespace fakes {
 
-class MemoryFileSystem : public platform::linux_::FileSystem {
- public:
-  template <class T>
-  using Result = platform::Result<T>;
-  using File = platform::linux_::File;
-  using FileIdentity = platform::linux_::FileIdentity;
-  using FileLock = platform::linux_::FileLock;
-  using FolderWatch = platform::linux_::FolderWatch;
-  using Changed = std::function<void(const std::string&)>;
+using namespace platform::linux_;
 
+class MemoryFileSystem : public FileSystem {
+ public:
   // Calls are counted; from the `failFrom`th on all fail with `failure`.
   int calls = 0;
   int failFrom = std::numeric_limits<int>::max();
@@ -127,7 +120,8 @@ class MemoryFileSystem : public platform::linux_::FileSystem {
     locks[path] = held->token;
     return std::unique_ptr<FileLock>(std::move(held));
   }
-  Result<std::unique_ptr<FolderWatch>> watch(const std::string& folder, Changed changed) override {
+  Result<std::unique_ptr<FolderWatch>> watch(const std::string& folder,
+                                             std::function<void(const std::string&)> changed) override {
     if (const int error = check(folder)) return code(error);
     auto held = std::make_unique<Held<FolderWatch>>();
     watches.push_back({held->token, folder, std::move(changed)});
@@ -176,7 +170,7 @@ class MemoryFileSystem : public platform::linux_::FileSystem {
   struct Watched {
     std::weak_ptr<int> token;
     std::string folder;
-    Changed changed;
+    std::function<void(const std::string&)> changed;
   };
 
   static std::error_code code(int error) { return {error, std::system_category()}; }

@@ -4,14 +4,6 @@
 #include <gmock/gmock.h>
 #include <gtest/gtest.h>
 
-#include <cstdint>
-#include <functional>
-#include <memory>
-#include <string>
-#include <string_view>
-#include <utility>
-#include <vector>
-
 #include "pairwelld/PairwellDaemon.hpp"
 #include "pairwelld/debug/DebugManager.hpp"
 #include "pairwelld/notifications/SystemNotificationManager.hpp"
@@ -30,12 +22,6 @@ using testing::IsEmpty;
 inline constexpr const char* flagKey = "VelaLogCloudCollectionEnabled";
 inline constexpr const char* endKey = "VelaLogCloudCollectionEnabledExpiration";
 inline constexpr const char* overrideKey = "VelaLogCloudCollectionExpirationIntervalOverride";
-
-// Runs `work` on `queue`, in the test's thread.
-template <class Work>
-void on(const std::shared_ptr<platform::SerialQueue>& queue, Work work) {
-  queue->sync([&] { work(); });
-}
 
 // Publisher and subscriber hold each other; this cuts it.
 template <class Publisher>
@@ -56,7 +42,6 @@ struct Subscriber : KeyValueStoreManagerSubscribing, SystemNotificationManagerSu
     calls.push_back(label + " " + std::string(source) + " " + Effects::shortKey(what));
     if (const auto call = onCall) call();  // it may replace itself
   }
-
   const std::string label;
   Calls& calls;
   std::function<void()> onCall;

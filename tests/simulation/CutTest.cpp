@@ -1,56 +1,22 @@
 // A device cut short between any two effects of a switch: what is left, and that it can be used again.
-#include <gmock/gmock.h>
-#include <gtest/gtest.h>
-
 #include <cmath>
-#include <limits>
-#include <map>
-#include <memory>
-#include <optional>
-#include <string>
-#include <string_view>
-#include <utility>
 
-#include "pairwelld/debug/DebugManager.hpp"
-#include "pairwelld/notifications/SystemNotificationManager.hpp"
-#include "pairwelld/settings/KeyValueStoreManager.hpp"
 #include "platform/linux/FileRadixController.hpp"
 #include "platform/linux/FileUserPreferences.hpp"
 #include "platform/linux/ReplicaFileCloudStore.hpp"
-#include "tests/fakes/FakePlatform.hpp"
 #include "tests/fakes/MemoryFileSystem.hpp"
+#include "tests/pairwelld/World.hpp"
 
 namespace pairwell {
 namespace {
 
 using Defaults = KeyValueStoreManager::Defaults;
-constexpr platform::Time period{345600};
 
 // What outlives a process: the files, the clock, and hearthd with its alarms. All operations count together.
 struct Machine {
-  bool works() { return ++files.calls < files.failFrom; }
-
   fakes::MemoryFileSystem files;
   std::map<fakes::FakeEventStreams::Key, fakes::FakeEventStreams::Alarm> alarms;
   platform::Time now{1'000'000};
-};
-
-class CuttableStreams : public platform::EventStreams {
- public:
-  CuttableStreams(Machine& machine_, platform::EventStreams& streams_)
-      : machine(machine_), streams(streams_) {}
-  void setHandler(std::string_view stream, std::shared_ptr<platform::WorkQueue> queue,
-                  Handler handler) override {
-    streams.setHandler(stream, std::move(queue), std::move(handler));
-  }
-  void setEvent(std::string_view stream, std::string_view name,
-                const std::optional<platform::Dictionary>& descriptor) override {
-    if (machine.works()) streams.setEvent(stream, name, descriptor);
-  }
-
- private:
-  Machine& machine;
-  platform::EventStreams& streams;
 };
 
 // One run of the daemon's process, on the machine's files.
@@ -58,6 +24,7 @@ class Process : public fakes::FakePlatform {
  public:
   explicit Process(Machine& machine_) : machine(machine_), scope(*this) {
     manualClock.time = machine.now;
+    streams.isCut = [this] { return ++machine.files.calls >= machine.files.failFrom; };
     streams.alarms = machine.alarms;
     for (auto& [key, alarm] : streams.alarms) alarm.sent = false;
     kvs = KeyValueStoreManager::create();
@@ -70,9 +37,7 @@ class Process : public fakes::FakePlatform {
     machine.now = manualClock.time;
     machine.alarms = streams.alarms;
     dropSubscriptions(*kvs);
-    dropSubscriptions(*SystemNotificationManager::shared());
-    manager->kvsSubscription.reset();
-    manager->systemNotificationSubscription.reset();
+    World::letGo(*manager);
     manager.reset();
     kvs.reset();
     teardown();
@@ -80,10 +45,6 @@ class Process : public fakes::FakePlatform {
 
   void say(bool enabled) {
     manager->setAudioAccessoryLimitedLoggingEnabled(enabled);
-    settle();
-  }
-  void wait(platform::Time time) {
-    advance(time);
     settle();
   }
   bool isOn() { return manager->audioAccessoryLimitedLoggingEnabled(); }
@@ -108,13 +69,8 @@ class Process : public fakes::FakePlatform {
                                                            "/var/cloud.json");
   }
   platform::RadixController& radixController() override { return radix; }
-  platform::EventStreams& eventStreams() override { return cuttable; }
 
  private:
-  template <class Publisher>
-  static void dropSubscriptions(Publisher& publisher) PW_NO_ANALYSIS {
-    auto dropped = std::exchange(publisher.subscriptions, {});
-  }
   void settle() {
     runAll();
     machine.files.deliverEvents();
@@ -123,7 +79,6 @@ class Process : public fakes::FakePlatform {
 
   Machine& machine;
   const platform::PlatformScope scope;
-  CuttableStreams cuttable{machine, streams};
   const std::shared_ptr<platform::UserPreferences> user =
       platform::linux_::FileUserPreferences::create(machine.files, delivery.get(), "/var/user.json");
   platform::linux_::FileRadixController radix{machine.files, "/var/root.json"};
@@ -147,7 +102,7 @@ void checkAfterwards(Machine& machine) {
     EXPECT_EQ(process.isOn(), process.flag(KeyValueSource::cloud));
     // Off may leave the root flag, an end time or an alarm behind; on is whole.
     EXPECT_EQ(process.isOn(), process.isWholly());
-    process.wait(period + platform::Time(2));
+    process.advance(platform::Time(345602));
     EXPECT_FALSE(process.isOn());
     EXPECT_FALSE(process.flag(KeyValueSource::cloud));
     EXPECT_TRUE(process.streams.alarms.empty());

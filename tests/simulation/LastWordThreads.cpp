@@ -1,24 +1,20 @@
 // A client's last word on real threads, with writes as long as a disk's. Usage: last_word_threads [PAIRS]
-#include <chrono>
+#include <atomic>
 #include <cstdio>
 #include <cstdlib>
-#include <map>
 #include <mutex>
 #include <random>
-#include <string>
 #include <thread>
 
 #include "pairwelld/debug/DebugManager.hpp"
-#include "pairwelld/notifications/SystemNotificationManager.hpp"
 #include "pairwelld/settings/KeyValueStoreManager.hpp"
-#include "platform/linux/LinuxEnvironment.hpp"
 #include "platform/linux/ThreadPool.hpp"
-#include "tests/fakes/FakeEnvironment.hpp"
+#include "tests/fakes/FakePlatform.hpp"
 
 namespace pairwell {
 namespace {
 
-using platform::Value;
+using namespace platform;
 
 constexpr const char* flagKey = "VelaLogCloudCollectionEnabled";
 
@@ -32,17 +28,17 @@ void pause(int fromMicroseconds, int toMicroseconds) {
 template <class Interface>
 class SlowStore : public Interface {
  public:
-  bool boolForKey(std::string_view key) override { return get(key, platform::toBool).value_or(false); }
-  double doubleForKey(std::string_view key) override { return get(key, platform::toDouble).value_or(0.0); }
-  std::optional<std::string> textForKey(std::string_view key) override { return get(key, platform::toText); }
+  bool boolForKey(std::string_view key) override { return get(key, toBool).value_or(false); }
+  double doubleForKey(std::string_view key) override { return get(key, toDouble).value_or(0.0); }
+  std::optional<std::string> textForKey(std::string_view key) override { return get(key, toText); }
   void setValue(const std::optional<Value>& value, std::string_view key) override {
     std::lock_guard lock(mutex);
     pause(20, 400);
     contents.erase(std::string(key));
     if (value) contents.emplace(key, *value);
   }
-  void addObserver(std::weak_ptr<platform::KeyObserver>, std::string_view) override {}
-  void removeObserver(const platform::KeyObserver*, std::string_view) override {}
+  void addObserver(std::weak_ptr<KeyObserver>, std::string_view) override {}
+  void removeObserver(const KeyObserver*, std::string_view) override {}
 
  private:
   template <class Convert>
@@ -53,109 +49,83 @@ class SlowStore : public Interface {
     return convert(found->second);
   }
   std::mutex mutex;
-  platform::Dictionary contents;
+  Dictionary contents;
 };
 
-class SlowCloud : public SlowStore<platform::CloudStore> {
- public:
+struct SlowCloud : SlowStore<CloudStore> {
   bool synchronise() override { return true; }
-  platform::Dictionary dictionaryRepresentation() override { return {}; }
+  Dictionary dictionaryRepresentation() override { return {}; }
 };
 
-class SlowRadix : public platform::RadixController {
- public:
-  platform::Result<platform::Dictionary> readPrefKeys(const std::vector<std::string>& keys) override {
-    return platform::Dictionary{{keys.at(0), store.boolForKey(keys.at(0))}};
+struct SlowRadix : RadixController {
+  Result<Dictionary> readPrefKeys(const std::vector<std::string>& keys) override {
+    return Dictionary{{keys.at(0), store.boolForKey(keys.at(0))}};
   }
-  platform::Result<void> writePrefKey(std::string_view key, const Value& value) override {
+  Result<void> writePrefKey(std::string_view key, const Value& value) override {
     store.setValue(value, key);
     return {};
   }
-  SlowStore<platform::UserPreferences> store;
+  SlowStore<UserPreferences> store;
 };
 
 // Posts come back on the queue that they were asked for on; alarms are only counted.
-class Hearth : public platform::NamedNotifications, public platform::EventStreams {
+class Hearth : public NamedNotifications, public EventStreams {
  public:
   void post(std::string_view name) override {
     if (queue && name == "com.kestrel.bluetooth.prefsChanged") queue->async([this] { handler(1); });
   }
-  std::uint32_t registerHandler(std::string_view, std::int32_t& token,
-                                std::shared_ptr<platform::WorkQueue> queue_,
-                                platform::NamedNotifications::Handler handler_) override {
+  std::uint32_t registerHandler(std::string_view, std::int32_t& token, std::shared_ptr<WorkQueue> queue_,
+                                NamedNotifications::Handler handler_) override {
     token = 1;
     handler = std::move(handler_);
     queue = std::move(queue_);
     return 0;
   }
   void cancel(std::int32_t) override {}
-  void setHandler(std::string_view, std::shared_ptr<platform::WorkQueue>,
-                  platform::EventStreams::Handler) override {}
-  void setEvent(std::string_view, std::string_view,
-                const std::optional<platform::Dictionary>& descriptor) override {
+  void setHandler(std::string_view, std::shared_ptr<WorkQueue>, EventStreams::Handler) override {}
+  void setEvent(std::string_view, std::string_view, const std::optional<Dictionary>& descriptor) override {
     armed = descriptor.has_value();
   }
   std::atomic<bool> armed{false};
 
  private:
-  std::shared_ptr<platform::WorkQueue> queue;
-  platform::NamedNotifications::Handler handler;
+  std::shared_ptr<WorkQueue> queue;
+  NamedNotifications::Handler handler;
 };
 
-class SilentLog : public platform::LogSink {
-  bool enabled(const platform::LogChannel&, platform::LogLevel) override { return false; }
-  void write(const platform::LogChannel&, platform::LogLevel, std::string_view,
-             std::span<const platform::LogArgument>) override {}
+struct SilentLog : LogSink {
+  bool enabled(const LogChannel&, LogLevel) override { return false; }
+  void write(const LogChannel&, LogLevel, std::string_view, std::span<const LogArgument>) override {}
 };
 
-class PoolLoop : public platform::RunLoop {
- public:
-  explicit PoolLoop(std::shared_ptr<platform::WorkQueue> pool_) : pool(std::move(pool_)) {}
+struct PoolLoop : RunLoop {
+  explicit PoolLoop(std::shared_ptr<WorkQueue> pool_) : pool(std::move(pool_)) {}
   void run() override {}
   void stop() override {}
-  std::shared_ptr<platform::WorkQueue> mainQueue() override { return pool; }
-
- private:
-  const std::shared_ptr<platform::WorkQueue> pool;
+  std::shared_ptr<WorkQueue> mainQueue() override { return pool; }
+  const std::shared_ptr<WorkQueue> pool;
 };
 
-class ThreadedPlatform : public platform::Platform {
- public:
-  platform::RunLoop& runLoop() override { return loop; }
-  platform::Queues& queues() override { return queueMaker; }
-  platform::LogSink& logSink() override { return log; }
-  platform::ProcessEnvironment& environment() override { return variables; }
-  platform::Clock& clock() override { return wallClock; }
-  platform::SystemControl& systemControl() override { return kernel; }
-  platform::DeviceProperties& deviceProperties() override { return device; }
-  platform::NamedNotifications& namedNotifications() override { return hearth; }
-  platform::NamedNotificationCentre* namedNotificationCentre() override { return nullptr; }
-  platform::NotificationCentre& notificationCentre() override { return centre; }
-  std::shared_ptr<platform::UserPreferences> userPreferences() override { return user; }
-  std::shared_ptr<platform::CloudStore> makeCloudStore(std::string_view, int) override { return cloud; }
-  platform::RadixController& radixController() override { return radix; }
-  platform::EventStreams& eventStreams() override { return hearth; }
-  std::shared_ptr<platform::ServiceListener> makeServiceListener(std::string_view) override {
-    return nullptr;
-  }
+// Of the fakes it takes what no thread changes.
+struct ThreadedPlatform : fakes::FakePlatform {
+  RunLoop& runLoop() override { return poolLoop; }
+  Queues& queues() override { return threadedQueues; }
+  LogSink& logSink() override { return silentLog; }
+  NamedNotifications& namedNotifications() override { return hearth; }
+  NamedNotificationCentre* namedNotificationCentre() override { return nullptr; }
+  std::shared_ptr<UserPreferences> userPreferences() override { return slowUser; }
+  std::shared_ptr<CloudStore> makeCloudStore(std::string_view, int) override { return slowCloud; }
+  RadixController& radixController() override { return slowRadix; }
+  EventStreams& eventStreams() override { return hearth; }
 
-  const std::shared_ptr<platform::linux_::ThreadPool> pool =
-      std::make_shared<platform::linux_::ThreadPool>(4);
-  const std::shared_ptr<SlowCloud> cloud = std::make_shared<SlowCloud>();
-  SlowRadix radix;
+  const std::shared_ptr<linux_::ThreadPool> threads = std::make_shared<linux_::ThreadPool>(4);
+  PoolLoop poolLoop{threads};
+  Queues threadedQueues{threads};
+  SilentLog silentLog;
+  const std::shared_ptr<SlowStore<UserPreferences>> slowUser = std::make_shared<SlowStore<UserPreferences>>();
+  const std::shared_ptr<SlowCloud> slowCloud = std::make_shared<SlowCloud>();
+  SlowRadix slowRadix;
   Hearth hearth;
-
- private:
-  PoolLoop loop{pool};
-  platform::Queues queueMaker{pool};
-  SilentLog log;
-  fakes::FakeEnvironment variables;
-  platform::linux_::LinuxClock wallClock;
-  fakes::FakeSystemControl kernel;
-  fakes::FakeDeviceProperties device;
-  platform::NotificationCentre centre;
-  const std::shared_ptr<SlowStore<platform::UserPreferences>> user =
-      std::make_shared<SlowStore<platform::UserPreferences>>();
 };
 
 // How many of the pairs left something on, or did not come to rest.
@@ -166,9 +136,10 @@ long lostPairs(ThreadedPlatform& device, DebugManager& manager, long pairs) {
     if (pair % 2 == 0) pause(0, 3000);
     manager.setAudioAccessoryLimitedLoggingEnabled(false);
     const bool rests =
-        device.pool->waitUntilIdle(std::chrono::steady_clock::now() + std::chrono::seconds(10));
-    const bool off = !manager.audioAccessoryLimitedLoggingEnabled() && !device.cloud->boolForKey(flagKey) &&
-                     !device.radix.store.boolForKey(flagKey) && !device.hearth.armed;
+        device.threads->waitUntilIdle(std::chrono::steady_clock::now() + std::chrono::seconds(10));
+    const bool off = !manager.audioAccessoryLimitedLoggingEnabled() &&
+                     !device.slowCloud->boolForKey(flagKey) && !device.slowRadix.store.boolForKey(flagKey) &&
+                     !device.hearth.armed;
     if (!rests || !off) ++lost;
   }
   return lost;

@@ -37,28 +37,25 @@ class BusServerTest : public World {
 TEST_F(BusServerTest, CallsThatDoNotFitGetAnErrorAndNoMore) {
   std::string unended = callMessage("Echo", "text");
   unended.back() = 'x';
-  const struct {
-    std::string message;
-    int type;
-    std::string name;
-  } rows[] = {
-      {callMessage("Missing", ""), 3, "org.freedesktop.DBus.Error.UnknownMethod"},
-      {callMessage("Echo", "", {.interface = "test.Other"}), 3, "org.freedesktop.DBus.Error.UnknownMethod"},
-      {callMessage("Echo", "", {.path = "/other"}), 3, "org.freedesktop.DBus.Error.UnknownObject"},
-      {callMessage("Wide", "not a number"), 3, "org.freedesktop.DBus.Error.InvalidArgs"},
-      {unended, 3, "org.freedesktop.DBus.Error.InconsistentMessage"},
+  const std::string error = "org.freedesktop.DBus.Error.";
+  const std::pair<std::string, std::string> rows[] = {
+      {callMessage("Missing", ""), error + "UnknownMethod"},
+      {callMessage("Echo", "", {.interface = "test.Other"}), error + "UnknownMethod"},
+      {callMessage("Echo", "", {.path = "/other"}), error + "UnknownObject"},
+      {callMessage("Wide", "not a number"), error + "InvalidArgs"},
+      {unended, error + "InconsistentMessage"},
       {callMessage("GetNameOwner", "x.y",
                    {.path = "/org/freedesktop/DBus", .interface = "org.freedesktop.DBus"}),
-       2, ""},
-      {callMessage("Echo", "text"), 2, ""},
+       ""},
+      {callMessage("Echo", "text"), ""},
   };
   Wire wire = client();
-  for (const auto& row : rows) {
-    ASSERT_TRUE(wire.send(row.message));
+  for (const auto& [message, name] : rows) {
+    ASSERT_TRUE(wire.send(message));
     const auto answer = wire.next();
     ASSERT_TRUE(answer);
-    EXPECT_EQ(answer->type, row.type) << row.name;
-    EXPECT_EQ(answer->name, row.name);
+    EXPECT_EQ(answer->type, name.empty() ? 2 : 3) << name;
+    EXPECT_EQ(answer->name, name);
   }
   auto library = BusClient::connect(path, deadline);
   ASSERT_TRUE(library);
@@ -116,52 +113,33 @@ TEST_F(BusServerTest, DamageEndsItsClientAloneAndHoldsNoMemory) {
   EXPECT_THAT(calls, testing::Not(testing::Contains("good")));
 }
 
-TEST_F(BusServerTest, PipelinedCallsAreAnsweredAsTheyAreCompleted) {
+TEST_F(BusServerTest, PipelinedCallsAreAnsweredAsTheyAreCompletedThoughTheClientSaysNoMore) {
   constexpr std::size_t count = 1000;
   Wire wire = client();
   const auto writing = std::async(std::launch::async, [&] {
     for (std::uint32_t serial = 1; serial <= count; ++serial)
       wire.send(callMessage("Hold", std::to_string(serial), {.serial = serial}));
+    wire.closeOutput();
   });
-  std::vector<std::string> completed;
-  std::size_t most = 0;
-  auto worker = std::async(std::launch::async, [&] {
+  std::vector<std::string> completed, answered;
+  const auto worker = std::async(std::launch::async, [&] {
     std::mt19937 random(7);
     while (completed.size() < count && waitFor([&] { return !held.empty(); })) {
       std::unique_lock lock(mutex);
-      most = std::max(most, held.size());
+      EXPECT_LE(held.size(), limits::outstanding);
       const std::size_t index = random() % held.size();
       completed.push_back(held[index].text);
       lock.unlock();
       complete(index);
     }
   });
-  std::vector<std::string> answered;
-  while (answered.size() < count) {
-    const auto answer = wire.next();
-    ASSERT_TRUE(answer);
+  while (const auto answer = wire.next()) {
     EXPECT_EQ(std::to_string(answer->serial), answer->text);
     answered.push_back(answer->text);
   }
   worker.wait();
+  EXPECT_EQ(answered.size(), count);
   EXPECT_EQ(answered, completed);
-  EXPECT_LE(most, limits::outstanding);
-}
-
-TEST_F(BusServerTest, AHalfClosedClientGetsAllItsAnswers) {
-  constexpr std::size_t count = limits::outstanding + 4;
-  Wire wire = client();
-  for (std::uint32_t serial = 1; serial <= count; ++serial)
-    ASSERT_TRUE(wire.send(callMessage("Hold", "", {.serial = serial})));
-  wire.closeOutput();
-  for (std::uint32_t serial = 1; serial <= count; ++serial) {
-    ASSERT_TRUE(waitFor([&] { return !held.empty(); }));
-    complete(0);
-    const auto answer = wire.next();
-    ASSERT_TRUE(answer);
-    EXPECT_EQ(answer->serial, serial);
-  }
-  EXPECT_EQ(wire.readToEnd(), "");
   EXPECT_TRUE(waitFor([&] { return closed == 1; }));
 }
 
@@ -202,13 +180,12 @@ TEST_F(BusServerTest, UnreadSignalsMergeByKeyAndKeepTheirOrder) {
     connections[0]->emit(1, {"y"}, "other");
     connections[0]->emit(0, {"newest"}, "same");
   });
-  std::vector<std::string> read;
-  do {
+  std::vector<std::string> read{"", "", ""};
+  while (read.back() != "Changed kept apart") {
     const auto signal = wire.next();
     ASSERT_TRUE(signal);
     read.push_back(signal->name + " " + signal->text);
-  } while (read.back() != "Changed kept apart");
-  ASSERT_GE(read.size(), 3u);
+  }
   EXPECT_LT(read.size(), count / 2);
   EXPECT_THAT(std::vector(read.end() - 3, read.end()),
               ElementsAre("Changed newest", "Other y", "Changed kept apart"));

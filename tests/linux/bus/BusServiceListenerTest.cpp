@@ -14,8 +14,7 @@ namespace {
 using namespace std::chrono_literals;
 
 // Holds status reads back, fails writes.
-class Controller : public RadixUserControllerInterface {
- public:
+struct Controller : RadixUserControllerInterface {
   void getDistributedLoggingStatus(std::function<void(std::uint32_t, OptionalError)> completion) override {
     held = std::move(completion);
     isHeld = true;
@@ -41,14 +40,14 @@ class BusServiceListenerTest : public testing::Test, public ServiceListenerDeleg
  protected:
   BusServiceListenerTest() {
     listener = BusServiceListener::create(loop, entitlements, "test.service", listenAt(path));
-    listener->setQueue(std::make_shared<PoolQueue>(pool));
+    listener->setQueue(pool);
     listener->setDelegate(std::shared_ptr<ServiceListenerDelegate>(self, this));
     listener->resume();
     thread = std::thread([this] { loop.run(); });
   }
   ~BusServiceListenerTest() override {
     listener.reset();
-    pool.waitUntilIdle(std::chrono::steady_clock::now() + deadline);
+    pool->waitUntilIdle(std::chrono::steady_clock::now() + deadline);
     loop.stop();
     thread.join();
   }
@@ -76,15 +75,6 @@ class BusServiceListenerTest : public testing::Test, public ServiceListenerDeleg
     return client ? std::error_code() : client.error();
   }
 
-  class PoolQueue : public WorkQueue {
-   public:
-    explicit PoolQueue(ThreadPool& pool_) : pool(pool_) {}
-    void async(Work work) override { pool.async(std::move(work)); }
-
-   private:
-    ThreadPool& pool;
-  };
-
   TemporaryFolder folder;
   const std::string path = folder.path + "/socket";
   LinuxFileSystem files{nullptr};
@@ -93,7 +83,7 @@ class BusServiceListenerTest : public testing::Test, public ServiceListenerDeleg
   std::atomic<int> invalidated = 0;
   std::shared_ptr<Controller> controller = std::make_shared<Controller>();
   const std::shared_ptr<int> self = std::make_shared<int>();  // stands for this test's life
-  ThreadPool pool{1};
+  const std::shared_ptr<ThreadPool> pool = std::make_shared<ThreadPool>(1);
   EventLoop loop;
   std::shared_ptr<BusServiceListener> listener;
   std::thread thread;
@@ -118,21 +108,17 @@ TEST_F(BusServiceListenerTest, EveryClientThatIsRefusedIsToldSo) {
   EXPECT_EQ(refusal(), Outcome::notPermitted) << "accepted, but never resumed";
   resumes = true;
   accepts = false;
-  EXPECT_EQ(refusal(), Outcome::notPermitted);
   for (int count = 0; count < 600; ++count) ASSERT_EQ(refusal(), Outcome::notPermitted) << count;
   const std::string refused = "REJECTED EXTERNAL\r\nREJECTED EXTERNAL\r\nREJECTED EXTERNAL\r\n";
   for (unsigned count = 0; count < 400; ++count) {
     const bool isLate = count % 2 == 1;
     const std::size_t piece = count % 4 < 2 ? handshakeAhead.size() : 1;
     Wire wire(path);
-    if (isLate) {
-      ASSERT_EQ(wire.readToEnd(), refused);
-    }
+    std::string told = isLate ? wire.readToEnd() : "";
     for (std::size_t at = 0; at < handshakeAhead.size(); at += piece)
       ASSERT_TRUE(wire.send(handshakeAhead.substr(at, piece))) << "a broken pipe is no refusal";
-    if (!isLate) {
-      ASSERT_EQ(wire.readToEnd(), refused);
-    }
+    if (!isLate) told = wire.readToEnd();
+    ASSERT_EQ(told, refused);
   }
   EXPECT_TRUE(eventually([&] { return openDescriptors() == before; }));
   EXPECT_EQ(invalidated, 0);

@@ -25,22 +25,23 @@ PeerIdentity::Executable executableAt(const std::string& path) {
   return {status.st_dev, status.st_ino};
 }
 
-TEST(PeerIdentityTest, IsTheSameWithAndWithoutTheKernelsHandle) {
+class PeerIdentityTest : public testing::Test {
+ protected:
+  PeerIdentityTest() { EXPECT_EQ(::socketpair(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0, ends), 0); }
+  ~PeerIdentityTest() override { ::close(ends[0]), ::close(ends[1]); }
   int ends[2];
-  ASSERT_EQ(::socketpair(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0, ends), 0);
-  const UniqueDescriptor one(ends[0]), other(ends[1]);
+};
+
+TEST_F(PeerIdentityTest, IsTheSameWithAndWithoutTheKernelsHandle) {
   for (const int option : {peerPidfdOption, unknownOption}) {
-    const PeerIdentity peer = establishPeer(one.get(), option);
-    EXPECT_EQ(peer.pid, ::getpid());
-    EXPECT_EQ(peer.uid, ::getuid());
-    EXPECT_EQ(peer.gid, ::getgid());
-    EXPECT_TRUE(peer.process);
+    const PeerIdentity peer = establishPeer(ends[0], option);
+    EXPECT_TRUE(peer.pid == ::getpid() && peer.uid == ::getuid() && peer.gid == ::getgid() && peer.process);
     EXPECT_EQ(peer.executable, executableAt("/proc/self/exe"));
   }
   EXPECT_FALSE(establishPeer(-1).executable);
 }
 
-TEST(PeerIdentityTest, AProcessThatHasEndedHasNoExecutable) {
+TEST_F(PeerIdentityTest, AProcessThatHasEndedHasNoExecutable) {
   const TemporaryFolder folder;
   const UniqueDescriptor listener = listenAt(folder.path + "/socket");
   for (const bool reaped : {false, true}) {
@@ -55,10 +56,8 @@ TEST(PeerIdentityTest, AProcessThatHasEndedHasNoExecutable) {
   }
 }
 
-TEST(PeerIdentityTest, ExecutablesThatTheKernelHidesAreNamedOnce) {
+TEST_F(PeerIdentityTest, ExecutablesThatTheKernelHidesAreNamedOnce) {
   if (::getuid() != 0) GTEST_SKIP() << "takes root";
-  int ends[2];
-  ASSERT_EQ(::socketpair(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0, ends), 0);
   RecordedLog& log = RecordedLog::installed();
   const pid_t child = ::fork();
   if (child == 0) {
@@ -72,8 +71,6 @@ TEST(PeerIdentityTest, ExecutablesThatTheKernelHidesAreNamedOnce) {
   int status = -1;
   ::waitpid(child, &status, 0);
   EXPECT_EQ(WEXITSTATUS(status), 0);
-  ::close(ends[0]);
-  ::close(ends[1]);
 }
 
 // A root with one grant, of bin/prog.
@@ -132,11 +129,9 @@ TEST_F(EntitlementsTest, CountOnlyIfNobodyElseCanChangeThem) {
       {"loop", [&] { execute("loop"); }, "too many links"},
       {"missing", [&] { execute("bin/none"); }, "bin/none: No such file"},
       {"broken", [&] { write(grant, "{\n  \"executable\": bin}"); }, "line 2"},
-      {"list", [&] { write(grant, "[]"); }, "not an object"},
       {"no program", [&] { write(grant, R"({"entitlements": {}})"); }, "\"executable\" is not"},
       {"no entitlements", [&] { write(grant, R"({"executable": "bin/prog", "entitlements": []})"); },
        "\"entitlements\" is not"},
-      {"user true", [&] { write(grant, R"({"executable": "bin/prog", "uid": true})"); }, "\"uid\" is not"},
       {"no user", [&] { write(grant, R"({"executable": "bin/prog", "uid": 4294967295})"); },
        "\"uid\" is not"},
       {"group below 0", [&] { write(grant, R"({"executable": "bin/prog", "gid": -1})"); }, "\"gid\" is not"},

@@ -31,17 +31,14 @@ TEST_F(DeviceTest, FileComesFirstThenTheMachine) {
   files.put("/usr/lib/os-release", "NAME=\"X\"\nVERSION_ID=\"12\"\nBUILD_ID='21A5'\n");
   files.put("/etc/machine-id", "0123abcd\n");
   EXPECT_EQ(answer("BuildVersion"), "21A5");
-  EXPECT_EQ(answer("ProductVersion"), "12");
-  EXPECT_EQ(answer("UniqueDeviceID"), "0123abcd");
-  EXPECT_EQ(answer("ProductType"), "nil");
+  EXPECT_EQ(answer("ProductVersion") + answer("UniqueDeviceID") + answer("ProductType"), "120123abcdnil");
   for (const char* key : {"UserAssignedDeviceName", "k7QIBwZJJOVw+Sej/8h8VA"}) EXPECT_NE(answer(key), "nil");
   EXPECT_EQ(properties.isInternalBuild(), 0);
 
   files.put(etc, R"({"BuildVersion": "9Z", "UniqueChipID": 77, "ProductType": {"value": "T", "error": -3},
                      "ProductVersion": {"error": 5}, "InternalBuild": true})");
   EXPECT_EQ(answer("BuildVersion"), "9Z") << "read anew";
-  EXPECT_EQ(answer("UniqueChipID"), "77");
-  EXPECT_EQ(answer("ProductType"), "T error -3");
+  EXPECT_EQ(answer("UniqueChipID") + answer("ProductType"), "77T error -3");
   EXPECT_EQ(answer("ProductVersion"), "nil error 5");
   EXPECT_EQ(properties.isInternalBuild(), 1);
 
@@ -61,8 +58,6 @@ TEST_F(DeviceTest, BootSessionIsTheKernelsInUpperCaseOrTheFiles) {
   EXPECT_EQ(bootSession(36, length), std::to_string(ENOMEM));
   files.put(etc, R"({"BootSessionUUID": "another"})");
   EXPECT_EQ(bootSession(37, length), "another");
-  EXPECT_EQ(kernel.sysctlbyname("kern.bootsessionuuid", nullptr, &length), 0);
-  EXPECT_EQ(length, 8u);
   EXPECT_EQ(kernel.sysctlbyname("kern.other", nullptr, &length), -1);
   EXPECT_EQ(errno, ENOENT);
 }

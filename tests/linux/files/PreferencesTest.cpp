@@ -30,18 +30,6 @@ class PreferencesTest : public World {
   const std::shared_ptr<Recorder> observer = std::make_shared<Recorder>();
 };
 
-TEST_F(PreferencesTest, TypedReadsConvertExactlyOrFindNothing) {
-  files.put(path, R"({"values": {"one": 1, "half": 0.5, "text": "true", "list": [true], "null": null}})");
-  EXPECT_TRUE(store->boolForKey("one"));
-  EXPECT_EQ(store->doubleForKey("one"), 1.0);
-  EXPECT_EQ(store->textForKey("text"), "true");
-  for (const char* key : {"half", "text", "list", "null", "absent"})
-    EXPECT_FALSE(store->boolForKey(key)) << key;
-  for (const char* key : {"text", "list", "null", "absent"}) EXPECT_EQ(store->doubleForKey(key), 0.0) << key;
-  for (const char* key : {"one", "list", "absent"}) EXPECT_EQ(store->textForKey(key), std::nullopt) << key;
-  EXPECT_THAT(logged(), IsEmpty());
-}
-
 TEST_F(PreferencesTest, OutsideChangeIsReportedOnceWithExactlyTheKeysThatDiffer) {
   for (const char* key : {"a", "b", "c"}) neighbour->setValue(0, key);
   deliver();

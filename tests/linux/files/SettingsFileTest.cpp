@@ -20,10 +20,8 @@ TEST_F(SettingsFileTest, DamageIsMovedAsideWhileTheLastGoodContentsStayInForce) 
   const std::pair<std::string, const char*> rows[] = {
       {"", "line 1, column 1"},
       {"{\n  \"values\": {\"a\": 1", "line 2, column"},
-      {"[1]", "line 1, column 1: not an object"},
       {"{\n\"values\": 5}", "line 2: \"values\""},
       {"{\"values\": {\"a\": 3},\n\"checksum\": \"00000000\"}", "line 2: the contents do not match"},
-      {"{\"values\": {\"a\": 3}, \"checksum\": 0}", "line 1: the contents do not match"},
       {std::string(SettingsFile::sizeLimit + 1, ' '), "larger than"},
   };
   const auto file = open();
@@ -44,8 +42,6 @@ TEST_F(SettingsFileTest, DamageIsMovedAsideWhileTheLastGoodContentsStayInForce) 
   files.put(path, "?");
   ASSERT_TRUE(file->setValue("c", 3)) << "first met by a write";
   EXPECT_EQ(stored(*open()), (Dictionary{{"a", 1}, {"b", 2}, {"c", 3}}));
-  files.put(path, "?");
-  EXPECT_EQ(stored(*open()), Dictionary{}) << "by a process that knows nothing good";
 }
 
 TEST_F(SettingsFileTest, DamageThatCannotBeMovedIsNotOverwritten) {

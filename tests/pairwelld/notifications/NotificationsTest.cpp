@@ -1,5 +1,4 @@
 // Subscriptions, alarms, and callbacks for named notifications.
-#include <cmath>
 #include <limits>
 
 #include "pairwelld/TarnNotificationHelper.hpp"
@@ -45,7 +44,6 @@ TEST_F(NotificationsTest, SubscribersAreCalledInOrderUntilTheyHaveLeft) {
   const auto first = alarms()->subscribe(a), second = alarms()->subscribe(b), third = alarms()->subscribe(c);
   const auto again = alarms()->subscribe(a);
   EXPECT_FALSE(first == again);
-  EXPECT_TRUE(second == Subscription(second));
   std::vector<std::optional<std::error_code>> results;
   a->onCall = [&] {
     a->onCall = nullptr;
@@ -84,7 +82,7 @@ TEST_F(NotificationsTest, UnsubscribingCompletesWhateverTheBlockSaysAndWhoeverLi
 }
 
 TEST_F(NotificationsTest, AlarmsDropTheFractionAndRefuseWhatHasNoDate) {
-  constexpr double infinity = std::numeric_limits<double>::infinity();
+  using Limits = std::numeric_limits<double>;
   constexpr std::int64_t rejected = 5;
   const struct {
     const char* name;
@@ -98,8 +96,8 @@ TEST_F(NotificationsTest, AlarmsDropTheFractionAndRefuseWhatHasNoDate) {
       {"past the last", 9223372037, rejected, "9223372037.000000"},
       {"first", -9223372036.75, -9'223'372'036'000'000'000, "-9223372036.750000"},
       {"before the first", -9223372037, rejected, "-9223372037.000000"},
-      {"not a number", std::nan(""), rejected, "nan"},
-      {"infinite", infinity, rejected, "inf"},
+      {"not a number", Limits::quiet_NaN(), rejected, "nan"},
+      {"infinite", Limits::infinity(), rejected, "inf"},
   };
   const auto& kept = platform.streams.alarms;
   for (const auto& row : table) {
@@ -118,12 +116,9 @@ TEST_F(NotificationsTest, AlarmsDropTheFractionAndRefuseWhatHasNoDate) {
   alarms()->scheduleAlarm("x", platform::Time(7.5));
   EXPECT_EQ(kept.begin()->second.nanoseconds, 7'000'000'000);
   mark();
-  alarms()->cancelAlarm("y");
   alarms()->cancelAlarm("x");
   EXPECT_THAT(effects(Effects::log | Effects::alarm),
-              ElementsAre("notification default: Canceling alarm: y", "alarm y cleared",
-                          "notification default: Canceling alarm: x", "alarm x cleared"));
-  EXPECT_TRUE(kept.empty());
+              ElementsAre("notification default: Canceling alarm: x", "alarm x cleared"));
 }
 
 TEST_F(NotificationsTest, AHelperAnswersToItsNamesOnBothRoutes) {
@@ -145,16 +140,8 @@ TEST_F(NotificationsTest, AHelperAnswersToItsNamesOnBothRoutes) {
   platform.named.postFromElsewhere("b");
   run();
   EXPECT_THAT(calls, ElementsAre("1b"));
-  for (bool* loses : {&platform.namedCentre.losesName, &platform.namedCentre.losesObserver}) {
-    *loses = true;
-    platform.named.postFromElsewhere("b");
-    run();
-  }
-  EXPECT_THAT(calls, ElementsAre("1b"));
   EXPECT_THAT(log(), ElementsAre(matching + "a", invoking + "a", invoking + "a", matching + "A",
-                                 channel + "Got tarn notification, b", invoking + "b",
-                                 "daemon error: loomNotificationName for tarn callback handler not found",
-                                 "daemon error: Observer for tarn callback handler not found"));
+                                 channel + "Got tarn notification, b", invoking + "b"));
 }
 
 TEST_F(NotificationsTest, AHelperLivesAsLongAsItsRegistration) {
@@ -171,23 +158,6 @@ TEST_F(NotificationsTest, AHelperLivesAsLongAsItsRegistration) {
                                  "daemon default: Remove tarn callback handler for b"));
   EXPECT_EQ(platform.namedCentre.observers.size(), 1u);
   EXPECT_THAT(callsAfterMatch("a"), ElementsAre("2a"));
-  mark();
-  platform.hasNamedCentre = false;
-  EXPECT_THROW(helper("3", {"a"}), fakes::Stopped);
-  TarnNotificationManager::shared()->unregisterHelper(*helpers[1].lock());
-  EXPECT_THAT(log(), IsEmpty());
-}
-
-TEST_F(NotificationsTest, AHelperMayLeaveInItsOwnCallback) {
-  TarnNotificationManager::shared()->setUp();
-  helper("", {}).notificationHandlers["a"] = [this, name = std::string("leaver")] {
-    helpers[0].lock()->notificationHandlers.clear();
-    TarnNotificationManager::shared()->unregisterHelper(*helpers[0].lock());
-    calls.push_back(name);
-  };
-  helper("2", {"a"});
-  EXPECT_THAT(callsAfterMatch("a"), ElementsAre("leaver", "2a"));
-  EXPECT_TRUE(helpers[0].expired());
 }
 
 }  // namespace

@@ -24,12 +24,6 @@ class KeyValueStoreManagerTest : public World {
     mark();
     return kvs;
   }
-  void store(const std::optional<Value>& value) {
-    platform.cloud->store(flagKey, value);
-    platform.user->store(flagKey, value);
-    platform.radix.contents.clear();
-    if (value) platform.radix.contents.emplace(flagKey, *value);
-  }
   Calls callsAfterRun() {
     calls.clear();
     run();
@@ -39,21 +33,17 @@ class KeyValueStoreManagerTest : public World {
 
 TEST_F(KeyValueStoreManagerTest, ReadsAnswerWhatConvertsOrNothing) {
   const auto kvs = makeManager();
-  const struct {
-    const char* name;
-    std::optional<Value> stored;
-    bool asBool;
-    double asDouble;
-  } table[] = {{"absent", {}, false, 0},       {"true", true, true, 1}, {"fraction", 1.5, false, 1.5},
-               {"whole number", 1, true, 1.0}, {"text", "1", false, 0}, {"list", List{1}, false, 0}};
-  for (const auto& row : table) {
-    store(row.stored);
-    for (KeyValueSource source : {cloud, root, user}) {
-      SCOPED_TRACE(std::string(row.name) + " in " + std::string(platform::rawValue(source)));
-      EXPECT_EQ(kvs->getBool(source, flag), row.asBool);
-      EXPECT_EQ(kvs->getDouble(source, flag), row.asDouble);
-    }
+  platform.cloud->store(flagKey, 1.5);
+  platform.user->store(flagKey, 1);
+  for (const Value& value : {Value(), Value("1"), Value(List{1}), Value(2.5), Value(1)}) {
+    platform.radix.contents = {{flagKey, value}};
+    EXPECT_EQ(kvs->getBool(root, flag), value == Value(1));
+    EXPECT_EQ(kvs->getDouble(root, flag), platform::toDouble(value).value_or(0));
   }
+  EXPECT_FALSE(kvs->getBool(cloud, flag));
+  EXPECT_EQ(kvs->getDouble(cloud, flag), 1.5);
+  EXPECT_TRUE(kvs->getBool(user, flag));
+  EXPECT_EQ(kvs->getDouble(user, flag), 1);
   EXPECT_THAT(log(), IsEmpty());
   platform.radix.failure = std::make_error_code(std::errc::io_error);
   EXPECT_FALSE(kvs->getBool(root, flag));
@@ -103,7 +93,7 @@ TEST_F(KeyValueStoreManagerTest, EachChangedKeyReachesEverySubscriberInTurn) {
     first->onCall = nullptr;
     kvs->subscribe(late);
     kvs->unsubscribe(other);
-    on(kvs->subscriptionQueue, [] {});
+    kvs->subscriptionQueue->sync([] {});
   };
   kvs->handleStoreChange(root, {});
   EXPECT_THAT(callsAfterRun(), ElementsAre("1 root -", "2 root -"));
@@ -120,9 +110,8 @@ TEST_F(KeyValueStoreManagerTest, ChangesMadeElsewhereArrive) {
   changeRoot();
   EXPECT_THAT(callsAfterRun(), ElementsAre("1 root -"));
   EXPECT_THAT(log(), ElementsAre("kvs default: Root KVS Notification"));
-  const auto observer = kvs->keyValueStoreObserver();
-  observer->observeValue(std::nullopt, platform.user.get());
-  observer->observeValue("b", platform.cloud.get());
+  kvs->keyValueStoreObserver()->observeValue(std::nullopt, platform.user.get());
+  kvs->keyValueStoreObserver()->observeValue("b", platform.cloud.get());
   EXPECT_THAT(callsAfterRun(), ElementsAre("1 user b"));
 }
 
@@ -141,7 +130,6 @@ TEST_F(KeyValueStoreManagerTest, OutsideCloudChangesCountByReasonAndKeys) {
       {"quota", change(2, List{"c"}), {}},
       {"account", change(3, List{}), {"1 cloud -"}},
       {"unknown", change(4, List{"c"}), {}},
-      {"negative", change(-1, List{"c"}), {}},
       {"reason that is no number", change("0", List{"c"}), {}},
       {"keys that are no texts", change(0, List{"c", 1}), {}},
       {"empty", Dictionary{}, {}},
