@@ -2,6 +2,7 @@
 #pragma once
 
 #include <functional>
+#include <mutex>
 #include <string>
 #include <string_view>
 #include <utility>
@@ -19,22 +20,26 @@ class Effects {
   enum Kind : unsigned { store = 1, alarm = 2, post = 4, log = 8, client = 16 };
 
   void record(Kind kind, std::string text) {
-    list.emplace_back(kind, std::move(text));
+    {
+      std::lock_guard lock(mutex);
+      list.emplace_back(kind, std::move(text));
+    }
     moment();
   }
   // Where other threads of a real device get their chance: after each effect, and at each read of a store.
   // `onMoment` stands for them; it does not nest.
   void moment() {
-    if (!onMoment || inMoment) return;
-    inMoment = true;
+    static thread_local bool inMoment = false;
+    if (!onMoment || std::exchange(inMoment, true)) return;
     onMoment();
     inMoment = false;
   }
-  void mark() { start = list.size(); }
+  // What came before is forgotten.
+  void mark() { list.clear(); }
   std::vector<std::string> sinceMark(unsigned kinds) const {
     std::vector<std::string> texts;
-    for (std::size_t index = start; index < list.size(); ++index) {
-      if (list[index].first & kinds) texts.push_back(list[index].second);
+    for (const auto& [kind, text] : list) {
+      if (kind & kinds) texts.push_back(text);
     }
     return texts;
   }
@@ -49,9 +54,8 @@ class Effects {
   std::function<void()> onMoment;
 
  private:
+  std::mutex mutex;  // guards additions
   std::vector<std::pair<Kind, std::string>> list;
-  std::size_t start = 0;
-  bool inMoment = false;
 };
 
 }  // namespace fakes

@@ -10,6 +10,7 @@
 #include <random>
 #include <string>
 #include <utility>
+#include <vector>
 
 #include "platform/Environment.hpp"
 #include "platform/LogSink.hpp"

@@ -1,13 +1,6 @@
 // Named notifications and event streams, without a service manager behind them.
 #pragma once
 
-#include <map>
-#include <memory>
-#include <optional>
-#include <string>
-#include <utility>
-#include <vector>
-
 #include "platform/EventStreams.hpp"
 #include "platform/NamedNotifications.hpp"
 #include "tests/fakes/FakeEnvironment.hpp"
@@ -58,24 +51,25 @@ class FakeNamedNotifications : public NamedNotifications {
   }
   // Another process posts.
   void postFromElsewhere(std::string_view name) {
+    std::lock_guard lock(mutex);
     for (const auto& [token, registration] : registrations) {
       if (registration->name != name || std::exchange(registration->pending, true)) continue;
       registration->queue->async([this, registration = registration, token = token] {
-        registration->pending = false;
-        if (!registrations.contains(token) && registration->queue == centre.mainQueue) return;
-        registration->handler(token);
+        if (take(token, *registration)) registration->handler(token);
       });
     }
     centre.deliver(name);
   }
   std::uint32_t registerHandler(std::string_view name, std::int32_t& token, std::shared_ptr<WorkQueue> queue,
                                 Handler handler) override {
+    std::lock_guard lock(mutex);
     token = ++lastToken;
     registrations[token] = std::make_shared<Registration>(
         Registration{std::string(name), std::move(queue), std::move(handler), false});
     return 0;
   }
   void cancel(std::int32_t token) override {
+    std::lock_guard lock(mutex);
     cancelled.push_back(token);
     registrations.erase(token);
   }
@@ -90,8 +84,15 @@ class FakeNamedNotifications : public NamedNotifications {
   std::vector<std::int32_t> cancelled;
 
  private:
+  bool take(std::int32_t token, Registration& registration) {
+    std::lock_guard lock(mutex);
+    registration.pending = false;
+    return registrations.contains(token) || registration.queue != centre.mainQueue;
+  }
+
   Effects& effects;
   FakeNamedNotificationCentre& centre;
+  std::mutex mutex;  // guards the registrations
   std::int32_t lastToken = 0;
 };
 

@@ -1,11 +1,9 @@
 // One device made of fakes, moved by hand.
 #pragma once
 
-#include <memory>
-#include <optional>
-#include <random>
-#include <string>
-#include <vector>
+#include <gtest/gtest.h>
+
+#include <algorithm>
 
 #include "tests/fakes/FakeNotifications.hpp"
 #include "tests/fakes/FakeService.hpp"
@@ -22,22 +20,71 @@ struct Stopped {
 // own work runs.
 class FakePlatform : public platform::Platform {
  public:
-  FakePlatform();
-  ~FakePlatform() override;
+  FakePlatform() {
+    centre.addObserver(postRecorder, &PostRecorder::record, "com.kestrel.pairwell.cloud.storeChanged",
+                       nullptr);
+  }
+  ~FakePlatform() override { teardown(); }
 
   // Draws the order of the pool's work, and whose turn it is, from `value`, which is printed.
-  void seed(std::uint64_t value);
+  void seed(std::uint64_t value) {
+    testing::Test::RecordProperty("seed", std::to_string(value));
+    random.emplace(value);
+    pool->seed(value);
+  }
   // One item of the pool, the main queue or the delivery thread. False if there is none.
-  bool runOne();
+  bool runOne() {
+    std::vector<ManualPool*> ready;
+    for (ManualPool* queue : {pool.get(), loop.queue.get(), delivery.get()}) {
+      if (!queue->isEmpty()) ready.push_back(queue);
+    }
+    if (ready.empty()) return false;
+    const std::size_t turn =
+        random ? std::uniform_int_distribution<std::size_t>(0, ready.size() - 1)(*random) : 0;
+    ready[turn]->runOne();
+    return true;
+  }
   // Everything that is queued and what that queues. Fails the test if that does not end.
-  void runAll();
+  void runAll() {
+    int count = 0;
+    while (runOne()) ASSERT_LT(++count, 10'000) << "the device does not come to rest";
+  }
   // Lets time pass, with a stop at every date on the way at which an alarm comes due.
-  void advance(Time duration);
+  void advance(Time duration) {
+    const Time target = manualClock.time + duration;
+    runAll();
+    while (const auto due = streams.nextDue()) {
+      if (*due > target) break;
+      manualClock.time = std::max(manualClock.time, *due);
+      streams.deliverDue(manualClock.time);
+      runAll();
+    }
+    manualClock.time = target;
+    runAll();
+  }
 
   // Run by teardown() when the handlers are gone: lists that hold their members strongly are emptied here.
   std::vector<std::function<void()>> cutSubscriptions;
   // Handlers, subscriptions, queued work, slots, while the platform is current; the destructor does it too.
-  void teardown();
+  void teardown() {
+    const PlatformScope scope(*this);
+    effects.onMoment = nullptr;
+    named.registrations.clear();
+    streams.handlers.clear();
+    for (const auto& listener : listeners) {
+      for (const auto& client : std::exchange(listener->clients, {})) client->end();
+    }
+    for (const auto& cut : std::exchange(cutSubscriptions, {})) cut();
+    const auto dropWork = [this] {
+      while (!pool->isEmpty() || !loop.queue->isEmpty() || !delivery->isEmpty()) {
+        for (const auto& queue : {pool, loop.queue, delivery}) queue->drop();
+      }
+    };
+    dropWork();
+    clearSlots();
+    dropWork();  // an owner that goes gives back its subscriptions
+    listeners.clear();
+  }
 
   RunLoop& runLoop() override { return loop; }
   Queues& queues() override { return queueMaker; }

@@ -1,12 +1,6 @@
 // The client service, with clients that a test makes up.
 #pragma once
 
-#include <memory>
-#include <optional>
-#include <string>
-#include <utility>
-#include <vector>
-
 #include "platform/ServiceListener.hpp"
 #include "tests/fakes/FakeEnvironment.hpp"
 

@@ -1,13 +1,9 @@
-// The three stores, in memory. Any write fails, and leaves what was there, once a test says so.
+// The three stores, in memory. Any write fails, and leaves what was there, once a test says so. Reads and
+// writes may come from several threads; what a test sees and sets directly is the test's.
 #pragma once
 
 #include <algorithm>
-#include <memory>
-#include <optional>
-#include <string>
 #include <system_error>
-#include <utility>
-#include <vector>
 
 #include "platform/NotificationCentre.hpp"
 #include "platform/Stores.hpp"
@@ -15,7 +11,7 @@
 
 namespace fakes {
 
-// What the cloud and user stores share. Unlike a real store it is not made for several threads at once.
+// What the cloud and user stores share.
 template <class Interface>
 class FakeKeyValueStore : public Interface {
  public:
@@ -40,10 +36,12 @@ class FakeKeyValueStore : public Interface {
 
   // Puts a value there as if it had always been: no effect, no observer.
   void store(std::string_view key, const std::optional<Value>& value) {
+    std::lock_guard lock(mutex);
     contents.erase(std::string(key));
     if (value) contents.emplace(key, *value);
   }
   std::optional<Value> value(std::string_view key) const {
+    std::lock_guard lock(mutex);
     const auto found = contents.find(key);
     return found == contents.end() ? std::nullopt : std::optional(found->second);
   }
@@ -70,6 +68,7 @@ class FakeKeyValueStore : public Interface {
 
   Effects& effects;
   const std::string name;
+  mutable std::mutex mutex;  // guards `contents`
 };
 
 class FakeUserPreferences : public FakeKeyValueStore<UserPreferences> {
@@ -127,12 +126,14 @@ struct FakeRadixController : RadixController {
 
   Result<Dictionary> readPrefKeys(const std::vector<std::string>& keys) override {
     if (failure) return failure;
+    std::lock_guard lock(mutex);
     Dictionary found = contents;
     std::erase_if(found, [&](const auto& entry) { return std::ranges::count(keys, entry.first) == 0; });
     return found;
   }
   Result<void> writePrefKey(std::string_view key, const Value& value) override {
     if (!failure) {
+      std::lock_guard lock(mutex);
       contents.erase(std::string(key));
       if (!(value == Value())) contents.emplace(key, value);
     }
@@ -144,6 +145,7 @@ struct FakeRadixController : RadixController {
   Dictionary contents;
   std::error_code failure;
   Effects& effects;
+  std::mutex mutex;  // guards `contents`
 };
 
 }  // namespace fakes

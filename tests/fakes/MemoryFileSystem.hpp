@@ -3,15 +3,9 @@
 // freed inode to the next file at once: so only an open file tells two of one size apart.
 #pragma once
 
-#include <cerrno>
-#include <functional>
 #include <limits>
 #include <map>
-#include <memory>
 #include <set>
-#include <string>
-#include <utility>
-#include <vector>
 
 #include "platform/linux/FileSystem.hpp"
 #include "tests/fakes/Effects.hpp"

@@ -27,8 +27,7 @@ Date at(double seconds) { return {static_cast<std::int64_t>(seconds * 1e9)}; }
 EventKey key(const std::string& name, const std::string& job = "job") { return {job, stream, name}; }
 
 // Wall clock and steady clock move together, unless the test sets one.
-class AlarmsTest : public testing::Test {
- protected:
+struct AlarmsTest : testing::Test {
   void advance(double seconds) {
     now.wall += Time(seconds);
     now.steady += Time(seconds);

@@ -52,8 +52,7 @@ struct Service : BusHandler {
 };
 
 // The loop's thread touches what is here only until it has settled.
-class HearthLinkTest : public testing::Test {
- protected:
+struct HearthLinkTest : testing::Test {
   HearthLinkTest() {
     int ends[2];
     EXPECT_EQ(::socketpair(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC | SOCK_NONBLOCK, 0, ends), 0);

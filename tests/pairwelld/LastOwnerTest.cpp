@@ -8,8 +8,7 @@
 namespace pairwell {
 namespace {
 
-class LastOwnerTest : public World {
- public:
+struct LastOwnerTest : World {
   using Device = LastOwnerTest;
   struct Row {
     const char* name;

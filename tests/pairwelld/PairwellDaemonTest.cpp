@@ -7,8 +7,7 @@ namespace {
 
 const std::string bootSession = "01234567-89AB-CDEF-0123-456789ABCDEF";
 
-class PairwellDaemonTest : public World {
- protected:
+struct PairwellDaemonTest : World {
   // The whole program, until its loop has nothing left to do.
   void launch() {
     platform.cutSubscriptions.push_back([] {
@@ -51,13 +50,6 @@ TEST_F(PairwellDaemonTest, LaunchesInOrderAndActivatesEverything) {
   const auto running = std::dynamic_pointer_cast<PairwellDaemon>(daemon());
   ASSERT_TRUE(running);
   EXPECT_EQ(running->conduitListener()->debugManager, running->debugManager());
-}
-
-TEST_F(PairwellDaemonTest, RefusesBeforeAnythingHappensWithoutAServiceName) {
-  platform.variables.variables.clear();
-  EXPECT_EQ(textOfStop([this] { launch(); }), "pairwelld must be run from hearthd");
-  EXPECT_THAT(effects(~0u), IsEmpty());
-  EXPECT_TRUE(platform.cloudStoresMade.empty() && platform.streams.handlers.empty());
 }
 
 struct LockableInfo : SystemInfo {

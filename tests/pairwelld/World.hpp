@@ -48,8 +48,7 @@ struct Subscriber : KeyValueStoreManagerSubscribing, SystemNotificationManagerSu
 };
 
 // Also a device of its own within a test.
-class World : public testing::Test {
- public:
+struct World : testing::Test {
   void TestBody() override {}
   World() { platform.variables.variables["CONDUIT_SERVICE_NAME"] = "com.kestrel.pairwell.conduit"; }
 

@@ -26,8 +26,7 @@ using testing::HasSubstr;
 inline const std::string flagKey = "VelaLogCloudCollectionEnabled", endKey = flagKey + "Expiration";
 inline constexpr uid_t nobody = 65534;
 
-class Device : public testing::Test {
- protected:
+struct Device : testing::Test {
   struct Outcome {
     int status;  // of the exit; the signal's, negative
     std::string output, errors;

@@ -23,8 +23,7 @@ using testing::HasSubstr;
 
 constexpr std::size_t mebibyte = 1024 * 1024;
 
-class BusServerTest : public World {
- protected:
+struct BusServerTest : World {
   BusServerTest() { EXPECT_EQ(::getrlimit(RLIMIT_NOFILE, &original), 0); }
   ~BusServerTest() override { EXPECT_EQ(limitDescriptors(original.rlim_cur), 0); }
   int limitDescriptors(rlim_t count) const {
@@ -54,21 +53,16 @@ TEST_F(BusServerTest, CallsThatDoNotFitGetAnErrorAndNoMore) {
     ASSERT_TRUE(wire.send(message));
     const auto answer = wire.next();
     ASSERT_TRUE(answer);
-    EXPECT_EQ(answer->type, name.empty() ? 2 : 3) << name;
     EXPECT_EQ(answer->name, name);
   }
   auto library = BusClient::connect(path, deadline);
   ASSERT_TRUE(library);
-  const auto answer = [&](const char* interface, const BusOperation& operation, const List& arguments) {
-    const auto reply =
-        (*library)->call({"/test", interface, {operation}, {}}, operation.name, arguments, deadline);
-    return reply && std::holds_alternative<List>(*reply) ? describe(Value(std::get<List>(*reply))) : "none";
-  };
-  EXPECT_EQ(answer("org.freedesktop.DBus.Peer", {"Ping", "", ""}, {}), "[]");
-  EXPECT_THAT(answer("org.freedesktop.DBus.Introspectable", {"Introspect", "", "s"}, {}),
-              HasSubstr("<method name=\"Hold\">"));
-  EXPECT_EQ(answer("test.Interface", {"Wide", "t", ""}, {std::int64_t{1}}), "[]");
-  EXPECT_THAT(calls, ElementsAre("text", ""));
+  const BusInterface introspectable{
+      "/test", "org.freedesktop.DBus.Introspectable", {{"Introspect", "", "s"}}, {}};
+  const auto description = (*library)->call(introspectable, "Introspect", {}, deadline);
+  ASSERT_TRUE(description);
+  EXPECT_THAT(describe(std::get<List>(*description).front()), HasSubstr("<method name=\"Hold\">"));
+  EXPECT_THAT(calls, ElementsAre("text"));
 
   ASSERT_TRUE(wire.send(callMessage("Echo", "", {.flags = noReplyExpected}) +
                         callMessage("Missing", "", {.flags = noReplyExpected}) +
@@ -83,11 +77,16 @@ TEST_F(BusServerTest, DamageEndsItsClientAloneAndHoldsNoMemory) {
     message[at] = byte;
     return message;
   };
-  std::string giant = good.substr(0, 16);
+  std::string giant = good.substr(0, 16), overflow = giant;
   giant[7] = 0x07;  // a body of 120 MiB
   giant[6] = static_cast<char>(0x80);
+  // Sizes of body and fields whose sum is small in 32 bits.
+  for (const std::size_t at : {4, 5, 6, 7, 12, 13, 14, 15}) overflow[at] = static_cast<char>(0xff);
+  overflow[12] = static_cast<char>(0xf9);
   const std::pair<const char*, std::string> rows[] = {
       {"giant", giant},
+      {"overflow", overflow},
+      {"version 2", damaged(3, 2)},
       {"damaged, then giant", damaged(17, 9) + giant},
       {"no byte order", damaged(0, 'x')},
       {"serial 0", damaged(8, 0)},
@@ -243,11 +242,11 @@ TEST_F(BusServerTest, NothingWakesAServerThatNoLongerListens) {
 
 TEST_F(BusServerTest, AtTheDescriptorLimitClientsWaitUntilOthersEnd) {
   constexpr std::size_t clients = 30;
-  const std::size_t before = log.count("accepting rests");
   std::vector<Wire> wires;
-  ASSERT_EQ(limitDescriptors(openDescriptors() + clients + limits::spareDescriptors + 20), 0);
+  const std::size_t limit = openDescriptors() + clients + limits::spareDescriptors + 20;
+  ASSERT_EQ(limitDescriptors(limit), 0);
   while (wires.size() < clients) wires.emplace_back(path);
-  EXPECT_TRUE(eventually([&] { return log.count("accepting rests") > before; }));
+  EXPECT_TRUE(eventually([&] { return openDescriptors() + limits::spareDescriptors >= limit; }));
   // Each one that ends lets the next one in.
   for (Wire& wire : wires) {
     wire.shakeHands();
@@ -272,8 +271,7 @@ TEST_F(BusServerTest, OneUsersConnectionsAreLimitedAndOneThatEndsMakesRoom) {
 }
 
 // Without patience.
-class HastyBusServerTest : public World {
- protected:
+struct HastyBusServerTest : World {
   HastyBusServerTest() : World({200ms, 200ms, 200ms, 200ms}) {}
 };
 
@@ -299,7 +297,7 @@ TEST_F(HastyBusServerTest, WhoeverStallsIsDisconnected) {
   EXPECT_TRUE(refused.waitForHangUp()) << "refused, but never closed";
   // Clients that wait are others' fault, or nobody's.
   complete(0);
-  EXPECT_EQ(waiting.next()->type, 2);
+  EXPECT_EQ(waiting.next()->name, "");
   EXPECT_TRUE(idle.isServed());
 }
 

@@ -31,25 +31,6 @@ void addField(std::string& fields, char code, char type, const std::string& valu
 
 }  // namespace
 
-RecordedLog& RecordedLog::installed() {
-  static auto& log = *new RecordedLog;
-  static const bool once = (installLogSink(log), true);
-  static_cast<void>(once);
-  return log;
-}
-
-void RecordedLog::write(const LogChannel&, LogLevel, std::string_view format,
-                        std::span<const LogArgument> arguments) {
-  std::lock_guard lock(mutex);
-  lines.push_back(formatLogMessage(format, arguments, false));
-}
-
-std::size_t RecordedLog::count(std::string_view part) {
-  std::lock_guard lock(mutex);
-  return static_cast<std::size_t>(std::count_if(
-      lines.begin(), lines.end(), [&](const auto& line) { return line.find(part) != line.npos; }));
-}
-
 std::string callMessage(const std::string& member, const std::string& argument, const CallOptions& options) {
   std::string fields;
   addField(fields, 1, 'o', text(options.path));
@@ -105,7 +86,6 @@ std::optional<Answer> Wire::next() {
   const std::size_t size = body + numberAt(received, 4);
   if (!fill(size)) return std::nullopt;
   Answer answer;
-  answer.type = received[1];
   for (std::size_t at = 16; at < end;) {
     at = aligned(at, 8);
     const char code = received[at], type = received[at + 2];

@@ -12,7 +12,6 @@
 #include <string_view>
 #include <vector>
 
-#include "platform/LogSink.hpp"
 #include "platform/linux/BusServer.hpp"
 #include "platform/linux/EventLoop.hpp"
 #include "tests/fakes/RealFiles.hpp"
@@ -23,19 +22,6 @@ using fakes::deadline;
 using fakes::eventually;
 using fakes::TemporaryFolder;
 inline constexpr std::chrono::hours never{1};
-
-// The lines of the whole process.
-class RecordedLog : public LogSink {
- public:
-  static RecordedLog& installed();
-  bool enabled(const LogChannel&, LogLevel) override { return true; }
-  void write(const LogChannel&, LogLevel, std::string_view format, std::span<const LogArgument>) override;
-  std::size_t count(std::string_view part);
-
- private:
-  std::mutex mutex;
-  std::vector<std::string> lines;  // guarded by `mutex`
-};
 
 struct CallOptions {
   std::string path = "/test";
@@ -51,9 +37,8 @@ inline constexpr std::string_view handshakeAhead{"\0AUTH EXTERNAL\r\nDATA\r\nBEG
 // A method call with a text as its argument, written by hand: libraries refuse to make bad ones.
 std::string callMessage(const std::string& member, const std::string& text, const CallOptions& options = {});
 
-// What came back: a return, an error with its name, or a signal with its.
+// What came back: a return, which has no name, an error or a signal.
 struct Answer {
-  int type = 0;
   std::uint32_t serial = 0;  // of the call
   std::string name;
   std::string text;  // the first result
@@ -89,8 +74,7 @@ std::size_t residentBytes();
 
 // Operations: Echo answers at once, Hold when the test says so, Wide takes a t. Every client is admitted,
 // unless the test decides.
-class World : public testing::Test {
- protected:
+struct World : testing::Test {
   explicit World(limits::Patience patience = {never, never, never, never});
   ~World() override;
 
@@ -108,7 +92,6 @@ class World : public testing::Test {
   };
   class Handler;
 
-  RecordedLog& log = RecordedLog::installed();
   TemporaryFolder folder;
   const std::string path = folder.path + "/socket";
   UniqueDescriptor hearthsOwn;  // as a service manager keeps the socket of its job

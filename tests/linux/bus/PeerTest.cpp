@@ -25,23 +25,19 @@ PeerIdentity::Executable executableAt(const std::string& path) {
   return {status.st_dev, status.st_ino};
 }
 
-class PeerIdentityTest : public testing::Test {
- protected:
-  PeerIdentityTest() { EXPECT_EQ(::socketpair(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0, ends), 0); }
-  ~PeerIdentityTest() override { ::close(ends[0]), ::close(ends[1]); }
+TEST(PeerIdentityTest, IsTheSameWithAndWithoutTheKernelsHandle) {
   int ends[2];
-};
-
-TEST_F(PeerIdentityTest, IsTheSameWithAndWithoutTheKernelsHandle) {
+  ASSERT_EQ(::socketpair(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0, ends), 0);
+  const UniqueDescriptor one(ends[0]), other(ends[1]);
   for (const int option : {peerPidfdOption, unknownOption}) {
-    const PeerIdentity peer = establishPeer(ends[0], option);
+    const PeerIdentity peer = establishPeer(one.get(), option);
     EXPECT_TRUE(peer.pid == ::getpid() && peer.uid == ::getuid() && peer.gid == ::getgid() && peer.process);
     EXPECT_EQ(peer.executable, executableAt("/proc/self/exe"));
   }
   EXPECT_FALSE(establishPeer(-1).executable);
 }
 
-TEST_F(PeerIdentityTest, AProcessThatHasEndedHasNoExecutable) {
+TEST(PeerIdentityTest, AProcessThatHasEndedHasNoExecutable) {
   const TemporaryFolder folder;
   const UniqueDescriptor listener = listenAt(folder.path + "/socket");
   for (const bool reaped : {false, true}) {
@@ -56,26 +52,8 @@ TEST_F(PeerIdentityTest, AProcessThatHasEndedHasNoExecutable) {
   }
 }
 
-TEST_F(PeerIdentityTest, ExecutablesThatTheKernelHidesAreNamedOnce) {
-  if (::getuid() != 0) GTEST_SKIP() << "takes root";
-  RecordedLog& log = RecordedLog::installed();
-  const pid_t child = ::fork();
-  if (child == 0) {
-    if (::setgid(nobody) != 0 || ::setuid(nobody) != 0) ::_exit(2);
-    // The socket was made by the parent, root's.
-    for (int count = 0; count < 3; ++count) {
-      if (establishPeer(ends[0]).executable) ::_exit(3);
-    }
-    ::_exit(log.count("the peer's executable: Permission denied") == 1 ? 0 : 4);
-  }
-  int status = -1;
-  ::waitpid(child, &status, 0);
-  EXPECT_EQ(WEXITSTATUS(status), 0);
-}
-
 // A root with one grant, of bin/prog.
-class EntitlementsTest : public testing::Test {
- protected:
+struct EntitlementsTest : testing::Test {
   EntitlementsTest() {
     fs::create_directories(root + "/bin");
     fs::create_directories(paths.entitlements());
@@ -86,7 +64,6 @@ class EntitlementsTest : public testing::Test {
   std::string problem() { return readGrants(files, paths).front().problem; }
   std::string granted(const PeerIdentity& peer) { return describe(entitlements.of(peer)); }
 
-  RecordedLog& log = RecordedLog::installed();
   TemporaryFolder folder;
   const std::string root = folder.path;
   const Paths paths = Paths::under(root);
@@ -114,7 +91,6 @@ TEST_F(EntitlementsTest, CountOnlyIfNobodyElseCanChangeThem) {
     std::function<void()> change;
     std::string problem;
   } rows[] = {
-      {"sound", [] {}, ""},
       {"writable file", [&] { ::chmod(grant.c_str(), 0666); }, "a.json can be written by others"},
       {"sound again", [&] { ::chmod(grant.c_str(), 0644); }, ""},
       {"the group's program", [&] { ::chmod(program.c_str(), 0775); }, "bin/prog can be written by others"},
@@ -123,17 +99,14 @@ TEST_F(EntitlementsTest, CountOnlyIfNobodyElseCanChangeThem) {
       {"sticky folder", [&] { ::chmod((root + "/bin").c_str(), 01777); }, ""},
       {"link", [&] { execute("link"); }, ""},
       {"link in a folder of others", [&] { execute("open/link"); }, "open can be written by others"},
-      {"the folder above a link's target", [&] { execute("inner/../prog"); },
-       "open can be written by others"},
-      {"the folder itself, in a roundabout way", [&] { execute("bin/.././bin//prog"); }, ""},
+      {"above a link's target", [&] { execute("inner/../prog"); }, "open can be written by others"},
+      {"roundabout way", [&] { execute("bin/.././bin//prog"); }, ""},
       {"loop", [&] { execute("loop"); }, "too many links"},
       {"missing", [&] { execute("bin/none"); }, "bin/none: No such file"},
       {"broken", [&] { write(grant, "{\n  \"executable\": bin}"); }, "line 2"},
       {"no program", [&] { write(grant, R"({"entitlements": {}})"); }, "\"executable\" is not"},
       {"no entitlements", [&] { write(grant, R"({"executable": "bin/prog", "entitlements": []})"); },
        "\"entitlements\" is not"},
-      {"no user", [&] { write(grant, R"({"executable": "bin/prog", "uid": 4294967295})"); },
-       "\"uid\" is not"},
       {"group below 0", [&] { write(grant, R"({"executable": "bin/prog", "gid": -1})"); }, "\"gid\" is not"},
   };
   for (const auto& row : rows) {
@@ -143,11 +116,11 @@ TEST_F(EntitlementsTest, CountOnlyIfNobodyElseCanChangeThem) {
   }
   if (::getuid() != 0) return;  // only root gives things away
   execute("bin/prog");
-  EXPECT_EQ(::chown(program.c_str(), nobody, nobody), 0);
-  EXPECT_THAT(problem(), HasSubstr("bin/prog belongs to another user"));
-  EXPECT_EQ(::chown(program.c_str(), 0, 0), 0);
-  EXPECT_EQ(::chown(grant.c_str(), nobody, nobody), 0);
-  EXPECT_THAT(problem(), HasSubstr("a.json belongs to another user"));
+  for (const std::string& file : {program, grant}) {
+    EXPECT_EQ(::chown(file.c_str(), nobody, nobody), 0);
+    EXPECT_THAT(problem(), HasSubstr(file + " belongs to another user"));
+    EXPECT_EQ(::chown(file.c_str(), 0, 0), 0);
+  }
 }
 
 TEST_F(EntitlementsTest, BelongToTheProgramOfTheUserThatTheyName) {
@@ -171,8 +144,7 @@ TEST_F(EntitlementsTest, BelongToTheProgramOfTheUserThatTheyName) {
   add("e.text", "");
   EXPECT_EQ(granted(peer), R"(["name": "b.json"])");
   add("f.json", "nonsense");
-  EXPECT_EQ(granted(peer), granted(peer));
-  EXPECT_EQ(log.count(paths.entitlements() + "/f.json does not count"), 1u);
+  EXPECT_EQ(granted(peer), R"(["name": "b.json"])");
 }
 
 }  // namespace

@@ -6,8 +6,7 @@
 namespace platform::linux_ {
 namespace {
 
-class DeviceTest : public World {
- protected:
+struct DeviceTest : World {
   std::string answer(const char* key) {
     std::int32_t error = 0;
     const std::string text = describe(properties.copyAnswerWithError(key, error));

@@ -19,8 +19,7 @@ struct Recorder : KeyObserver {
   std::function<void()> onChange;
 };
 
-class PreferencesTest : public World {
- protected:
+struct PreferencesTest : World {
   PreferencesTest() {
     for (const char* key : {"a", "b", "c"}) store->addObserver(observer, key);
   }

@@ -10,8 +10,7 @@ using testing::ElementsAre;
 using testing::HasSubstr;
 using testing::IsEmpty;
 
-class ReplicaFileCloudStoreTest : public World {
- protected:
+struct ReplicaFileCloudStoreTest : World {
   struct Listener {
     void changed(const Notification& notification) { seen.push_back(describe(*notification.userInfo)); }
     std::vector<std::string> seen;
@@ -102,17 +101,6 @@ TEST_F(ReplicaFileCloudStoreTest, FailedWriteIsNotDurableAndNotRemembered) {
   EXPECT_TRUE(store->synchronise());
   files.powerCut();
   EXPECT_TRUE(open(nullptr)->boolForKey("flag")) << "no echo of what was never written";
-}
-
-TEST_F(ReplicaFileCloudStoreTest, EditedValuesAreWrittenAsOneBurst) {
-  for (const char* key : {"a", "b", "c"}) neighbour->setValue(1, key);
-  const std::string kept = entry("a");
-  device.manualClock.time += Time(60);
-  ASSERT_TRUE(neighbour->replaceValues({{"a", 1}, {"b", 2}}));
-  EXPECT_EQ(entry("a"), kept);
-  EXPECT_EQ(describe(store->dictionaryRepresentation()), R"(["a": 1, "b": 2])");
-  EXPECT_THAT(entry("c"), HasSubstr(R"("removed": true, "tick": 0, "time": 1000060000000])"));
-  EXPECT_THAT(entry("b"), HasSubstr(R"("tick": 0, "time": 1000060000000)"));
 }
 
 }  // namespace

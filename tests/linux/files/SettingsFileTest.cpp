@@ -10,8 +10,7 @@ using testing::AllOf;
 using testing::ElementsAre;
 using testing::HasSubstr;
 
-class SettingsFileTest : public World {
- protected:
+struct SettingsFileTest : World {
   std::shared_ptr<SettingsFile> open() { return SettingsFile::create(files, path); }
   static Dictionary stored(SettingsFile& file) { return settingsValues(*file.contents()); }
 };

@@ -21,8 +21,7 @@ Calls steps(std::string flag, std::string end, std::string alarm) {
 const Calls fresh = steps("true", "1345600.0", "at 1345600000000000 ns"),
             stopped = steps("false", "nil", "cleared"), nothing;
 
-class DebugManagerTest : public World {
- public:
+struct DebugManagerTest : World {
   void start() {
     manager = makeDebugManager();
     effectsAfterRun();

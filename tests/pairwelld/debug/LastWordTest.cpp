@@ -7,8 +7,7 @@ namespace pairwell {
 namespace {
 
 // Calls come between the work items and, from a thread of their own, at any read or effect inside one.
-class Device : public World {
- public:
+struct Device : World {
   explicit Device(std::uint64_t seed) : random(seed) {
     platform.seed(seed);
     manager = makeDebugManager();

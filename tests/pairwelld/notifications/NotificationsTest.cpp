@@ -9,8 +9,7 @@
 namespace pairwell {
 namespace {
 
-class NotificationsTest : public World {
- public:
+struct NotificationsTest : World {
   ~NotificationsTest() override {
     for (const auto& weak : helpers) {
       if (const auto left = weak.lock()) TarnNotificationManager::shared()->unregisterHelper(*left);
@@ -82,26 +81,22 @@ TEST_F(NotificationsTest, UnsubscribingCompletesWhateverTheBlockSaysAndWhoeverLi
 }
 
 TEST_F(NotificationsTest, AlarmsDropTheFractionAndRefuseWhatHasNoDate) {
-  using Limits = std::numeric_limits<double>;
   constexpr std::int64_t rejected = 5;
   const struct {
-    const char* name;
     double seconds;
     std::int64_t nanoseconds;
     const char* text;
   } table[] = {
-      {"fraction", 12.9, 12'000'000'000, "12.900000"},
-      {"negative rounds toward zero", -1.5, -1'000'000'000, "-1.500000"},
-      {"last", 9223372036.75, 9'223'372'036'000'000'000, "9223372036.750000"},
-      {"past the last", 9223372037, rejected, "9223372037.000000"},
-      {"first", -9223372036.75, -9'223'372'036'000'000'000, "-9223372036.750000"},
-      {"before the first", -9223372037, rejected, "-9223372037.000000"},
-      {"not a number", Limits::quiet_NaN(), rejected, "nan"},
-      {"infinite", Limits::infinity(), rejected, "inf"},
+      {12.9, 12'000'000'000, "12.900000"},
+      {-1.5, -1'000'000'000, "-1.500000"},
+      {9223372036.75, 9'223'372'036'000'000'000, "9223372036.750000"},
+      {9223372037, rejected, "9223372037.000000"},
+      {-9223372036.75, -9'223'372'036'000'000'000, "-9223372036.750000"},
+      {-9223372037, rejected, "-9223372037.000000"},
+      {std::numeric_limits<double>::quiet_NaN(), rejected, "nan"},
   };
   const auto& kept = platform.streams.alarms;
   for (const auto& row : table) {
-    SCOPED_TRACE(row.name);
     platform.streams.setEvent("com.kestrel.alarm", "x", platform::Dictionary{{"Date", platform::Date{5}}});
     mark();
     alarms()->scheduleAlarm("x", row.seconds);
@@ -111,10 +106,8 @@ TEST_F(NotificationsTest, AlarmsDropTheFractionAndRefuseWhatHasNoDate) {
                                 ? "notification error: Alarm rejected, its time is out of range: " + tail
                                 : log().front());
     ASSERT_EQ(kept.size(), 1u);
-    EXPECT_EQ(kept.begin()->second.nanoseconds, row.nanoseconds);
+    EXPECT_EQ(kept.begin()->second.nanoseconds, row.nanoseconds) << row.text;
   }
-  alarms()->scheduleAlarm("x", platform::Time(7.5));
-  EXPECT_EQ(kept.begin()->second.nanoseconds, 7'000'000'000);
   mark();
   alarms()->cancelAlarm("x");
   EXPECT_THAT(effects(Effects::log | Effects::alarm),

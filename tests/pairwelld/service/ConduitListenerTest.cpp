@@ -2,7 +2,6 @@
 #include "pairwelld/service/ConduitListener.hpp"
 
 #include "pairwelld/service/ConduitConnection.hpp"
-#include "pairwelld/service/RadixDistributedDebugLogging.hpp"
 #include "tests/pairwelld/World.hpp"
 
 namespace pairwell {
@@ -35,8 +34,7 @@ class RecordingManager : public DebugManager {
   Effects& effects;
 };
 
-class ConduitListenerTest : public World {
- public:
+struct ConduitListenerTest : World {
   ConduitListenerTest() {
     listener->activate();
     run();
@@ -89,7 +87,6 @@ TEST_F(ConduitListenerTest, OnlyTheBooleanTrueOfEitherEntitlementAdmits) {
       {"system false, internal true", {{systemKey, false}, {internalKey, true}}, true},
       {"text", {{systemKey, "true"}, {internalKey, platform::List{true}}}, false},
       {"number", {{systemKey, 1}, {internalKey, 1}}, false},
-      {"another", {{"com.kestrel.bluetooth", true}}, false},
       {"none", {}, false},
   };
   for (const int internalBuild : {0, 2}) {
@@ -183,8 +180,8 @@ TEST_F(ConduitListenerTest, AnAcceptedCallCompletesThoughClientAndListenerHaveGo
   const std::weak_ptr<ConduitListener> weak = listener;
   platform.listeners[0]->clients.clear();
   std::exchange(client, nullptr)->end();
-  std::exchange(listener, nullptr)->serialQueue->sync([] {
-  });  // its end is seen to before the calls have their turn
+  // Its end is seen to before the calls have their turn.
+  std::exchange(listener, nullptr)->serialQueue->sync([] {});
   EXPECT_FALSE(weak.expired()) << "the calls need it";
   mark();
   run();
@@ -194,12 +191,6 @@ TEST_F(ConduitListenerTest, AnAcceptedCallCompletesThoughClientAndListenerHaveGo
   mark();
   EXPECT_FALSE(*offerClient(8)->admitted);
   EXPECT_THAT(log(), IsEmpty());
-}
-
-TEST(RadixDistributedDebugLoggingTest, OnlyBitZeroHasAName) {
-  for (const unsigned bits : {0u, 2u}) EXPECT_EQ(RadixDistributedDebugLogging(bits).description(), "");
-  for (const unsigned bits : {1u, 3u})
-    EXPECT_EQ(RadixDistributedDebugLogging(bits).description(), "Kestrel Audio Accessory");
 }
 
 }  // namespace
