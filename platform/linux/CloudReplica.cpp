@@ -135,10 +135,10 @@ std::vector<CloudReport> cloudReports(const Dictionary& before, const Dictionary
 bool CloudBursts::write(Dictionary& entries, const CloudWrite& write) {
   if (const auto companion = passedCompanion(entries, write)) return expire(entries, write, *companion);
   if (!write.value && write.key == expiring) return place(entries, write);
+  expiring.clear();  // any other write, an echo too, ends what belongs to the expiry
   if (!joins(entries, write)) {
     if (isEcho(write)) return false;
     stamp = {std::max(microsecondsOf(write.now), greatestOf(entries).microseconds + 1), 0};
-    expiring.clear();
   }
   lastWrite = write.now;
   return place(entries, write);

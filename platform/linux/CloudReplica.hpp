@@ -45,10 +45,10 @@ Dictionary cloudValues(const Dictionary& entries);
 // idempotent: order, repetition and loss of documents do not matter.
 bool mergeCloudEntries(const Dictionary& other, Dictionary& into);
 
-// What to tell of a change from elsewhere. The document says why the account, the first download or the quota
-// changed it
-// ("reason", told once for each "reasonSequence"), which is news even without a key. What a quota is told for
-// is not read further by those who hear of it, so keys that changed meanwhile get a report of their own.
+// What to tell of a change from elsewhere. Where the account, the first download or the quota changed the
+// document, it says so ("reason", told once for each "reasonSequence"), which is news even without a key.
+// What a quota is told for is not read further by those who hear of it, so keys that changed meanwhile get a
+// report of their own.
 struct CloudReport {
   CloudStore::ChangeReason reason;
   std::vector<std::string> keys;

@@ -75,15 +75,16 @@ Result<void> ReplicaFileCloudStore::write(const std::optional<Value>& value, std
     if (const auto known = lastKnown.find(key); known != lastKnown.end()) write.lastKnown = known->second;
   }
   CloudBursts next = bursts;
+  bool changed = false;
   const auto written = file->update([&](Dictionary& document) {
     write.device = deviceOf(document);
     write.now = clock.now();
-    return next.write(settingsValues(document), write);
+    return changed = next.write(settingsValues(document), write);
   });
   std::lock_guard lock(mutex);
   isDurable = written.has_value();
   if (!written) return written;
-  next.finished(clock.now());
+  if (changed) next.finished(clock.now());  // an echo prolongs no burst
   bursts = next;
   lastKnown.insert_or_assign(write.key, value);
   return written;

@@ -17,7 +17,7 @@ struct Device {
     const auto known = lastKnown.contains(key) ? std::optional(lastKnown[key]) : std::nullopt;
     const bool news = bursts.write(entries, {key, value, known, now, name});
     now += disk;
-    bursts.finished(now);
+    if (news) bursts.finished(now);
     lastKnown[key] = value;
     return news;
   }
@@ -136,6 +136,18 @@ TEST(CloudReplicaTest, ExpiryRanksRightAfterTheSwitchThatItEnds) {
   EXPECT_EQ(away.stamp("flag").tick, 0);
   home.exchange(away);
   EXPECT_EQ(home.values(), R"(["flag": false, "other": 1])");
+
+  // An expiry long past does not keep a later removal of an end from being news.
+  home.switchOn(home.now.count());
+  home.switchOff();
+  away.now = home.now + Time(100);
+  away.exchange(home);
+  away.switchOn(20000);
+  home.exchange(away);
+  for (const char* key : {"flag", "flagExpiration"}) home.read(key);
+  home.now = away.now + Time(1);
+  home.switchOn(20000);  // echoes
+  EXPECT_TRUE(home.write("flagExpiration", std::nullopt));
 }
 
 TEST(CloudReplicaTest, MergingTakesTheGreaterInWhateverOrderAndSkipsWhatIsNoEntry) {

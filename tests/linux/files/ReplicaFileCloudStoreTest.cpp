@@ -54,6 +54,15 @@ TEST_F(ReplicaFileCloudStoreTest, OutsideChangeIsAnnouncedOnceAndAnOwnOneNever) 
   EXPECT_EQ(describe(store->dictionaryRepresentation()), R"(["end": 5.5, "flag": false, "own": 1])");
 }
 
+TEST_F(ReplicaFileCloudStoreTest, EchoProlongsNoBurst) {
+  store->setValue(true, "flag");
+  device.manualClock.time += Time(10);
+  store->setValue(true, "flag");
+  device.manualClock.time += Time(0.001);
+  store->setValue(1, "other");
+  EXPECT_THAT(entry("other"), HasSubstr(R"("time": 1000010001000)"));
+}
+
 TEST_F(ReplicaFileCloudStoreTest, ReasonsInTheFileAreAnnouncedOnceAndEvenWithoutAKey) {
   neighbour->setValue(1, "a");
   EXPECT_EQ(announced().size(), 1u);
