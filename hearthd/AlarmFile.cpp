@@ -19,7 +19,7 @@ const platform::Logger& log() {
 
 AlarmFile::AlarmFile(platform::linux_::FileSystem& files_, const std::string& folder)
     : files(files_), path(folder + "/alarms.json") {
-  if (const auto made = files.makeFolder(folder); !made) {
+  if (const auto made = platform::linux_::makeFolderDurably(files, folder); !made) {
     log().error("%s: %s", folder, made.error().message());
   }
 }
@@ -41,6 +41,7 @@ Alarms AlarmFile::load() {
 }
 
 platform::Result<void> AlarmFile::save(const Alarms& alarms) {
+  if (damageStays) return platform::Outcome::malformedFile;
   const auto text = platform::linux_::printJson(alarms.toValue(), platform::linux_::JsonStyle::indented);
   if (!text) return text.error();
   const auto saved = platform::linux_::replaceFile(files, path, *text);
@@ -50,6 +51,7 @@ platform::Result<void> AlarmFile::save(const Alarms& alarms) {
 
 void AlarmFile::moveAside(const std::string& problem) {
   const auto moved = platform::linux_::moveAside(files, path);
+  damageStays = !moved;
   if (moved) {
     log().error("%s: %s; moved to %s", path, problem, *moved);
   } else {

@@ -16,7 +16,8 @@ class AlarmFile {
 
   // A file that cannot be read is moved aside, with a line in the log: no registration may overwrite it.
   Alarms load();
-  // Durable once it has returned without an error; after one the file is as it was.
+  // Durable once it has returned without an error. Outcome::malformedFile where a damaged file could not be
+  // moved aside: it is not overwritten.
   platform::Result<void> save(const Alarms& alarms);
 
  private:
@@ -24,6 +25,7 @@ class AlarmFile {
 
   platform::linux_::FileSystem& files;
   const std::string path;
+  bool damageStays = false;
 };
 
 }  // namespace hearth

@@ -114,7 +114,7 @@ BusReply Connection::perform(std::size_t index, const List& arguments) {
 
 BusReply Connection::watch(const std::string& name) {
   if (manager.watch(watcher, name)) return List();
-  return error("org.freedesktop.DBus.Error.LimitsExceeded", "too many names are watched");
+  return error("org.freedesktop.DBus.Error.LimitsExceeded", "too many names, or too long a one");
 }
 
 // With a date as the third argument it sets the event, without one it clears it.

@@ -11,8 +11,8 @@ namespace hearth {
 
 // One file of etc/jobs, for example
 //
-//   {"name": "com.kestrel.pairwelld", "program": "bin/pairwelld", "services":
-//   ["com.kestrel.pairwell.conduit"],
+//   {"name": "com.kestrel.pairwelld", "program": "bin/pairwelld",
+//    "services": ["com.kestrel.pairwell.conduit"],
 //    "streams": ["com.kestrel.alarm", "com.kestrel.tidingsd.matching"], "matching": ["com.kestrel.example"],
 //    "environment": {"LANG": "C.UTF-8"}, "restart": true}
 //

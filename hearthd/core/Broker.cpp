@@ -3,6 +3,7 @@
 namespace hearth {
 
 bool Broker::watch(Watcher watcher, const std::string& name) {
+  if (name.size() > nameLength) return false;
   auto& names = byWatcher[watcher];
   if (names.size() >= namesPerWatcher && names.count(name) == 0) return false;
   names.insert(name);

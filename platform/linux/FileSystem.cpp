@@ -3,12 +3,6 @@
 namespace platform::linux_ {
 namespace {
 
-std::string folderOf(const std::string& path) {
-  const auto slash = path.rfind('/');
-  if (slash == std::string::npos) return ".";
-  return slash == 0 ? "/" : path.substr(0, slash);
-}
-
 Result<void> writeNew(FileSystem& files, const std::string& path, std::string_view bytes) {
   auto file = files.create(path);
   if (!file && file.error() == std::errc::file_exists) {
@@ -23,10 +17,27 @@ Result<void> writeNew(FileSystem& files, const std::string& path, std::string_vi
 
 }  // namespace
 
+std::string folderOf(const std::string& path) {
+  const auto slash = path.rfind('/');
+  if (slash == std::string::npos) return ".";
+  return slash == 0 ? "/" : path.substr(0, slash);
+}
+
 Result<std::string> readFile(FileSystem& files, const std::string& path, std::size_t limit) {
   const auto file = files.openToRead(path);
   if (!file) return file.error();
   return (*file)->readAll(limit);
+}
+
+Result<void> makeFolderDurably(FileSystem& files, const std::string& folder) {
+  if (const auto made = files.makeFolder(folder); !made) return made;
+  for (std::string path = folder; path != folderOf(path); path = folderOf(path)) {
+    const auto synced = files.syncFolder(folderOf(path));
+    // What may not be opened was not made here, either; nor was anything above it.
+    if (!synced && synced.error() == std::errc::permission_denied) break;
+    if (!synced && synced.error() != std::errc::read_only_file_system) return synced;
+  }
+  return {};
 }
 
 Result<std::string> moveAside(FileSystem& files, const std::string& path) {

@@ -74,14 +74,22 @@ class FileSystem {
       const std::string& folder, std::function<void(const std::string& name)> changed) = 0;
 };
 
+// The folder that `path` lies in.
+std::string folderOf(const std::string& path);
+
 // The whole of a file.
 Result<std::string> readFile(FileSystem& files, const std::string& path, std::size_t limit);
+
+// Makes `folder` with its entry in each folder above, which a power cut would take otherwise; whether an
+// earlier attempt or another process made it, and was cut off, cannot be told.
+Result<void> makeFolderDurably(FileSystem& files, const std::string& folder);
 
 // Moves a damaged file aside, under a name that is new; the name.
 Result<std::string> moveAside(FileSystem& files, const std::string& path);
 
 // Replaces `path`, durably and in one step: temporary file beside it, sync, rename, sync of the folder. On
-// failure the old file is as it was and the temporary one is gone.
+// failure the old file is as it was and the temporary one is gone; where the last sync alone fails, the new
+// one is there.
 Result<void> replaceFile(FileSystem& files, const std::string& path, std::string_view bytes);
 
 }  // namespace platform::linux_

@@ -11,9 +11,8 @@ namespace platform::linux_ {
 //
 //   Post s                 posts a named notification
 //   Watch s / Unwatch s    the connection hears of the posts of a name from now on, or no longer
-//   SetEvent ssx → x       stream, name, date in nanoseconds: registers an event, durably before it answers
-//   with
-//                          its generation
+//   SetEvent ssx → x       stream, name, date in nanoseconds: registers an event, durably before it
+//                          answers with its generation
 //   ClearEvent ss → x      stream, name; the least generation that is not stale
 //   InstallHandler s       the job has a handler for a stream: its events are delivered from now on
 //   Taken ssx              stream, name, generation: the handler has returned
@@ -44,9 +43,8 @@ enum class HearthOperation {
 // Signals.
 //
 //   Notification s         a watched name was posted; unread ones of a name merge
-//   Event ssx              stream, name, generation; on a link alone. Generation 0 is no alarm's, and is not
-//   answered
-//                          with Taken
+//   Event ssx              stream, name, generation; on a link alone. Generation 0 is no alarm's, and
+//                          is not answered with Taken
 enum class HearthSignal { notification, event };
 
 const BusInterface& hearthInterface();

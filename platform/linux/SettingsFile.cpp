@@ -16,24 +16,6 @@ const Logger& log() {
 
 bool isMissing(std::error_code error) { return error == std::errc::no_such_file_or_directory; }
 
-std::string parentOf(const std::string& path) {
-  const auto parent = std::filesystem::path(path).parent_path().string();
-  return parent.empty() ? "." : parent;
-}
-
-// With its entry in each folder above, which a power cut would take otherwise; whether an earlier attempt or
-// another process made it, and was cut off, cannot be told.
-Result<void> makeFolderDurably(FileSystem& files, const std::string& folder) {
-  if (const auto made = files.makeFolder(folder); !made) return made;
-  for (std::string path = folder; path != parentOf(path); path = parentOf(path)) {
-    const auto synced = files.syncFolder(parentOf(path));
-    // What may not be opened was not made here, either; nor was anything above it.
-    if (!synced && synced.error() == std::errc::permission_denied) break;
-    if (!synced && synced.error() != std::errc::read_only_file_system) return synced;
-  }
-  return {};
-}
-
 }  // namespace
 
 std::shared_ptr<SettingsFile> SettingsFile::create(FileSystem& files, std::string path) {
@@ -124,7 +106,7 @@ void SettingsFile::moveAside() {
 // A file that is there is proof that its folders are durable: they are made so before it is.
 Result<std::unique_ptr<FileLock>> SettingsFile::lockForWriting() {
   if (!files.identity(path)) {
-    if (const auto made = makeFolderDurably(files, parentOf(path)); !made) return made.error();
+    if (const auto made = makeFolderDurably(files, folderOf(path)); !made) return made.error();
   }
   return files.lock(path + ".lock");
 }
@@ -205,7 +187,7 @@ Result<void> SettingsFile::setValue(std::string_view key, const std::optional<Va
 void SettingsFile::startWatching(WorkQueue& delivery_, Changed changed_) {
   delivery = &delivery_;
   changed = std::move(changed_);
-  const std::string folder = parentOf(path);
+  const std::string folder = folderOf(path);
   const auto made = files.makeFolder(folder);
   auto begun = made ? files.watch(folder,
                                   [weak = weak_from_this()](const std::string&) {
