@@ -42,9 +42,10 @@ class Reader : public nlohmann::json_sax<Json> {
   bool boolean(bool value) override { return add(value); }
   bool number_integer(number_integer_t value) override { return add(Value(std::int64_t{value})); }
   bool number_unsigned(number_unsigned_t value) override {
-    if (value > static_cast<number_unsigned_t>(std::numeric_limits<std::int64_t>::max())) {
-      return fail("an integer beyond 64 bits");
-    }
+    // One beyond 64 bits is a double, as the parser has it for still greater ones: at most its entry is of no
+    // use.
+    if (value > static_cast<number_unsigned_t>(std::numeric_limits<std::int64_t>::max()))
+      return add(Value(static_cast<double>(value)));
     return add(Value(static_cast<std::int64_t>(value)));
   }
   bool number_float(number_float_t value, const string_t&) override {

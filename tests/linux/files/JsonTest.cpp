@@ -15,7 +15,7 @@ std::string nested(int levels) {
 TEST(JsonTest, RefusesWhatItCouldNotKeepAndSaysWhere) {
   for (const std::string& text :
        {nested(33), nested(100'000), std::string("{\"a\": 1,\n \"a\": 1}"), std::string("\n[1e400]"),
-        std::string("9223372036854775808"), std::string("\"\xff\""), std::string("1 2"), std::string()}) {
+        std::string("\"\xff\""), std::string("1 2"), std::string()}) {
     std::string problem;
     EXPECT_EQ(parseJson(text, problem).error(), Outcome::malformedFile) << text.substr(0, 40);
     const std::string place = text.find('\n') == text.npos ? "line 1, column " : "line 2, column ";
@@ -34,6 +34,8 @@ TEST(JsonTest, ReadsBackWhatItWrote) {
     EXPECT_EQ(parseJson(*printJson(value, style), problem).value(), value);
   }
   EXPECT_TRUE(parseJson(nested(32), problem)) << problem;
+  EXPECT_EQ(parseJson("9223372036854775808", problem).value(), Value(0x1p63))
+      << "its entry's fault, not the file's";
   EXPECT_EQ(printJson("\xff", JsonStyle::line).value(), "\"\xef\xbf\xbd\"");
 }
 
