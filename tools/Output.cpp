@@ -59,7 +59,8 @@ void say(const std::string& text) {
 Exit fail(const std::string& what, std::error_code error) {
   say(what + ": " + error.message());
   if (error == platform::Outcome::notPermitted) return refused;
-  const bool isAbsent = error == platform::Outcome::notConnected || error == platform::Outcome::timedOut;
+  const bool isAbsent = error == platform::Outcome::notConnected || error == platform::Outcome::timedOut ||
+                        error == std::errc::permission_denied;
   return isAbsent ? unreachable : failed;
 }
 

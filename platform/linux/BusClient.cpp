@@ -52,8 +52,11 @@ Result<UniqueDescriptor> connectTo(const std::string& path, std::chrono::millise
   // Bounds the wait where the queue of a service that does not accept is full.
   const timeval limit{timeout.count() / 1000, timeout.count() % 1000 * 1000};
   ::setsockopt(socket.get(), SOL_SOCKET, SO_SNDTIMEO, &limit, sizeof limit);
-  if (::connect(socket.get(), reinterpret_cast<const sockaddr*>(&address), sizeof address) < 0)
+  if (::connect(socket.get(), reinterpret_cast<const sockaddr*>(&address), sizeof address) < 0) {
+    // The file system's word, no service's.
+    if (errno == EACCES || errno == EPERM) return std::error_code(errno, std::system_category());
     return failure(errno);
+  }
   return socket;
 }
 

@@ -16,7 +16,8 @@ namespace platform::linux_ {
 class BusClient {
  public:
   // Connects to the socket at `path` and authenticates. Outcome::notPermitted when refused,
-  // Outcome::notConnected when nobody serves it, Outcome::timedOut.
+  // Outcome::notConnected when nobody serves it, std::errc::permission_denied when the file system does not
+  // let us there, Outcome::timedOut.
   static Result<std::unique_ptr<BusClient>> connect(const std::string& path,
                                                     std::chrono::milliseconds timeout);
   ~BusClient();

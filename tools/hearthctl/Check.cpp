@@ -11,6 +11,7 @@
 #include "platform/linux/Entitlements.hpp"
 #include "platform/linux/Json.hpp"
 #include "platform/linux/LinuxEnvironment.hpp"
+#include "tools/End.hpp"
 #include "tools/hearthctl/Settings.hpp"
 
 namespace tools {
@@ -26,7 +27,6 @@ using platform::linux_::FileSystem;
 using platform::linux_::Paths;
 
 constexpr std::size_t fileLimit = 64 << 20;
-constexpr double lastAlarmSecond = 9223372036;  // a later one has no date, and the daemon takes it for none
 // What a switch writes is written in far less.
 constexpr std::chrono::milliseconds switchTime{300};
 
@@ -48,7 +48,7 @@ bool flagIn(const Dictionary& values) {
 std::optional<double> endIn(const Dictionary& values) {
   const auto found = values.find(endKey);
   const auto end = found == values.end() ? std::nullopt : platform::toDouble(found->second);
-  return end && *end > 0 && std::trunc(*end) <= lastAlarmSecond ? end : std::nullopt;
+  return end && isEnd(*end) ? end : std::nullopt;
 }
 
 struct Finding {
@@ -169,7 +169,7 @@ std::optional<Period> Look::readPeriod(const std::vector<Alarm>& alarms) {
     const auto values = Settings(paths, source, files, hearth).values(problem);
     if (values) {
       contents[source] = *values;
-    } else {
+    } else if (values.error() != std::errc::no_such_file_or_directory) {  // that one has been named already
       add(settingsPath(paths, source) + ": " + problem,
           values.error() == Outcome::malformedFile
               ? "hearthctl settings edit " + std::string(platform::rawValue(source))

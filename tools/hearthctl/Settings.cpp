@@ -101,8 +101,13 @@ Settings::Settings(const platform::linux_::Paths& paths, KeyValueSource source_,
 Result<Dictionary> Settings::values(std::string& problem) const {
   const auto text = platform::linux_::readFile(files, path, SettingsFile::sizeLimit);
   if (!text) {
-    if (text.error() == std::errc::no_such_file_or_directory) return Dictionary();
-    problem = text.error().message();
+    const std::string aside = path + ".damaged-1";
+    const bool isMissing = text.error() == std::errc::no_such_file_or_directory;
+    if (isMissing && !files.identity(aside)) return Dictionary();
+    // A running daemon still holds its last good contents, which a new file would take from it.
+    problem = isMissing ? "was damaged, and is now " + aside +
+                              ": mend that, remove its checksum line and move it back, or delete it"
+                        : text.error().message();
     return text.error();
   }
   const auto document = platform::linux_::decodeSettings(*text, problem);
@@ -169,7 +174,7 @@ Exit Settings::edit() {
     say(path + ": " + problem + "; the copy to mend is the whole file");
     text = platform::linux_::readFile(files, path, SettingsFile::sizeLimit);
   }
-  if (!text) return fail(path, text.error());
+  if (!text) return say(path + ": " + problem), failed;
   const auto copy = makeCopy(*text);
   if (!copy) return fail("/tmp", copy.error());
   const Exit exit = takeEdited(*copy, *text, before);

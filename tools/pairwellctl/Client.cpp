@@ -10,6 +10,7 @@
 #include "platform/linux/LinuxEnvironment.hpp"
 #include "platform/linux/LinuxFileSystem.hpp"
 #include "platform/linux/ReplicaFileCloudStore.hpp"
+#include "tools/End.hpp"
 
 namespace tools {
 namespace {
@@ -46,7 +47,7 @@ double Client::end() const {
                                                                      paths.cloudSettings(cloudIdentifier));
   const double end =
       cloud->doubleForKey(platform::rawValue(pairwell::Defaults::velaLogCloudCollectionEnabledExpiration));
-  return end > clock.now().count() ? end : 0;
+  return isEnd(end) && end > clock.now().count() ? end : 0;
 }
 
 std::error_code Client::watch(const std::function<std::error_code()>& changed) {
