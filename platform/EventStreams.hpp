@@ -22,7 +22,8 @@ class EventStreams {
   // Runs `handler` on `queue` for every event of `stream`, those included that came before it was installed.
   using Handler = std::function<void(const Dictionary& event)>;
   virtual void setHandler(std::string_view stream, std::shared_ptr<WorkQueue> queue, Handler handler) = 0;
-  // Registers, or replaces, the event `name`; no descriptor clears it.
+  // Registers, or replaces, the event `name`; no descriptor clears it. One that its stream cannot use is
+  // refused with a line in the log, and an earlier event stays as it was.
   virtual void setEvent(std::string_view stream, std::string_view name,
                         const std::optional<Dictionary>& descriptor) = 0;
 };

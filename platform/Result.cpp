@@ -14,8 +14,6 @@ class OutcomeCategory : public std::error_category {
         return "malformed file";
       case Outcome::notPermitted:
         return "not permitted";
-      case Outcome::malformedDescriptor:
-        return "malformed descriptor";
       case Outcome::notConnected:
         return "not connected";
       case Outcome::timedOut:

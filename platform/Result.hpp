@@ -10,10 +10,9 @@ namespace platform {
 // Failures that a caller of the platform acts on; every other category of std::error_code is a fault of the
 // system below, which callers pass on untouched.
 enum class Outcome {
-  malformedFile = 1,    // does not parse, or does not match its checksum: the file is moved aside
-  notPermitted,         // refused by the other side's rules
-  malformedDescriptor,  // an event descriptor without what its stream needs
-  notConnected,         // the other side is not there
+  malformedFile = 1,  // does not parse, or does not match its checksum: the file is moved aside
+  notPermitted,       // refused by the other side's rules
+  notConnected,       // the other side is not there
   timedOut,
   tooLarge,
 };

@@ -9,5 +9,7 @@ namespace platform::linux_ {
 
 // The inherited descriptor called `name`, or none. Each is given out once. Any thread.
 UniqueDescriptor takeInheritedDescriptor(std::string_view name);
+// Whether there is one of that name which nobody has taken.
+bool hasInheritedDescriptor(std::string_view name);
 
 }  // namespace platform::linux_

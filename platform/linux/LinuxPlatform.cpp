@@ -19,6 +19,7 @@
 #include "platform/linux/FileDeviceProperties.hpp"
 #include "platform/linux/FileRadixController.hpp"
 #include "platform/linux/FileUserPreferences.hpp"
+#include "platform/linux/HearthInterface.hpp"
 #include "platform/linux/HearthLink.hpp"
 #include "platform/linux/InheritedDescriptors.hpp"
 #include "platform/linux/LinuxEnvironment.hpp"
@@ -67,6 +68,11 @@ class Lazy {
   std::optional<T> value;
 };
 
+[[noreturn]] void endWithoutLink() {
+  hearthLog("link").error("there is no link to hearthd: pairwelld is a job of hearthd's, which starts it");
+  ::_exit(1);
+}
+
 // A loop and the thread that runs it.
 class LoopThread {
  public:
@@ -80,6 +86,18 @@ class LoopThread {
  private:
   const std::unique_ptr<EventLoop> loop;
   std::thread thread;
+};
+
+// A job's environment. A service name that somebody set by hand makes no job: without hearthd's link the
+// process ends at once, before it has written anything.
+class JobEnvironment : public LinuxEnvironment {
+ public:
+  std::optional<std::string> variable(std::string_view name) override {
+    auto value = LinuxEnvironment::variable(name);
+    if (name == "CONDUIT_SERVICE_NAME" && value && !hasInheritedDescriptor(linkDescriptorName))
+      endWithoutLink();
+    return value;
+  }
 };
 
 class MainLoop : public RunLoop {
@@ -126,14 +144,10 @@ struct LinuxPlatform::Services {
       return std::move(*inherited);
     });
   }
-  [[noreturn]] void endWithoutLink() {
-    hearthLog("link").error("there is no link to hearthd: pairwelld is a job of hearthd's, which starts it");
-    ::_exit(1);
-  }
 
   const Paths paths;
   UnifiedLog log;
-  LinuxEnvironment environment;
+  JobEnvironment environment;
   LinuxClock clock;
   NotificationCentre centre;
   Lazy<std::unique_ptr<MainLoop>> main;
