@@ -81,7 +81,7 @@ TEST_F(BusServerTest, DamageEndsItsClientAloneAndHoldsNoMemory) {
   giant[7] = 0x07;  // a body of 120 MiB
   giant[6] = static_cast<char>(0x80);
   // Sizes of body and fields whose sum is small in 32 bits.
-  for (const std::size_t at : {4, 5, 6, 7, 12, 13, 14, 15}) overflow[at] = static_cast<char>(0xff);
+  for (const std::size_t at : {4u, 5u, 6u, 7u, 12u, 13u, 14u, 15u}) overflow[at] = static_cast<char>(0xff);
   overflow[12] = static_cast<char>(0xf9);
   const std::pair<const char*, std::string> rows[] = {
       {"giant", giant},
