@@ -104,6 +104,8 @@ TEST_F(HearthctlTest, CheckNamesEachResidueWithItsRemedy) {
       {"true", "true", "4000000000.5", "4000000001", "not at the end", "start hearthd"},
       {"true", "true", "1000000000", "", "the end has passed", "start hearthd"},
       {"true", "true", "", "4000000000", "without an end time", "pairwellctl logging off"}};
+  EXPECT_THAT(ctl("check").output, HasSubstr("etc: there is no device"));
+  fs::create_directory(root / "etc");
   for (const auto& row : rows) {
     SCOPED_TRACE(row.problem);
     EXPECT_THAT(set("root", flagKey, row.rootFlag).errors, HasSubstr("nobody was told"));

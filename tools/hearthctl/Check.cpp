@@ -30,7 +30,7 @@ constexpr std::size_t fileLimit = 64 << 20;
 // What a switch writes is written in far less.
 constexpr std::chrono::milliseconds switchTime{300};
 
-const std::string job = "com.kestrel.pairwelld";
+const std::string daemonJob = "com.kestrel.pairwelld";
 const std::string flagKey(platform::rawValue(Defaults::velaLogCloudCollectionEnabled));
 const std::string endKey(platform::rawValue(Defaults::velaLogCloudCollectionEnabledExpiration));
 
@@ -81,6 +81,7 @@ class Look {
     findings.push_back({std::move(problem), std::move(remedy)});
   }
   void lookAtFiles();
+  void lookAtJobs();
   void lookForDamaged(const std::string& folder);
   // Empty where there is no file; what is wrong with it is a finding.
   Dictionary readObject(const std::string& path, const std::string& remedy);
@@ -100,6 +101,7 @@ Exit Look::take() {
   if (!alarms && alarms.error() != Outcome::notConnected) return hearth.fail(alarms.error());
   hearthdRuns = alarms.has_value();
   lookAtFiles();
+  if (hearthdRuns) lookAtJobs();
   if (const auto period = readPeriod(alarms ? *alarms : alarmsFromFile())) judge(*period);
   for (const auto& grant : platform::linux_::readGrants(files, paths)) {
     if (!grant.problem.empty()) add(grant.file + " does not count: " + grant.problem, "mend what it names");
@@ -107,7 +109,16 @@ Exit Look::take() {
   return done;
 }
 
+// One that waits has ended by itself, or could not be started.
+void Look::lookAtJobs() {
+  const auto jobs = hearth.jobs();
+  for (const Job& each : jobs ? *jobs : std::vector<Job>()) {
+    if (each.state == "waiting") add(each.name + " does not run: " + each.detail, "mend what it names");
+  }
+}
+
 void Look::lookAtFiles() {
+  if (!files.identity(paths.etc)) add(paths.etc + ": there is no device", "hearthctl init");
   readObject(paths.device(), "mend it");
   if (const auto names = files.list(paths.jobs())) {
     for (const std::string& name : *names) {
@@ -180,7 +191,7 @@ std::optional<Period> Look::readPeriod(const std::vector<Alarm>& alarms) {
   Period period{flagIn(contents[KeyValueSource::root]), flagIn(contents[KeyValueSource::cloud]),
                 endIn(contents[KeyValueSource::cloud]), std::nullopt};
   for (const Alarm& alarm : alarms) {
-    if (alarm.job == job && alarm.stream == "com.kestrel.alarm" && alarm.name == flagKey)
+    if (alarm.job == daemonJob && alarm.stream == "com.kestrel.alarm" && alarm.name == flagKey)
       period.alarm = alarm.date;
   }
   return period;
@@ -188,7 +199,7 @@ std::optional<Period> Look::readPeriod(const std::vector<Alarm>& alarms) {
 
 void Look::judge(const Period& period) {
   if (!period.cloudFlag) return judgeOff(period);
-  const std::string restart = hearthdRuns ? "hearthctl jobs restart " + job : "start hearthd";
+  const std::string restart = hearthdRuns ? "hearthctl jobs restart " + daemonJob : "start hearthd";
   if (!period.rootFlag) add("the cloud flag is on, and the root flag off", restart);
   if (!period.end) {
     add("the flag is on without an end time", "pairwellctl logging off");

@@ -64,13 +64,22 @@ Result<std::vector<Alarm>> Hearth::alarms() {
   return alarms;
 }
 
-Exit Hearth::listJobs(Output& output) {
+Result<std::vector<Job>> Hearth::jobs() {
   const auto results = call(HearthOperation::listJobs);
-  if (!results) return fail(results.error());
-  for (const Value& row : rows(*results)) {
-    const auto pid = integer(row, 2);
-    output.add({{"name", text(row, 0)}, {"state", text(row, 1)}, {"pid", pid}, {"detail", text(row, 3)}},
-               {text(row, 0), text(row, 1), pid > 0 ? std::to_string(pid) : "-", text(row, 3)});
+  if (!results) return results.error();
+  std::vector<Job> jobs;
+  for (const Value& row : rows(*results))
+    jobs.push_back({text(row, 0), text(row, 1), integer(row, 2), text(row, 3)});
+  return jobs;
+}
+
+Exit Hearth::listJobs(Output& output) {
+  const auto all = jobs();
+  if (!all) return fail(all.error());
+  for (const Job& job : *all) {
+    output.add({{"name", job.name}, {"state", job.state}, {"pid", job.pid}, {"detail", job.detail}},
+               {job.name, job.state, job.pid > 0 ? std::to_string(job.pid) : "-",
+                job.detail.empty() ? "" : "last: " + job.detail});
   }
   output.print();
   return done;

@@ -1,6 +1,7 @@
 // What hearthctl asks of hearthd.
 #pragma once
 
+#include <cstdint>
 #include <memory>
 #include <optional>
 #include <string>
@@ -23,11 +24,19 @@ struct Alarm {
   double date;  // seconds since 1970
 };
 
+struct Job {
+  std::string name;
+  std::string state;
+  std::int64_t pid;    // 0 where none runs
+  std::string detail;  // how its last run ended, or why it could not be started
+};
+
 class Hearth {
  public:
   explicit Hearth(const platform::linux_::Paths& paths) : socket(paths.hearthdSocket()) {}
 
   platform::Result<std::vector<Alarm>> alarms();
+  platform::Result<std::vector<Job>> jobs();
 
   // The commands; each prints, and answers how to exit.
   Exit perform(platform::linux_::HearthOperation operation, const platform::List& arguments);
