@@ -65,7 +65,10 @@ void prepareProcess() {
 // The lock that says that a hearthd lives on this root.
 std::optional<UniqueDescriptor> takeRoot(const platform::linux_::Paths& paths) {
   std::error_code error;
-  std::filesystem::create_directories(paths.run, error);
+  if (std::filesystem::create_directories(paths.run, error); error) {
+    std::fprintf(stderr, "hearthd: %s: %s\n", paths.run.c_str(), error.message().c_str());
+    return std::nullopt;
+  }
   const std::string path = paths.run + "/hearthd.lock";
   auto lock = hearth::takeLock(path);
   if (!lock) {
