@@ -119,12 +119,55 @@ TEST_F(SystemTest, ChangesFromOutsideAreFollowed) {
   EXPECT_TRUE(eventually([&] { return logged("Root KVS Notification"); }));
 }
 
+TEST_F(SystemTest, StockClientsAndTheCommandLineAreAnsweredAlike) {
+  for (const std::string client : {"busctl", "gdbus"}) {
+    fs::copy_file("/usr/bin/" + client, root / "bin" / client);
+    write("etc/entitlements.d/" + client + ".json",
+          R"({"executable": "bin/)" + client +
+              R"(", "entitlements": {"com.kestrel.bluetooth.internal": true}})");
+  }
+  start();
+  const pid_t watcher = spawn("pairwellctl watch", "watch");
+  ASSERT_TRUE(eventually([&] {
+    EXPECT_EQ(run("pairwellctl status set 3").status, 0);
+    EXPECT_EQ(run("pairwellctl status set 0").status, 0);
+    return contents(root / "watch.out").find("off\n") != std::string::npos;
+  }));
+  EXPECT_EQ(run("pairwellctl status set 3").status, 0);
+  ASSERT_TRUE(eventually([&] { return run("pairwellctl status").output == "1 Kestrel Audio Accessory\n"; }));
+  EXPECT_TRUE(eventually([&] {
+    const std::string lines = contents(root / "watch.out");
+    return lines.rfind("on until ") > lines.rfind("off\n") && lines.ends_with("\n");
+  }));
+  const std::string address =
+      "unix:path=" + platform::linux_::Paths::under(root).serviceSocket("com.kestrel.pairwell.conduit");
+  const std::string object = "/com/kestrel/pairwell/conduit",
+                    interface = "com.kestrel.pairwell.RadixUserController";
+  EXPECT_EQ(run("busctl --address=" + address + " call x.y " + object + " " + interface +
+                " KestrelAudioAccessoryLimitedLogging")
+                .output,
+            "b true\n");
+  EXPECT_EQ(run("gdbus call --address " + address + " --dest x.y --object-path " + object + " --method " +
+                interface + ".GetCurrentUserGivenName")
+                .output,
+            "([''],)\n");
+  EXPECT_EQ(run("pairwellctl --json given-name").output, "{\"givenName\":\"\"}\n");
+  EXPECT_THAT(run("pairwellctl --json logging").output, HasSubstr("\"logging\":true"));
+  stop();
+  EXPECT_EQ(finish(watcher, "watch").status, 3) << "hearthd has gone";
+}
+
 TEST_F(SystemTest, StrangersAreToldSo) {
   fs::copy_file(root / "bin/pairwellctl", root / "bin/stranger");
   start();
-  EXPECT_EQ(run("stranger status").status, 4);
-  EXPECT_TRUE(logged("Conduit connection denied, ")) << log();
-  EXPECT_TRUE(logged(", add com.kestrel.bluetooth.system entitlement")) << log();
+  const fs::path descriptors = "/proc/" + std::to_string(pairwelld()) + "/fd";
+  const auto open = [&] { return std::distance(fs::directory_iterator(descriptors), {}); };
+  const auto before = open();
+  write("bin/many", "for i in $(seq 200); do stranger status; [ $? -eq 4 ] || exit 1; done");
+  EXPECT_EQ(run("sh " + (root / "bin/many").string()).status, 0);
+  EXPECT_EQ(timesLogged("Conduit connection denied, "), 200u);
+  EXPECT_EQ(timesLogged(", add com.kestrel.bluetooth.system entitlement"), 200u);
+  EXPECT_TRUE(eventually([&] { return open() <= before; }));
   EXPECT_EQ(run("pairwellctl --timeout 5 status").status, 0);
 }
 
@@ -133,9 +176,11 @@ TEST_F(SystemTest, ProcessStartedWronglySaysOneThingAndTouchesNothing) {
   EXPECT_EQ(run("env -u CONDUIT_SERVICE_NAME pairwelld").status, -SIGABRT);
   EXPECT_EQ(contents(root / "run.err"), "pairwelld must be run from hearthd\n");
   EXPECT_FALSE(fs::exists(root / "var"));
-  const Outcome ended = run("env HEARTH_LOG_LEVEL=error CONDUIT_SERVICE_NAME=x pairwelld");
+  const Outcome ended = run("env CONDUIT_SERVICE_NAME=x pairwelld");
   EXPECT_EQ(ended.status, 1);
   EXPECT_THAT(ended.errors, HasSubstr("there is no link to hearthd"));
+  EXPECT_EQ(std::count(ended.errors.begin(), ended.errors.end(), '\n'), 1) << ended.errors;
+  EXPECT_FALSE(fs::exists(root / "var"));
 }
 
 TEST_F(SystemTest, TerminationAtAnyMomentIsClean) {
