@@ -156,7 +156,7 @@ TEST_F(AlarmsTest, ReadsBackWhatItWroteWithGenerationsGoingOn) {
 
 TEST(Broker, KnowsWhoWatchesUntilTheyLeave) {
   Broker broker;
-  for (const auto& [watcher, name] : {std::pair(1, "a"), {1, "a"}, {2, "a"}, {1, "b"}})
+  for (const auto& [watcher, name] : {std::pair(1u, "a"), {1u, "a"}, {2u, "a"}, {1u, "b"}})
     EXPECT_TRUE(broker.watch(watcher, name));
   EXPECT_THAT(broker.watchers("a"), ElementsAre(1, 2));
   broker.unwatch(1, "a");
