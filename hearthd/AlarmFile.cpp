@@ -18,11 +18,7 @@ const platform::Logger& log() {
 }  // namespace
 
 AlarmFile::AlarmFile(platform::linux_::FileSystem& files_, const std::string& folder)
-    : files(files_), path(folder + "/alarms.json") {
-  if (const auto made = platform::linux_::makeFolderDurably(files, folder); !made) {
-    log().error("%s: %s", folder, made.error().message());
-  }
-}
+    : files(files_), path(folder + "/alarms.json") {}
 
 Alarms AlarmFile::load() {
   const auto bytes = platform::linux_::readFile(files, path, fileLimit);
@@ -44,7 +40,10 @@ platform::Result<void> AlarmFile::save(const Alarms& alarms) {
   if (damageStays) return platform::Outcome::malformedFile;
   const auto text = platform::linux_::printJson(alarms.toValue(), platform::linux_::JsonStyle::indented);
   if (!text) return text.error();
-  const auto saved = platform::linux_::replaceFile(files, path, *text);
+  auto saved = files.identity(path)
+                   ? platform::Result<void>()
+                   : platform::linux_::makeFolderDurably(files, platform::linux_::folderOf(path));
+  if (saved) saved = platform::linux_::replaceFile(files, path, *text);
   if (!saved) log().error("%s: %s", path, saved.error().message());
   return saved;
 }

@@ -11,7 +11,7 @@ namespace hearth {
 
 class AlarmFile {
  public:
-  // `folder` is made if need be.
+  // `folder` is made when it is needed.
   AlarmFile(platform::linux_::FileSystem& files, const std::string& folder);
 
   // A file that cannot be read is moved aside, with a line in the log: no registration may overwrite it.

@@ -151,6 +151,7 @@ BusReply Connection::deliverEvent(const std::string& stream, const std::string& 
 BusReply Connection::controlJob(const std::string& action, const std::string& name) {
   Job* job = manager.findJob(name);
   if (!job) return error(platform::linux_::unknownJobError, "no job is called " + name);
+  if (manager.isStopping()) return error(platform::linux_::failedError, "hearthd is being stopped");
   if (action == "start") {
     job->start();
   } else if (action == "stop") {

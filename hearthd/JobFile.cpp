@@ -63,13 +63,14 @@ class Reader {
 
   const std::string& problem() const { return _problem; }
 
+  void fail(std::string_view key, std::string_view what) {
+    if (_problem.empty()) _problem = '"' + std::string(key) + "\" " + std::string(what);
+  }
+
  private:
   const platform::Value* find(std::string_view key) const {
     const auto found = fields.find(key);
     return found == fields.end() ? nullptr : &found->second;
-  }
-  void fail(std::string_view key, std::string_view what) {
-    if (_problem.empty()) _problem = '"' + std::string(key) + "\" " + std::string(what);
   }
 
   const platform::Dictionary& fields;
@@ -92,6 +93,7 @@ JobDescription readJob(const std::string& bytes, const std::string& root, std::s
   job.environment = reader.environment("environment");
   for (std::string& service : reader.texts("services")) {
     job.services.push_back(reader.fileName("services", std::move(service)));
+    if (job.services.back() == "hearthd") reader.fail("services", "names hearthd's own socket");
   }
   job.streams = reader.texts("streams");
   job.matching = reader.texts("matching");

@@ -41,7 +41,7 @@ bool holds(const fs::path& process, const struct stat& file) {
 }  // namespace
 
 platform::Result<UniqueDescriptor> takeLock(const std::string& path) {
-  UniqueDescriptor file(::open(path.c_str(), O_RDONLY | O_CREAT | O_CLOEXEC, 0600));
+  UniqueDescriptor file(::open(path.c_str(), O_RDONLY | O_CREAT | O_CLOEXEC | O_NONBLOCK, 0600));
   if (!file) return std::error_code(errno, std::system_category());
   if (::flock(file.get(), LOCK_EX | LOCK_NB) == 0) return file;
   if (errno == EWOULDBLOCK) return UniqueDescriptor();

@@ -70,6 +70,7 @@ platform::Result<void> ServiceManager::start(std::function<void()> ready) {
 
 void ServiceManager::stop(std::function<void()> stopped) {
   server.stopListening();
+  stopping = true;
   whenReady = nullptr;
   whenStopped = std::move(stopped);
   for (const auto& job : allJobs) job->stop();
@@ -163,6 +164,15 @@ void ServiceManager::disconnected(Watcher watcher) {
 }
 
 void ServiceManager::post(const std::string& name) {
+  if (posted.empty()) loop.async([this] { tellPosted(); });
+  posted.insert(name);
+}
+
+void ServiceManager::tellPosted() {
+  for (const std::string& name : std::exchange(posted, {})) tell(name);
+}
+
+void ServiceManager::tell(const std::string& name) {
   for (const Watcher watcher : broker.watchers(name)) {
     const auto found = connections.find(watcher);
     if (found == connections.end()) continue;

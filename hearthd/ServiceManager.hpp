@@ -5,6 +5,7 @@
 #include <functional>
 #include <map>
 #include <memory>
+#include <set>
 #include <string>
 #include <vector>
 
@@ -53,6 +54,8 @@ class ServiceManager {
   // An event that is no alarm's.
   void deliver(const EventKey& key);
 
+  // No job is started any more.
+  bool isStopping() const { return stopping; }
   Job* findJob(const std::string& name);
   const std::vector<std::unique_ptr<Job>>& jobs() const { return allJobs; }
 
@@ -65,6 +68,8 @@ class ServiceManager {
   void jobChanged();
   template <class Change>
   auto changeAlarms(Change change) -> platform::Result<decltype(change(std::declval<Alarms&>()))>;
+  void tellPosted();
+  void tell(const std::string& name);
   void deliverDue();
   void emitEvent(const EventKey& key, std::int64_t generation);
 
@@ -76,12 +81,15 @@ class ServiceManager {
   Alarms alarms;
   Broker broker;
   PendingEvents pendingEvents;
+  // Told in the loop's next turn, each once: a flood of posts costs its many watchers one notification.
+  std::set<std::string> posted;
   platform::linux_::EventSource wallTimer;
   platform::linux_::EventSource steadyTimer;
 
   std::vector<platform::linux_::UniqueDescriptor> serviceSockets;
   std::vector<std::unique_ptr<Job>> allJobs;
   bool startedAll = false;
+  bool stopping = false;
   std::function<void()> whenReady;
   std::function<void()> whenStopped;
 

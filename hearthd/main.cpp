@@ -1,10 +1,12 @@
 // hearthd [--root DIR]: the service manager, in the foreground.
+#include <fcntl.h>
+#include <poll.h>
 #include <signal.h>
 #include <sys/resource.h>
 #include <sys/stat.h>
 #include <systemd/sd-daemon.h>
+#include <unistd.h>
 
-#include <cstdio>
 #include <cstdlib>
 #include <filesystem>
 #include <optional>
@@ -47,7 +49,22 @@ std::optional<std::string> rootFromArguments(int count, char** arguments) {
   return path;
 }
 
+// Never waits: whoever holds the other end may not read.
+void say(const std::string& text) {
+  pollfd standardError{STDERR_FILENO, POLLOUT, 0};
+  if (::poll(&standardError, 1, 0) <= 0) return;
+  [[maybe_unused]] const ssize_t written = ::write(STDERR_FILENO, text.data(), text.size());
+}
+
+// What is opened must not take the place of a closed standard descriptor, to which messages go.
+void openStandardDescriptors() {
+  int descriptor = 0;
+  while (descriptor >= 0 && descriptor <= STDERR_FILENO) descriptor = ::open("/dev/null", O_RDWR);
+  ::close(descriptor);
+}
+
 void prepareProcess() {
+  openStandardDescriptors();
   ::umask(022);
   ::signal(SIGPIPE, SIG_IGN);
   sigset_t watched;
@@ -66,24 +83,24 @@ void prepareProcess() {
 std::optional<UniqueDescriptor> takeRoot(const platform::linux_::Paths& paths) {
   std::error_code error;
   if (std::filesystem::create_directories(paths.run, error); error) {
-    std::fprintf(stderr, "hearthd: %s: %s\n", paths.run.c_str(), error.message().c_str());
+    say("hearthd: " + paths.run + ": " + error.message() + "\n");
     return std::nullopt;
   }
   const std::string path = paths.run + "/hearthd.lock";
   auto lock = hearth::takeLock(path);
   if (!lock) {
-    std::fprintf(stderr, "hearthd: %s: %s\n", path.c_str(), lock.error().message().c_str());
+    say("hearthd: " + path + ": " + lock.error().message() + "\n");
     return std::nullopt;
   }
   if (!*lock) {
-    std::fputs("hearthd: already running\n", stderr);
+    say("hearthd: already running\n");
     return std::nullopt;
   }
   return std::move(*lock);
 }
 
 void announceReady() {
-  std::fputs("hearthd: ready\n", stderr);
+  say("hearthd: ready\n");
   sd_notify(0, "READY=1");
 }
 
@@ -92,7 +109,7 @@ void announceReady() {
 int main(int count, char** arguments) {
   const auto root = rootFromArguments(count, arguments);
   if (!root) {
-    std::fputs("usage: hearthd [--root DIR]\n", stderr);
+    say("usage: hearthd [--root DIR]\n");
     return wrongUsage;
   }
   prepareProcess();
@@ -109,8 +126,7 @@ int main(int count, char** arguments) {
   const auto terminated = loop.watchSignal(SIGTERM, stop);
   const auto interrupted = loop.watchSignal(SIGINT, stop);
   if (const auto started = manager.start(announceReady); !started) {
-    std::fprintf(stderr, "hearthd: %s: %s\n", paths.hearthdSocket().c_str(),
-                 started.error().message().c_str());
+    say("hearthd: " + paths.hearthdSocket() + ": " + started.error().message() + "\n");
     return failed;
   }
   loop.run();

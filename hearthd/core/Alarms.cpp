@@ -116,7 +116,9 @@ std::optional<Alarms> Alarms::fromValue(const platform::Value& value) {
   if (!whole) return std::nullopt;
   const auto* last = find<std::int64_t>(*whole, "lastGeneration");
   const auto* list = find<platform::List>(*whole, "alarms");
-  if (!last || !list) return std::nullopt;
+  // Half of the range is more registrations than will ever be made, and leaves room to count on.
+  constexpr std::int64_t greatest = std::int64_t{1} << 62;
+  if (!last || !list || *last > greatest) return std::nullopt;
   Alarms alarms;
   alarms.lastGeneration = *last;
   for (const platform::Value& element : *list) {

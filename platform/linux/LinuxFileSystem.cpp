@@ -247,7 +247,7 @@ Result<std::vector<std::string>> LinuxFileSystem::list(const std::string& folder
 }
 
 Result<std::unique_ptr<FileLock>> LinuxFileSystem::lock(const std::string& path) {
-  UniqueDescriptor descriptor = openDescriptor(path, O_RDONLY | O_CREAT);
+  UniqueDescriptor descriptor = openDescriptor(path, O_RDONLY | O_CREAT | O_NONBLOCK);
   if (!descriptor) return lastError();
   if (retried([&] { return ::flock(descriptor.get(), LOCK_EX); }) < 0) return lastError();
   return std::unique_ptr<FileLock>(std::make_unique<LinuxFileLock>(std::move(descriptor)));

@@ -254,7 +254,8 @@ void LinuxPlatform::finish(int status) {
     listener->drain([drained] { drained->set_value(); });
     drained->get_future().wait_until(deadline);
   }
-  if (auto* pool = services->pool.ifMade()) (*pool)->waitUntilIdle(deadline);
+  if (auto* pool = services->pool.ifMade(); pool && !(*pool)->waitUntilIdle(deadline))
+    hearthLog("platform").error("the time to end is up, and work is left undone");
   // What was handed to the link before this leaves before it.
   if (services->io.ifMade()) {
     const auto left = std::make_shared<std::promise<void>>();
