@@ -74,5 +74,23 @@ TEST(BusHandshakeTest, AnswersAreTheSameInWhateverPiecesItComes) {
   }
 }
 
+// Little-endian, but for `order`.
+std::string header(std::uint32_t body, std::uint32_t fields, char order = 'l') {
+  std::string bytes{order, 1, 0, 1};
+  for (const std::uint32_t number : {body, 7u, fields}) {
+    for (unsigned index = 0; index < 4; ++index)
+      bytes += static_cast<char>(number >> 8 * (order == 'l' ? index : 3 - index));
+  }
+  return bytes;
+}
+
+TEST(BusMessageLengthTest, IsKnownFromTheFixedHeaderAlone) {
+  EXPECT_EQ(busMessageLength(header(0, 0).substr(0, 15), 1024).value(), std::nullopt);
+  EXPECT_EQ(busMessageLength(header(3, 9), 1024).value(), 35u) << "fields are padded, a body is not";
+  EXPECT_EQ(busMessageLength(header(984, 24, 'B') + "more", 1024).value(), 1024u) << "the limit";
+  for (const std::string& large : {header(985, 24), header(0xffffffff, 0), header(0xffffffff, 0xfffffff9)})
+    EXPECT_EQ(busMessageLength(large, 1024).error(), Outcome::tooLarge);
+}
+
 }  // namespace
 }  // namespace platform::linux_
