@@ -54,6 +54,22 @@ struct Value {
   Storage storage;
 };
 
+// The entry of `key`, or nullptr; the second, only one of that alternative.
+inline const Value* find(const Dictionary& dictionary, std::string_view key) {
+  const auto found = dictionary.find(key);
+  return found == dictionary.end() ? nullptr : &found->second;
+}
+template <class T>
+const T* find(const Dictionary& dictionary, std::string_view key) {
+  const Value* value = find(dictionary, key);
+  return value ? value->as<T>() : nullptr;
+}
+// A copy of it.
+inline std::optional<Value> valueOf(const Dictionary& dictionary, std::string_view key) {
+  const Value* value = find(dictionary, key);
+  return value ? std::optional(*value) : std::nullopt;
+}
+
 // Numbers and booleans convert where that is exact (0 and 1, 5 and 5.0); everything else is absent.
 std::optional<bool> toBool(const Value& value);
 std::optional<std::int64_t> toInteger(const Value& value);

@@ -14,17 +14,6 @@ Time due(platform::Date date) { return Time(static_cast<double>(date.nanoseconds
 
 void lower(std::optional<Time>& least, Time time) { least = least ? std::min(*least, time) : time; }
 
-const platform::Value* find(const platform::Dictionary& dictionary, std::string_view key) {
-  const auto found = dictionary.find(key);
-  return found == dictionary.end() ? nullptr : &found->second;
-}
-
-template <class T>
-const T* find(const platform::Dictionary& dictionary, std::string_view key) {
-  const platform::Value* value = find(dictionary, key);
-  return value ? value->as<T>() : nullptr;
-}
-
 }  // namespace
 
 std::int64_t Alarms::set(const EventKey& key, platform::Date date) {
@@ -114,8 +103,8 @@ platform::Value Alarms::toValue() const {
 std::optional<Alarms> Alarms::fromValue(const platform::Value& value) {
   const auto* whole = value.as<platform::Dictionary>();
   if (!whole) return std::nullopt;
-  const auto* last = find<std::int64_t>(*whole, "lastGeneration");
-  const auto* list = find<platform::List>(*whole, "alarms");
+  const auto* last = platform::find<std::int64_t>(*whole, "lastGeneration");
+  const auto* list = platform::find<platform::List>(*whole, "alarms");
   // Half of the range is more registrations than will ever be made, and leaves room to count on.
   constexpr std::int64_t greatest = std::int64_t{1} << 62;
   if (!last || !list || *last > greatest) return std::nullopt;
@@ -124,11 +113,11 @@ std::optional<Alarms> Alarms::fromValue(const platform::Value& value) {
   for (const platform::Value& element : *list) {
     const auto* entry = element.as<platform::Dictionary>();
     if (!entry) return std::nullopt;
-    const auto* job = find<std::string>(*entry, "job");
-    const auto* stream = find<std::string>(*entry, "stream");
-    const auto* name = find<std::string>(*entry, "name");
-    const auto* date = find<platform::Date>(*entry, "date");
-    const auto* generation = find<std::int64_t>(*entry, "generation");
+    const auto* job = platform::find<std::string>(*entry, "job");
+    const auto* stream = platform::find<std::string>(*entry, "stream");
+    const auto* name = platform::find<std::string>(*entry, "name");
+    const auto* date = platform::find<platform::Date>(*entry, "date");
+    const auto* generation = platform::find<std::int64_t>(*entry, "generation");
     if (!job || !stream || !name || !date || !generation || *generation > *last) return std::nullopt;
     alarms.entries[{*job, *stream, *name}] = Entry{*date, *generation, std::nullopt, false};
   }

@@ -13,20 +13,15 @@ namespace {
 using platform::CloudStore;
 using ChangeReason = CloudStore::ChangeReason;
 
-std::optional<platform::Value> entry(const platform::Dictionary& userInfo, std::string_view key) {
-  const auto found = userInfo.find(key);
-  return found == userInfo.end() ? std::nullopt : std::optional(found->second);
-}
-
 std::optional<std::vector<std::string>> changedKeys(const platform::Dictionary& userInfo) {
-  const auto value = entry(userInfo, CloudStore::changedKeysKey);
+  const auto value = platform::valueOf(userInfo, CloudStore::changedKeysKey);
   return value ? platform::toTexts(*value) : std::nullopt;
 }
 
 // Missing or no integer, it is one of those that are ignored: whoever posted it has not said that values
 // changed.
 bool reportsValues(const platform::Dictionary& userInfo) {
-  const auto value = entry(userInfo, CloudStore::changeReasonKey);
+  const auto value = platform::valueOf(userInfo, CloudStore::changeReasonKey);
   const auto reason = value ? platform::toInteger(*value) : std::nullopt;
   return reason && *reason >= static_cast<int>(ChangeReason::serverChange) &&
          *reason <= static_cast<int>(ChangeReason::accountChange) &&

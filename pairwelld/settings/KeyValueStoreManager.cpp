@@ -67,8 +67,7 @@ std::optional<platform::Value> KeyValueStoreManager::readRoot(std::string_view f
     Log::kvs().error(format, name, [&] { return values.error().message(); });
     return std::nullopt;
   }
-  const auto found = values->find(name);
-  return found == values->end() ? std::nullopt : std::optional(found->second);
+  return platform::valueOf(*values, name);
 }
 
 void KeyValueStoreManager::setValue(KeyValueSource source, const std::optional<platform::Value>& value,

@@ -18,8 +18,7 @@ class BusClientConnection : public ClientConnection, public BusHandler {
   std::int32_t processIdentifier() const override { return peer.pid; }
   std::optional<Value> valueForEntitlement(std::string_view name) override {
     if (!entitlements) entitlements = source.of(peer);
-    const auto found = entitlements->find(name);
-    return found == entitlements->end() ? std::nullopt : std::optional(found->second);
+    return valueOf(*entitlements, name);
   }
   void setExportedInterface(std::shared_ptr<const InterfaceDescription> exported) override {
     description = std::move(exported);

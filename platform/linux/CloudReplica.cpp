@@ -13,8 +13,7 @@ namespace {
 constexpr std::int64_t greatestStamp = std::int64_t{1} << 61;
 
 std::optional<std::int64_t> stampPart(const Dictionary& entry, std::string_view name) {
-  const auto found = entry.find(name);
-  const auto* number = found == entry.end() ? nullptr : found->second.as<std::int64_t>();
+  const auto* number = platform::find<std::int64_t>(entry, name);
   return number && *number >= 0 && *number <= greatestStamp ? std::optional(*number) : std::nullopt;
 }
 
@@ -48,8 +47,8 @@ std::optional<std::string> passedCompanion(const Dictionary& entries, const Clou
 }
 
 std::optional<std::int64_t> number(const Dictionary& document, std::string_view name) {
-  const auto found = document.find(name);
-  return found == document.end() ? std::nullopt : toInteger(found->second);
+  const Value* found = platform::find(document, name);
+  return found ? toInteger(*found) : std::nullopt;
 }
 
 // A reason counts once: when its sequence number is new.
@@ -67,21 +66,16 @@ std::optional<CloudEntry> CloudEntry::fromValue(const Value& value) {
   if (!fields) return std::nullopt;
   const auto microseconds = stampPart(*fields, "time");
   const auto tick = stampPart(*fields, "tick");
-  const auto device = fields->find("device");
-  const auto stored = fields->find("value");
-  const auto removed = fields->find("removed");
-  const bool isRemoved = removed != fields->end() && removed->second == Value(true);
-  if (!microseconds || !tick || device == fields->end() || !device->second.as<std::string>())
-    return std::nullopt;
-  if (isRemoved == (stored != fields->end())) return std::nullopt;
-  return CloudEntry{isRemoved ? std::nullopt : std::optional(stored->second),
-                    {*microseconds, *tick},
-                    *device->second.as<std::string>()};
+  const auto* device = platform::find<std::string>(*fields, "device");
+  const auto stored = valueOf(*fields, "value");
+  const bool isRemoved = valueOf(*fields, "removed") == Value(true);
+  if (!microseconds || !tick || !device || isRemoved == stored.has_value()) return std::nullopt;
+  return CloudEntry{stored, {*microseconds, *tick}, *device};
 }
 
 std::optional<CloudEntry> CloudEntry::find(const Dictionary& entries, std::string_view key) {
-  const auto found = entries.find(key);
-  return found == entries.end() ? std::nullopt : fromValue(found->second);
+  const Value* found = platform::find(entries, key);
+  return found ? fromValue(*found) : std::nullopt;
 }
 
 Value CloudEntry::toValue() const {

@@ -30,8 +30,7 @@ DeviceFile::DeviceFile(FileSystem& files_, std::string path_) : files(files_), p
 std::optional<Value> DeviceFile::entry(std::string_view key) {
   std::lock_guard lock(mutex);
   refresh();
-  const auto found = entries.find(key);
-  return found == entries.end() ? std::nullopt : std::optional(found->second);
+  return valueOf(entries, key);
 }
 
 void DeviceFile::refresh() {

@@ -53,11 +53,10 @@ std::string writableByOthers(const fs::path& path, int links = 0) {
 // An identifier below the one that stands for none.
 template <class Identifier>
 bool readIdentifier(const Dictionary& fields, const char* name, std::optional<Identifier>& identifier) {
-  const auto found = fields.find(name);
-  if (found == fields.end()) return true;
-  const auto number = toInteger(found->second);
-  if (!number || found->second.as<bool>() || *number < 0 || *number >= static_cast<Identifier>(-1))
-    return false;
+  const Value* found = find(fields, name);
+  if (!found) return true;
+  const auto number = toInteger(*found);
+  if (!number || found->as<bool>() || *number < 0 || *number >= static_cast<Identifier>(-1)) return false;
   identifier = static_cast<Identifier>(*number);
   return true;
 }
@@ -65,15 +64,13 @@ bool readIdentifier(const Dictionary& fields, const char* name, std::optional<Id
 std::string readFields(const Value& value, const std::string& root, EntitlementGrant& grant) {
   const auto* fields = value.as<Dictionary>();
   if (!fields) return "not an object";
-  const auto executable = fields->find("executable");
-  const auto* path = executable == fields->end() ? nullptr : executable->second.as<std::string>();
+  const auto* path = find<std::string>(*fields, "executable");
   if (!path || path->empty()) return "\"executable\" is not the path of a program";
   grant.executable = fs::path(*path).is_absolute() || root.empty() ? *path : root + "/" + *path;
   if (!fs::path(grant.executable).is_absolute()) return "\"executable\" is not an absolute path";
   if (!readIdentifier(*fields, "uid", grant.user)) return "\"uid\" is not a user's number";
   if (!readIdentifier(*fields, "gid", grant.group)) return "\"gid\" is not a group's number";
-  const auto entitlements = fields->find("entitlements");
-  const auto* granted = entitlements == fields->end() ? nullptr : entitlements->second.as<Dictionary>();
+  const auto* granted = find<Dictionary>(*fields, "entitlements");
   if (!granted) return "\"entitlements\" is not an object";
   grant.entitlements = *granted;
   return "";

@@ -34,7 +34,7 @@ std::optional<std::string> osRelease(FileSystem& files, const std::string& name)
   if (!text) text = readFile(files, "/usr/lib/os-release", sizeLimit);
   std::istringstream lines(text ? *text : "");
   for (std::string entry; std::getline(lines, entry);) {
-    if (entry.rfind(name + "=", 0) == 0) return unquoted(entry.substr(name.size() + 1));
+    if (entry.starts_with(name + "=")) return unquoted(entry.substr(name.size() + 1));
   }
   return std::nullopt;
 }
@@ -58,14 +58,13 @@ std::optional<Value> FileDeviceProperties::copyAnswerWithError(std::string_view 
   if (!entry) return machineAnswer(key);
   const auto* fields = entry->as<Dictionary>();
   if (!fields) return entry;
-  if (const auto code = fields->find("error"); code != fields->end()) {
+  if (const Value* code = find(*fields, "error")) {
     using Limits = std::numeric_limits<std::int32_t>;
-    const auto number = toInteger(code->second);
+    const auto number = toInteger(*code);
     if (number)
       error = static_cast<std::int32_t>(std::clamp<std::int64_t>(*number, Limits::min(), Limits::max()));
   }
-  const auto value = fields->find("value");
-  return value == fields->end() ? std::nullopt : std::optional(value->second);
+  return valueOf(*fields, "value");
 }
 
 int FileDeviceProperties::isInternalBuild() {

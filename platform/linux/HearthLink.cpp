@@ -244,8 +244,7 @@ void HearthLink::setHandler(std::string_view stream, std::shared_ptr<WorkQueue> 
 void HearthLink::setEvent(std::string_view stream, std::string_view name,
                           const std::optional<Dictionary>& descriptor) {
   if (!descriptor) return state->setEvent(std::string(stream), std::string(name), std::nullopt);
-  const auto entry = descriptor->find("Date");
-  const Date* date = entry == descriptor->end() ? nullptr : entry->second.as<Date>();
+  const Date* date = find<Date>(*descriptor, "Date");
   if (!date) {
     hearthLog("link").error("event %s of %s refused: no usable date in %s", name, stream,
                             [&] { return describe(*descriptor); });

@@ -83,8 +83,7 @@ Result<Dictionary> decodeEditedSettings(std::string_view text, std::string& prob
 
 const Dictionary& settingsValues(const Dictionary& document) {
   static const Dictionary none;
-  const auto found = document.find(valuesEntry);
-  const auto* values = found == document.end() ? nullptr : found->second.as<Dictionary>();
+  const auto* values = find<Dictionary>(document, valuesEntry);
   return values ? *values : none;
 }
 

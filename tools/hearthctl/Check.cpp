@@ -34,20 +34,14 @@ const std::string daemonJob = "com.kestrel.pairwelld";
 const std::string flagKey(platform::rawValue(Defaults::velaLogCloudCollectionEnabled));
 const std::string endKey(platform::rawValue(Defaults::velaLogCloudCollectionEnabledExpiration));
 
-template <class T>
-const T* field(const Dictionary& dictionary, std::string_view key) {
-  const auto found = dictionary.find(key);
-  return found == dictionary.end() ? nullptr : found->second.as<T>();
-}
-
 bool flagIn(const Dictionary& values) {
-  const auto flag = values.find(flagKey);
-  return flag != values.end() && platform::toBool(flag->second).value_or(false);
+  const Value* flag = platform::find(values, flagKey);
+  return flag && platform::toBool(*flag).value_or(false);
 }
 
 std::optional<double> endIn(const Dictionary& values) {
-  const auto found = values.find(endKey);
-  const auto end = found == values.end() ? std::nullopt : platform::toDouble(found->second);
+  const Value* found = platform::find(values, endKey);
+  const auto end = found ? platform::toDouble(*found) : std::nullopt;
   return end && isEnd(*end) ? end : std::nullopt;
 }
 
@@ -156,14 +150,14 @@ std::vector<Alarm> Look::alarmsFromFile() {
   const std::string path = paths.hearthd() + "/alarms.json";
   say("hearthd does not run; the alarms are those of " + path);
   const Dictionary whole = readObject(path, "mend it before hearthd starts, which would move it aside");
-  const auto* list = field<List>(whole, "alarms");
+  const auto* list = platform::find<List>(whole, "alarms");
   if (!list && !whole.empty()) add(path + ": not a list of alarms", "delete it");
   std::vector<Alarm> alarms;
   for (const Value& value : list ? *list : List()) {
     const auto* entry = value.as<Dictionary>();
-    const auto* date = entry ? field<platform::Date>(*entry, "date") : nullptr;
+    const auto* date = entry ? platform::find<platform::Date>(*entry, "date") : nullptr;
     const auto text = [&](const char* key) {
-      const auto* found = field<std::string>(*entry, key);
+      const auto* found = platform::find<std::string>(*entry, key);
       return found ? *found : "";
     };
     if (!date) continue;
