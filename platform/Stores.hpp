@@ -25,15 +25,28 @@ class KeyValueStore {
  public:
   virtual ~KeyValueStore() = default;
 
-  virtual bool boolForKey(std::string_view key) = 0;
-  virtual double doubleForKey(std::string_view key) = 0;
-  virtual std::optional<std::string> textForKey(std::string_view key) = 0;
+  bool boolForKey(std::string_view key) {
+    const auto value = read(key);
+    return value && toBool(*value).value_or(false);
+  }
+  double doubleForKey(std::string_view key) {
+    const auto value = read(key);
+    return value ? toDouble(*value).value_or(0.0) : 0.0;
+  }
+  std::optional<std::string> textForKey(std::string_view key) {
+    const auto value = read(key);
+    return value ? toText(*value) : std::nullopt;
+  }
   // No value removes the key. Failures are logged by the store; what was stored before then stays.
   virtual void setValue(const std::optional<Value>& value, std::string_view key) = 0;
 
   // Observers are held weakly. Removing what is not there is harmless.
   virtual void addObserver(std::weak_ptr<KeyObserver> observer, std::string_view key) = 0;
   virtual void removeObserver(const KeyObserver* observer, std::string_view key) = 0;
+
+ private:
+  // What is stored; the typed reads convert it.
+  virtual std::optional<Value> read(std::string_view key) = 0;
 };
 
 // The process's own preferences. An own write calls the key's observers on the writer's thread before it

@@ -26,26 +26,9 @@ std::shared_ptr<FileUserPreferences> FileUserPreferences::create(FileSystem& fil
 FileUserPreferences::FileUserPreferences(FileSystem& files, std::string path)
     : file(SettingsFile::create(files, std::move(path))) {}
 
-std::optional<Value> FileUserPreferences::value(std::string_view key) {
+std::optional<Value> FileUserPreferences::read(std::string_view key) {
   const auto document = file->contents();
-  const Dictionary& values = settingsValues(*document);
-  const auto found = values.find(key);
-  return found == values.end() ? std::nullopt : std::optional(found->second);
-}
-
-bool FileUserPreferences::boolForKey(std::string_view key) {
-  const auto found = value(key);
-  return found && toBool(*found).value_or(false);
-}
-
-double FileUserPreferences::doubleForKey(std::string_view key) {
-  const auto found = value(key);
-  return found ? toDouble(*found).value_or(0.0) : 0.0;
-}
-
-std::optional<std::string> FileUserPreferences::textForKey(std::string_view key) {
-  const auto found = value(key);
-  return found ? toText(*found) : std::nullopt;
+  return valueOf(settingsValues(*document), key);
 }
 
 void FileUserPreferences::setValue(const std::optional<Value>& value, std::string_view key) {

@@ -20,9 +20,6 @@ class FileUserPreferences : public UserPreferences, public std::enable_shared_fr
   static std::shared_ptr<FileUserPreferences> create(FileSystem& files, WorkQueue* delivery,
                                                      std::string path);
 
-  bool boolForKey(std::string_view key) override;
-  double doubleForKey(std::string_view key) override;
-  std::optional<std::string> textForKey(std::string_view key) override;
   void setValue(const std::optional<Value>& value, std::string_view key) override;
   void addObserver(std::weak_ptr<KeyObserver> observer, std::string_view key) override;
   void removeObserver(const KeyObserver* observer, std::string_view key) override;
@@ -35,7 +32,7 @@ class FileUserPreferences : public UserPreferences, public std::enable_shared_fr
   };
 
   FileUserPreferences(FileSystem& files, std::string path);
-  std::optional<Value> value(std::string_view key);
+  std::optional<Value> read(std::string_view key) override;
   // Calls the key's observers, no lock held.
   void report(const std::string& key);
   bool isRegistered(const KeyObserver* observer, std::string_view key);

@@ -46,21 +46,6 @@ std::optional<Value> ReplicaFileCloudStore::read(std::string_view key) {
   return value;
 }
 
-bool ReplicaFileCloudStore::boolForKey(std::string_view key) {
-  const auto found = read(key);
-  return found && toBool(*found).value_or(false);
-}
-
-double ReplicaFileCloudStore::doubleForKey(std::string_view key) {
-  const auto found = read(key);
-  return found ? toDouble(*found).value_or(0.0) : 0.0;
-}
-
-std::optional<std::string> ReplicaFileCloudStore::textForKey(std::string_view key) {
-  const auto found = read(key);
-  return found ? toText(*found) : std::nullopt;
-}
-
 void ReplicaFileCloudStore::setValue(const std::optional<Value>& value, std::string_view key) {
   if (const auto written = write(value, key); !written) {
     hearthLog("files").error("cloud store: %s cannot be stored: %s", key, written.error().message());
@@ -97,9 +82,7 @@ Result<void> ReplicaFileCloudStore::replaceValues(const Dictionary& values) {
     CloudBursts own;
     bool changed = false;
     for (const std::string& key : differingKeys(cloudValues(entries), values)) {
-      const auto found = values.find(key);
-      const auto value = found == values.end() ? std::nullopt : std::optional(found->second);
-      changed |= own.write(entries, {key, value, std::nullopt, clock.now(), device});
+      changed |= own.write(entries, {key, valueOf(values, key), std::nullopt, clock.now(), device});
     }
     return changed;
   });

@@ -26,9 +26,6 @@ class ReplicaFileCloudStore : public CloudStore, public std::enable_shared_from_
                                                        NotificationCentre& centre, Clock& clock,
                                                        std::string path);
 
-  bool boolForKey(std::string_view key) override;
-  double doubleForKey(std::string_view key) override;
-  std::optional<std::string> textForKey(std::string_view key) override;
   void setValue(const std::optional<Value>& value, std::string_view key) override;
   // Key observation does not exist here.
   void addObserver(std::weak_ptr<KeyObserver>, std::string_view) override {}
@@ -45,7 +42,7 @@ class ReplicaFileCloudStore : public CloudStore, public std::enable_shared_from_
  private:
   ReplicaFileCloudStore(FileSystem& files, NotificationCentre& centre, Clock& clock, std::string path);
   // A typed read: an equal write that follows is an echo.
-  std::optional<Value> read(std::string_view key);
+  std::optional<Value> read(std::string_view key) override;
   void report(const CloudReport& report);
 
   NotificationCentre& centre;

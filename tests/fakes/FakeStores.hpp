@@ -18,9 +18,6 @@ class FakeKeyValueStore : public Interface {
   FakeKeyValueStore(std::string name_, Effects& effects_, std::shared_ptr<ManualPool> delivery_)
       : delivery(std::move(delivery_)), effects(effects_), name(std::move(name_)) {}
 
-  bool boolForKey(std::string_view key) override { return converted(key, toBool).value_or(false); }
-  double doubleForKey(std::string_view key) override { return converted(key, toDouble).value_or(0.0); }
-  std::optional<std::string> textForKey(std::string_view key) override { return converted(key, toText); }
   void setValue(const std::optional<Value>& value, std::string_view key) override {
     if (!failing) store(key, value);
     effects.record(Effects::store,
@@ -42,8 +39,7 @@ class FakeKeyValueStore : public Interface {
   }
   std::optional<Value> value(std::string_view key) const {
     std::lock_guard lock(mutex);
-    const auto found = contents.find(key);
-    return found == contents.end() ? std::nullopt : std::optional(found->second);
+    return valueOf(contents, key);
   }
 
   struct Observation {
@@ -59,11 +55,10 @@ class FakeKeyValueStore : public Interface {
   const std::shared_ptr<ManualPool> delivery;
 
  private:
-  template <class Convert>
-  auto converted(std::string_view key, Convert convert) {
+  std::optional<Value> read(std::string_view key) override {
     const auto found = value(key);
     effects.moment();
-    return found ? convert(*found) : std::nullopt;
+    return found;
   }
 
   Effects& effects;
