@@ -67,7 +67,7 @@ void Job::tryToStart() {
 void Job::launchWith(UniqueDescriptor life) {
   int ends[2];
   if (::socketpair(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC | SOCK_NONBLOCK, 0, ends) < 0) {
-    return startLater({}, std::error_code(errno, std::system_category()).message());
+    return startLater({}, platform::linux_::lastError().message());
   }
   UniqueDescriptor own(ends[0]);
   const UniqueDescriptor theirs(ends[1]);

@@ -97,7 +97,7 @@ void placeDescriptors(std::vector<int>& descriptors, int report) {
   fail(report);
 }
 
-std::error_code lastError() { return {errno, std::system_category()}; }
+using platform::linux_::lastError;
 
 }  // namespace
 

@@ -42,10 +42,10 @@ bool holds(const fs::path& process, const struct stat& file) {
 
 platform::Result<UniqueDescriptor> takeLock(const std::string& path) {
   UniqueDescriptor file(::open(path.c_str(), O_RDONLY | O_CREAT | O_CLOEXEC | O_NONBLOCK, 0600));
-  if (!file) return std::error_code(errno, std::system_category());
+  if (!file) return platform::linux_::lastError();
   if (::flock(file.get(), LOCK_EX | LOCK_NB) == 0) return file;
   if (errno == EWOULDBLOCK) return UniqueDescriptor();
-  return std::error_code(errno, std::system_category());
+  return platform::linux_::lastError();
 }
 
 std::vector<UniqueDescriptor> endHolders(const std::string& path) {

@@ -12,7 +12,7 @@
 namespace hearth {
 
 platform::Result<platform::linux_::UniqueDescriptor> listenAt(const std::string& path) {
-  const auto lastError = [] { return std::error_code(errno, std::system_category()); };
+  using platform::linux_::lastError;
   sockaddr_un address{};
   address.sun_family = AF_UNIX;
   if (path.size() >= sizeof address.sun_path) return std::make_error_code(std::errc::filename_too_long);

@@ -2,7 +2,6 @@
 #include <fcntl.h>
 #include <poll.h>
 #include <signal.h>
-#include <sys/resource.h>
 #include <sys/stat.h>
 #include <systemd/sd-daemon.h>
 #include <unistd.h>
@@ -20,6 +19,7 @@
 #include "platform/linux/EventLoop.hpp"
 #include "platform/linux/LinuxFileSystem.hpp"
 #include "platform/linux/Paths.hpp"
+#include "platform/linux/ProcessSetup.hpp"
 #include "platform/linux/UnifiedLog.hpp"
 
 namespace {
@@ -66,17 +66,8 @@ void openStandardDescriptors() {
 void prepareProcess() {
   openStandardDescriptors();
   ::umask(022);
-  ::signal(SIGPIPE, SIG_IGN);
-  sigset_t watched;
-  sigemptyset(&watched);
-  for (const int signal : {SIGTERM, SIGINT}) sigaddset(&watched, signal);
-  ::sigprocmask(SIG_BLOCK, &watched, nullptr);
-  // A client costs a descriptor, and the usual limit is lower than the clients that are let in.
-  rlimit files{};
-  if (::getrlimit(RLIMIT_NOFILE, &files) == 0) {
-    files.rlim_cur = files.rlim_max;
-    ::setrlimit(RLIMIT_NOFILE, &files);
-  }
+  platform::linux_::prepareSignals();
+  platform::linux_::raiseDescriptorLimit();
 }
 
 // The lock that says that a hearthd lives on this root.

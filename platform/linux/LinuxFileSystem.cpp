@@ -19,8 +19,6 @@
 namespace platform::linux_ {
 namespace {
 
-std::error_code lastError() { return {errno, std::system_category()}; }
-
 Result<void> answer(int result) {
   if (result < 0) return lastError();
   return {};

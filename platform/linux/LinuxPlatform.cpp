@@ -1,7 +1,6 @@
 #include "platform/linux/LinuxPlatform.hpp"
 
 #include <signal.h>
-#include <sys/resource.h>
 #include <unistd.h>
 
 #include <chrono>
@@ -25,6 +24,7 @@
 #include "platform/linux/LinuxEnvironment.hpp"
 #include "platform/linux/LinuxFileSystem.hpp"
 #include "platform/linux/Paths.hpp"
+#include "platform/linux/ProcessSetup.hpp"
 #include "platform/linux/ReplicaFileCloudStore.hpp"
 #include "platform/linux/ThreadPool.hpp"
 #include "platform/linux/UnifiedLog.hpp"
@@ -42,14 +42,6 @@ constexpr std::chrono::seconds patience{2};
 std::string rootFromEnvironment() {
   const char* root = std::getenv("HEARTH_ROOT");
   return root ? root : "";
-}
-
-// A client costs a few descriptors, and the usual limit is lower than the clients that are let in.
-void raiseDescriptorLimit() {
-  rlimit limit{};
-  if (::getrlimit(RLIMIT_NOFILE, &limit) != 0) return;
-  limit.rlim_cur = limit.rlim_max;
-  ::setrlimit(RLIMIT_NOFILE, &limit);
 }
 
 // Made on first use, by any thread.
@@ -168,13 +160,7 @@ struct LinuxPlatform::Services {
   std::vector<std::shared_ptr<BusServiceListener>> listeners;  // guarded by `mutex`
 };
 
-LinuxPlatform::LinuxPlatform() : services(std::make_unique<Services>()) {
-  sigset_t ending;
-  sigemptyset(&ending);
-  for (const int signal : {SIGTERM, SIGINT}) sigaddset(&ending, signal);
-  ::pthread_sigmask(SIG_BLOCK, &ending, nullptr);
-  ::signal(SIGPIPE, SIG_IGN);
-}
+LinuxPlatform::LinuxPlatform() : services(std::make_unique<Services>()) { prepareSignals(); }
 
 LinuxPlatform::~LinuxPlatform() = default;
 

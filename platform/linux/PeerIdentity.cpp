@@ -36,10 +36,10 @@ UniqueDescriptor openProcess(int socket, pid_t pid, int pidfdOption) {
 Result<PeerIdentity::Executable> executableOf(pid_t pid) {
   const std::string path = "/proc/" + std::to_string(pid);
   const UniqueDescriptor folder(::open(path.c_str(), O_PATH | O_DIRECTORY | O_CLOEXEC));
-  if (!folder) return std::error_code(errno, std::system_category());
+  if (!folder) return lastError();
   const UniqueDescriptor file(::openat(folder.get(), "exe", O_PATH | O_CLOEXEC));
   struct stat place {};
-  if (!file || ::fstat(file.get(), &place) != 0) return std::error_code(errno, std::system_category());
+  if (!file || ::fstat(file.get(), &place) != 0) return lastError();
   return PeerIdentity::Executable{place.st_dev, place.st_ino};
 }
 

@@ -3,9 +3,14 @@
 
 #include <unistd.h>
 
+#include <cerrno>
+#include <system_error>
 #include <utility>
 
 namespace platform::linux_ {
+
+// What the last system call of this thread failed with.
+inline std::error_code lastError() { return {errno, std::system_category()}; }
 
 class UniqueDescriptor {
  public:
