@@ -23,7 +23,9 @@ AlarmFile::AlarmFile(platform::linux_::FileSystem& files_, const std::string& fo
 Alarms AlarmFile::load() {
   const auto bytes = platform::linux_::readFile(files, path, fileLimit);
   if (!bytes) {
-    if (bytes.error() != std::errc::no_such_file_or_directory) moveAside(bytes.error().message());
+    // What cannot be read now may be whole: it is left alone, and nothing is written over it.
+    damageStays = bytes.error() != std::errc::no_such_file_or_directory;
+    if (damageStays) log().error("%s: %s; no alarm can be kept", path, bytes.error().message());
     return {};
   }
   std::string problem;

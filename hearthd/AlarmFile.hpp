@@ -14,10 +14,11 @@ class AlarmFile {
   // `folder` is made when it is needed.
   AlarmFile(platform::linux_::FileSystem& files, const std::string& folder);
 
-  // A file that cannot be read is moved aside, with a line in the log: no registration may overwrite it.
+  // A damaged file is moved aside, with a line in the log; one that cannot be read stays, and nothing can be
+  // saved.
   Alarms load();
-  // Durable once it has returned without an error. Outcome::malformedFile where a damaged file could not be
-  // moved aside: it is not overwritten.
+  // Durable once it has returned without an error. Outcome::malformedFile where a file stays that
+  // must not be overwritten.
   platform::Result<void> save(const Alarms& alarms);
 
  private:

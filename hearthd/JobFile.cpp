@@ -27,7 +27,7 @@ class Reader {
 
   // Part of a file name below run/.
   std::string fileName(std::string_view key, std::string name) {
-    if (name.find('/') != std::string::npos || name.rfind('.', 0) == 0) fail(key, "cannot be a file's name");
+    if (name.find('/') != std::string::npos || name.starts_with('.')) fail(key, "cannot be a file's name");
     return name;
   }
 
@@ -89,7 +89,7 @@ JobDescription readJob(const std::string& bytes, const std::string& root, std::s
   Reader reader(*fields);
   job.name = reader.fileName("name", reader.text("name"));
   job.program = reader.text("program");
-  if (job.program.rfind('/', 0) != 0) job.program = root + "/" + job.program;
+  if (!job.program.starts_with('/')) job.program = root + "/" + job.program;
   job.environment = reader.environment("environment");
   for (std::string& service : reader.texts("services")) {
     job.services.push_back(reader.fileName("services", std::move(service)));
@@ -102,8 +102,17 @@ JobDescription readJob(const std::string& bytes, const std::string& root, std::s
   return job;
 }
 
-bool endsWith(std::string_view text, std::string_view end) {
-  return text.size() >= end.size() && text.substr(text.size() - end.size()) == end;
+// What of `job` an earlier one has; empty if nothing.
+std::string conflict(const JobDescription& job, const std::vector<JobDescription>& earlier) {
+  std::set<std::string> services;
+  for (const JobDescription& other : earlier) {
+    if (other.name == job.name) return "a second job " + job.name;
+    services.insert(other.services.begin(), other.services.end());
+  }
+  for (const std::string& service : job.services) {
+    if (!services.insert(service).second) return "a second service " + service;
+  }
+  return "";
 }
 
 }  // namespace
@@ -117,9 +126,8 @@ std::vector<JobDescription> readJobs(platform::linux_::FileSystem& files, const 
     log.error("%s: %s", folder, names.error().message());
     return jobs;
   }
-  std::set<std::string> taken;
   for (const std::string& name : *names) {
-    if (!endsWith(name, ".json")) continue;
+    if (!name.ends_with(".json")) continue;
     const std::string path = folder + "/" + name;
     const auto bytes = platform::linux_::readFile(files, path, fileLimit);
     std::string problem;
@@ -129,11 +137,7 @@ std::vector<JobDescription> readJobs(platform::linux_::FileSystem& files, const 
     } else {
       problem = bytes.error().message();
     }
-    if (problem.empty() && !taken.insert("job " + job.name).second) problem = "a second job " + job.name;
-    for (const std::string& service : job.services) {
-      if (problem.empty() && !taken.insert("service " + service).second)
-        problem = "a second service " + service;
-    }
+    if (problem.empty()) problem = conflict(job, jobs);
     if (problem.empty()) {
       jobs.push_back(std::move(job));
     } else {

@@ -5,6 +5,7 @@
 
 #include <algorithm>
 #include <cstdlib>
+#include <iterator>
 #include <utility>
 
 #include "hearthd/Connection.hpp"
@@ -109,6 +110,8 @@ void ServiceManager::addJob(JobDescription description) {
 // The sockets are bound once, and stay while the job restarts: its clients wait meanwhile.
 platform::Result<void> ServiceManager::addServices(const JobDescription& description,
                                                    Job::Surroundings& surroundings) {
+  std::vector<UniqueDescriptor>
+      bound;  // closed with a job that is skipped, or its clients would wait for ever
   for (const std::string& service : description.services) {
     auto socket = listenAt(paths.serviceSocket(service));
     if (!socket) {
@@ -117,8 +120,9 @@ platform::Result<void> ServiceManager::addServices(const JobDescription& descrip
       return socket.error();
     }
     surroundings.services.push_back({service, socket->get()});
-    serviceSockets.push_back(std::move(*socket));
+    bound.push_back(std::move(*socket));
   }
+  std::move(bound.begin(), bound.end(), std::back_inserter(serviceSockets));
   return {};
 }
 
