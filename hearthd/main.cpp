@@ -29,7 +29,7 @@ using platform::linux_::UniqueDescriptor;
 constexpr int failed = 1;
 constexpr int wrongUsage = 2;
 
-// Absolute, since jobs have another working folder; empty for the system's folders.
+// Empty for the system's folders.
 std::optional<std::string> rootFromArguments(int count, char** arguments) {
   std::string root;
   if (const char* variable = std::getenv("HEARTH_ROOT")) root = variable;
@@ -37,16 +37,13 @@ std::optional<std::string> rootFromArguments(int count, char** arguments) {
     const std::string_view argument = arguments[index];
     if (argument == "--root" && index + 1 < count) {
       root = arguments[++index];
-    } else if (argument.rfind("--root=", 0) == 0) {
+    } else if (argument.starts_with("--root=")) {
       root = argument.substr(7);
     } else {
       return std::nullopt;
     }
   }
-  if (root.empty()) return root;
-  auto path = std::filesystem::absolute(root).lexically_normal().string();
-  if (path.size() > 1 && path.back() == '/') path.pop_back();
-  return path;
+  return root;
 }
 
 // Never waits: whoever holds the other end may not read.
@@ -104,9 +101,9 @@ int main(int count, char** arguments) {
     return wrongUsage;
   }
   prepareProcess();
-  platform::linux_::UnifiedLog log(!root->empty());
+  const auto paths = platform::linux_::Paths::ofArgument(*root);
+  platform::linux_::UnifiedLog log(!paths.root.empty());
   platform::installLogSink(log);
-  const auto paths = platform::linux_::Paths::under(*root);
   const auto alive = takeRoot(paths);
   if (!alive) return failed;
 

@@ -10,6 +10,8 @@ namespace platform::linux_ {
 struct Paths {
   // An empty root stands for the system's folders.
   static Paths under(const std::string& root);
+  // The same of what a person gave: made absolute, since jobs have another working folder.
+  static Paths ofArgument(const std::string& root);
 
   std::string root;  // empty for the system's
   std::string etc;   // ROOT/etc, or /etc/pairwell

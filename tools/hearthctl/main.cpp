@@ -1,6 +1,5 @@
 // hearthctl: the operator's command line.
 #include <CLI/CLI.hpp>
-#include <filesystem>
 #include <optional>
 #include <string>
 #include <vector>
@@ -97,7 +96,7 @@ Exit runSettings(const std::string& command, const Options& options, tools::Sett
 
 // `part` is the subcommand's own, or empty.
 Exit run(const std::string& command, const std::string& part, const Options& options) {
-  const auto paths = platform::linux_::Paths::under(options.root);
+  const auto paths = platform::linux_::Paths::ofArgument(options.root);
   platform::linux_::LinuxFileSystem files(nullptr);
   tools::Hearth hearth(paths);
   tools::Output output(options.json);
@@ -139,7 +138,6 @@ int main(int count, char** arguments) {
     return app.exit(error) == 0 ? tools::done : tools::wrongUsage;
   }
 
-  if (!options.root.empty()) options.root = std::filesystem::absolute(options.root).lexically_normal();
   if (options.root.size() > 1 && options.root.ends_with('/')) options.root.pop_back();
   tools::SayingLog log;
   platform::installLogSink(log);

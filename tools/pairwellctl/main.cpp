@@ -3,7 +3,6 @@
 #include <chrono>
 #include <cmath>
 #include <cstdint>
-#include <filesystem>
 #include <string>
 #include <utility>
 
@@ -138,8 +137,7 @@ int main(int count, char** arguments) {
     return app.exit(error) == 0 ? tools::done : tools::wrongUsage;
   }
 
-  if (!options.root.empty()) options.root = std::filesystem::absolute(options.root).lexically_normal();
-  Client client(platform::linux_::Paths::under(options.root),
+  Client client(platform::linux_::Paths::ofArgument(options.root),
                 std::chrono::milliseconds(std::llround(options.timeout * 1000)));
   return run(*app.get_subcommands().front(), client, options);
 }
