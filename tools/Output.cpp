@@ -6,7 +6,7 @@
 #include <cstdio>
 #include <ctime>
 
-#include "platform/Result.hpp"
+#include "platform/linux/HearthInterface.hpp"
 #include "platform/linux/Json.hpp"
 
 namespace tools {
@@ -56,8 +56,18 @@ void say(const std::string& text) {
   std::fprintf(stderr, "%s: %s\n", ::program_invocation_short_name, text.c_str());
 }
 
-Exit fail(const std::string& what, std::error_code error) {
-  say(what + ": " + error.message());
+platform::Result<platform::List> resultsOf(platform::Result<platform::linux_::BusReply> reply,
+                                           std::string& answer) {
+  if (!reply) return reply.error();
+  if (auto* results = std::get_if<platform::List>(&*reply)) return std::move(*results);
+  const auto& error = std::get<platform::linux_::BusError>(*reply);
+  answer = error.message.empty() ? error.name : error.message;
+  if (error.name == platform::linux_::notPermittedError) return platform::Outcome::notPermitted;
+  return std::make_error_code(std::errc::protocol_error);
+}
+
+Exit fail(const std::string& what, std::error_code error, const std::string& answer) {
+  say(what + ": " + (answer.empty() ? error.message() : answer));
   if (error == platform::Outcome::notPermitted) return refused;
   const bool isAbsent = error == platform::Outcome::notConnected || error == platform::Outcome::timedOut ||
                         error == std::errc::permission_denied;

@@ -6,7 +6,9 @@
 #include <vector>
 
 #include "platform/LogSink.hpp"
+#include "platform/Result.hpp"
 #include "platform/Value.hpp"
+#include "platform/linux/BusServer.hpp"
 
 namespace tools {
 
@@ -28,8 +30,13 @@ class Output {
 
 // One line, the program's name and the text.
 void say(const std::string& text);
-// Says what went wrong with `what`; the exit code of such an error.
-Exit fail(const std::string& what, std::error_code error);
+// Says what went wrong with `what`: what the service answered, or the error; the exit code of such an error.
+Exit fail(const std::string& what, std::error_code error, const std::string& answer = "");
+
+// The results of a call, or its error; `answer` gets what the service itself said, if the error is of that
+// kind.
+platform::Result<platform::List> resultsOf(platform::Result<platform::linux_::BusReply> reply,
+                                           std::string& answer);
 
 // Local time as 2026-01-31T23:59:59+0100; a number where no calendar has the moment.
 std::string describeTime(double secondsSince1970);

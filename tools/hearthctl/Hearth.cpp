@@ -15,7 +15,6 @@ using platform::Outcome;
 using platform::Result;
 using platform::Value;
 using platform::linux_::BusClient;
-using platform::linux_::BusError;
 using platform::linux_::HearthOperation;
 using std::chrono::milliseconds;
 
@@ -40,13 +39,7 @@ Result<List> Hearth::call(HearthOperation operation, const List& arguments) {
   }
   const auto& interface = platform::linux_::hearthInterface();
   const auto& name = interface.operations[static_cast<std::size_t>(operation)].name;
-  auto reply = client->call(interface, name, arguments, patience);
-  if (!reply) return reply.error();
-  if (auto* results = std::get_if<List>(&*reply)) return std::move(*results);
-  const auto& error = std::get<BusError>(*reply);
-  answer = error.message.empty() ? error.name : error.message;
-  if (error.name == platform::linux_::notPermittedError) return Outcome::notPermitted;
-  return std::make_error_code(std::errc::protocol_error);
+  return resultsOf(client->call(interface, name, arguments, patience), answer);
 }
 
 Exit Hearth::perform(HearthOperation operation, const List& arguments) {
@@ -114,11 +107,7 @@ void Hearth::announceRootChange() {
   if (!posted) say("the change is made, but nobody was told: " + socket + ": " + posted.error().message());
 }
 
-Exit Hearth::fail(std::error_code error) const {
-  if (answer.empty()) return tools::fail(socket, error);
-  say(socket + ": " + answer);
-  return error == Outcome::notPermitted ? refused : failed;
-}
+Exit Hearth::fail(std::error_code error) const { return tools::fail(socket, error, answer); }
 
 Exit Hearth::watch(Output& output, const std::vector<std::string>& names, std::optional<unsigned> count,
                    std::optional<double> timeout) {

@@ -16,7 +16,6 @@ namespace tools {
 namespace {
 
 using platform::linux_::BusClient;
-using platform::linux_::BusError;
 
 constexpr const char* serviceName = "com.kestrel.pairwell.conduit";
 constexpr const char* cloudIdentifier = "com.kestrel.bluetooth.cloud.settings";
@@ -29,14 +28,11 @@ Client::Client(platform::linux_::Paths paths_, std::chrono::milliseconds timeout
 
 platform::Result<platform::List> Client::call(const std::string& operation, const platform::List& arguments) {
   asked = paths.serviceSocket(serviceName);
+  answer.clear();
   auto client = BusClient::connect(asked, timeout);
   if (!client) return client.error();
-  auto reply = (*client)->call(platform::linux_::clientInterface(serviceName), operation, arguments, timeout);
-  if (!reply) return reply.error();
-  if (auto* results = std::get_if<platform::List>(&*reply)) return std::move(*results);
-  const auto& error = std::get<BusError>(*reply);
-  asked += ": " + (error.message.empty() ? error.name : error.message);
-  return std::make_error_code(std::errc::protocol_error);
+  const auto interface = platform::linux_::clientInterface(serviceName);
+  return resultsOf((*client)->call(interface, operation, arguments, timeout), answer);
 }
 
 double Client::end() const {
@@ -54,8 +50,8 @@ std::error_code Client::watch(const std::function<std::error_code()>& changed) {
   asked = paths.hearthdSocket();
   auto hearthd = BusClient::connect(asked, timeout);
   if (!hearthd) return hearthd.error();
-  const auto watched =
-      (*hearthd)->call(platform::linux_::hearthInterface(), "Watch", {settingsChanged}, timeout);
+  const auto& interface = platform::linux_::hearthInterface();
+  const auto watched = resultsOf((*hearthd)->call(interface, "Watch", {settingsChanged}, timeout), answer);
   if (!watched) return watched.error();
   for (;;) {
     const auto signal = (*hearthd)->nextSignal(std::nullopt);

@@ -27,12 +27,13 @@ class Client {
   std::error_code watch(const std::function<std::error_code()>& changed);
 
   // Says what the last question failed with.
-  Exit fail(std::error_code error) const { return tools::fail(asked, error); }
+  Exit fail(std::error_code error) const { return tools::fail(asked, error, answer); }
 
  private:
   const platform::linux_::Paths paths;
   const std::chrono::milliseconds timeout;
-  std::string asked;  // whom, and what he said if it was an error
+  std::string asked;   // whom
+  std::string answer;  // the error that he answered, if it was that
 };
 
 }  // namespace tools
