@@ -21,7 +21,7 @@ void logError(const BusReply& reply, const BusOperation& operation) {
 }  // namespace
 
 // What several threads touch. Calls are handed to the loop while `mutex` is held, so that they leave in the
-// order in which the registrations changed; nothing of others is called, or destroyed, under it.
+// order in which the registrations changed; no handler is called, or destroyed, under it.
 class HearthLink::State : public std::enable_shared_from_this<State> {
  public:
   State(EventLoop& io_, std::shared_ptr<WorkQueue> mainQueue_, std::function<void()> lost_)
@@ -67,7 +67,7 @@ class HearthLink::State : public std::enable_shared_from_this<State> {
   }
 
   void setHandler(std::string stream, std::shared_ptr<WorkQueue> queue, EventStreams::Handler handler) {
-    std::optional<StreamHandler> old;
+    StreamHandler old;
     std::lock_guard lock(mutex);
     StreamHandler& place = handlers[stream];
     old =
@@ -92,15 +92,13 @@ class HearthLink::State : public std::enable_shared_from_this<State> {
     }
   }
 
-  std::int32_t registerHandler(std::string name, std::int32_t& token, std::shared_ptr<WorkQueue> queue,
-                               NamedNotifications::Handler handler) {
+  void registerHandler(std::string name, std::int32_t& token, std::shared_ptr<WorkQueue> queue,
+                       NamedNotifications::Handler handler) {
     std::lock_guard lock(mutex);
-    const std::int32_t own = ++lastToken;
-    token = own;
-    registrations[own] =
-        std::make_shared<Registration>(Registration{name, own, std::move(queue), std::move(handler)});
+    token = ++lastToken;
+    registrations[token] =
+        std::make_shared<Registration>(Registration{name, token, std::move(queue), std::move(handler)});
     send(HearthOperation::watch, {std::move(name)});
-    return own;
   }
 
   void cancel(std::int32_t token) {
@@ -228,9 +226,7 @@ Result<std::unique_ptr<HearthLink>> HearthLink::inherit(EventLoop& io, std::shar
 
 HearthLink::HearthLink(EventLoop& io_, UniqueDescriptor socket, std::shared_ptr<WorkQueue> mainQueue_,
                        std::function<void()> lost_)
-    : io(io_),
-      mainQueue(std::move(mainQueue_)),
-      state(std::make_shared<State>(io_, mainQueue, std::move(lost_))) {
+    : mainQueue(std::move(mainQueue_)), state(std::make_shared<State>(io_, mainQueue, std::move(lost_))) {
   state->open(std::move(socket));
 }
 

@@ -56,7 +56,6 @@ class HearthLink : public EventStreams, public NamedNotifications, public NamedN
   };
   class State;
 
-  EventLoop& io;
   const std::shared_ptr<WorkQueue> mainQueue;
   const std::shared_ptr<State> state;  // shared with work on its way, which holds it weakly
   std::mutex mutex;

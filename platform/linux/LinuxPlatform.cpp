@@ -3,6 +3,7 @@
 #include <signal.h>
 #include <unistd.h>
 
+#include <atomic>
 #include <chrono>
 #include <cstdlib>
 #include <future>
@@ -50,14 +51,18 @@ class Lazy {
  public:
   template <class Make>
   T& get(Make make) {
-    std::call_once(once, [&] { value.emplace(make()); });
+    std::call_once(once, [&] {
+      value.emplace(make());
+      made = true;
+    });
     return *value;
   }
-  T* ifMade() { return value ? &*value : nullptr; }
+  T* ifMade() { return made ? &*value : nullptr; }
 
  private:
   std::once_flag once;
   std::optional<T> value;
+  std::atomic<bool> made{false};  // by a thread that may be another than who asks
 };
 
 [[noreturn]] void endWithoutLink() {

@@ -199,10 +199,11 @@ void SettingsFile::startWatching(WorkQueue& delivery_, Changed changed_) {
     return;
   }
   watch = std::move(*begun);
-  // After the watch has begun, so that no change falls between the two.
-  const Document first = contents();
+  // After the watch has begun, and what is in force by then: a change of the meantime, which look() could not
+  // report yet, is read, not told.
+  static_cast<void>(contents());
   std::lock_guard lock(mutex);
-  reported = first;
+  reported = document;
 }
 
 // Compares instead of trusting events: they merge, overflow, and come for own writes, too.
