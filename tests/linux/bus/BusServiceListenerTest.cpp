@@ -1,9 +1,11 @@
 // The client service: who is let in, how a refusal reaches a client, and how it all ends.
 #include "platform/linux/BusServiceListener.hpp"
 
-#include <gmock/gmock.h>
+#include <atomic>
+#include <thread>
 
 #include "platform/linux/BusClient.hpp"
+#include "platform/linux/EventLoop.hpp"
 #include "platform/linux/LinuxFileSystem.hpp"
 #include "platform/linux/ThreadPool.hpp"
 #include "tests/linux/bus/BusWorld.hpp"
@@ -92,8 +94,6 @@ class BusServiceListenerTest : public testing::Test, public ServiceListenerDeleg
 TEST_F(BusServiceListenerTest, TheClientsOperationsAreCalledAndItsEndIsToldOnce) {
   auto client = BusClient::connect(path, deadline);
   ASSERT_TRUE(client);
-  EXPECT_EQ(call(**client, "KestrelAudioAccessoryLimitedLogging"), "[true]");
-  EXPECT_EQ(call(**client, "SetKestrelAudioAccessoryLimitedLogging", {true}), "[]");
   EXPECT_EQ(call(**client, "GetCurrentUserGivenName"), "[[\"Ada\"]]");
   EXPECT_EQ(call(**client, "SetDistributedLoggingStatus", {1}),
             "com.kestrel.hearth.Failed: No space left on device");
@@ -146,12 +146,11 @@ TEST_F(BusServiceListenerTest, DrainingWaitsForTheAnswersThatAreLeft) {
   EXPECT_EQ(invalidated, 0);
 }
 
-TEST_F(BusServiceListenerTest, AServiceThatHangsCostsAClientItsTimeoutAndNoMore) {
+TEST(BusClientTest, AServiceThatHangsCostsAClientItsTimeoutAndNoMore) {
+  const TemporaryFolder folder;
   const std::string hanging = folder.path + "/hanging";
   const UniqueDescriptor nobodyAccepts = listenAt(hanging);
-  const auto start = std::chrono::steady_clock::now();
   EXPECT_EQ(BusClient::connect(hanging, 50ms).error(), Outcome::timedOut);
-  EXPECT_LT(std::chrono::steady_clock::now() - start, deadline);
   EXPECT_EQ(BusClient::connect(folder.path + "/none", deadline).error(), Outcome::notConnected);
 }
 

@@ -1,20 +1,12 @@
-// A server on a thread of its own, and clients that write what they like.
+// A server that has its turns while the test waits, and clients that write what they like.
 #pragma once
 
 #include <gmock/gmock.h>
 #include <gtest/gtest.h>
-#include <poll.h>
-#include <sys/epoll.h>
 
-#include <atomic>
-#include <condition_variable>
-#include <cstring>
-#include <future>
-#include <mutex>
-#include <optional>
+#include <cerrno>
 
 #include "platform/linux/BusServer.hpp"
-#include "platform/linux/EventLoop.hpp"
 #include "tests/fakes/RealFiles.hpp"
 
 namespace platform::linux_ {
@@ -27,20 +19,14 @@ inline constexpr std::uint8_t noReplyExpected = 1;
 // A client's whole handshake, as libraries send it ahead.
 inline constexpr std::string_view handshakeAhead{"\0AUTH EXTERNAL\r\nDATA\r\nBEGIN\r\n", 29};
 
+// As they stand in messages.
 inline std::string number(std::uint32_t value) {
-  std::string bytes(4, '\0');
-  std::memcpy(bytes.data(), &value, 4);
-  return bytes;
+  return {reinterpret_cast<const char*>(&value), sizeof value};
 }
-inline std::uint32_t numberAt(const std::string& bytes, std::size_t at) {
-  std::uint32_t value;
-  std::memcpy(&value, bytes.data() + at, 4);
-  return value;
-}
-inline std::size_t aligned(std::size_t at, std::size_t size) { return (at + size - 1) / size * size; }
 inline std::string text(const std::string& value) {
   return number(static_cast<std::uint32_t>(value.size())) + value + '\0';
 }
+inline std::string answerTo(std::uint32_t serial) { return std::string("\5\1u\0", 4) + number(serial); }
 
 struct CallOptions {
   std::string path = "/test";
@@ -52,9 +38,10 @@ struct CallOptions {
 // A method call with a text as its argument, written by hand: libraries refuse to make bad ones.
 inline std::string callMessage(const std::string& member, const std::string& argument,
                                const CallOptions& options = {}) {
+  const auto align = [](std::string& bytes) { bytes.resize((bytes.size() + 7) / 8 * 8); };
   std::string fields;
   const auto add = [&](char code, char type, const std::string& value) {
-    fields.resize(aligned(fields.size(), 8));
+    align(fields);
     fields += std::string{code, 1, type, 0} + value;
   };
   add(1, 'o', text(options.path));
@@ -65,103 +52,67 @@ inline std::string callMessage(const std::string& member, const std::string& arg
   std::string message{'l', 1, static_cast<char>(options.flags), 1};
   message += number(static_cast<std::uint32_t>(body.size())) + number(options.serial) +
              number(static_cast<std::uint32_t>(fields.size())) + fields;
-  message.resize(aligned(message.size(), 8));
+  align(message);
   return message + body;
 }
 
-// What came back: a return, which has no name, an error or a signal.
-struct Answer {
-  std::uint32_t serial = 0;  // of the call
-  std::string name;
-  std::string text;  // the first result
-};
+// A client's end. `meanwhile` runs while it waits, which fails the test at the deadline.
+struct Wire {
+  explicit Wire(
+      const std::string& path, std::function<void()> meanwhile_ = [] {})
+      : socket(fakes::socketAt(path, ::connect)), meanwhile(std::move(meanwhile_)) {}
 
-// A client's end. Reads give up at the deadline, which fails the test.
-class Wire {
- public:
-  explicit Wire(const std::string& path) : socket(fakes::socketAt(path, ::connect)) {
-    const timeval limit{deadline.count(), 0};
-    EXPECT_EQ(::setsockopt(socket.get(), SOL_SOCKET, SO_RCVTIMEO, &limit, sizeof limit), 0);
+  ssize_t sendSome(std::string_view bytes) {
+    return ::send(socket.get(), bytes.data(), bytes.size(), MSG_NOSIGNAL | MSG_DONTWAIT);
   }
-  int descriptor() const { return socket.get(); }
-  void close() { socket.reset(); }
-  void closeOutput() { ::shutdown(socket.get(), SHUT_WR); }
   // False once the server has closed.
   bool send(std::string_view bytes) {
-    while (!bytes.empty()) {
-      const ssize_t sent = ::send(socket.get(), bytes.data(), bytes.size(), MSG_NOSIGNAL);
-      if (sent < 0) return false;
-      bytes.remove_prefix(static_cast<std::size_t>(sent));
-    }
-    return true;
+    bool open = true;
+    EXPECT_TRUE(eventually([&] {
+      meanwhile();
+      const ssize_t sent = sendSome(bytes);
+      open = sent >= 0 || errno == EAGAIN;
+      if (sent > 0) bytes.remove_prefix(static_cast<std::size_t>(sent));
+      return bytes.empty() || !open;
+    })) << "nothing is taken";
+    return open;
+  }
+  void receive() {
+    char buffer[16384];
+    ssize_t count;
+    while ((count = ::recv(socket.get(), buffer, sizeof buffer, MSG_DONTWAIT)) > 0)
+      received.append(buffer, static_cast<std::size_t>(count));
+    ended = count == 0 || errno != EAGAIN;
+  }
+  // Whether `wanted` comes, behind what was read before.
+  bool reads(std::string_view wanted) {
+    std::size_t at = received.npos;
+    EXPECT_TRUE(eventually([&] {
+      meanwhile();
+      receive();
+      at = received.find(wanted, used);
+      return at != received.npos || ended;
+    })) << "nothing comes";
+    if (at != received.npos) used = at + wanted.size();
+    return at != received.npos;
+  }
+  std::string readToEnd() {
+    EXPECT_FALSE(reads("what never comes"));
+    return received.substr(used);
   }
   // Sends the handshake ahead, and waits to be let in.
   void shakeHands() {
     EXPECT_TRUE(send(handshakeAhead));
-    std::size_t end;
-    while ((end = received.find("OK ")) == received.npos ||
-           (end = received.find("\r\n", end)) == received.npos)
-      ASSERT_TRUE(fill(received.size() + 1));
-    received.erase(0, end + 2);
-  }
-  // Absent at the end.
-  std::optional<Answer> next() {
-    if (!fill(16)) return std::nullopt;
-    const std::size_t end = 16 + numberAt(received, 12);
-    const std::size_t body = aligned(end, 8);
-    const std::size_t size = body + numberAt(received, 4);
-    if (!fill(size)) return std::nullopt;
-    Answer answer;
-    for (std::size_t at = 16; at < end;) {
-      at = aligned(at, 8);
-      const char code = received[at], type = received[at + 2];
-      at += 4;
-      if (type == 'g') {
-        if (received[at + 1] == 's') answer.text = received.substr(body + 4, numberAt(received, body));
-        at += 2u + static_cast<unsigned char>(received[at]);
-        continue;
-      }
-      const std::uint32_t value = numberAt(received, at);
-      at += 4;
-      if (code == 5) answer.serial = value;
-      if (code == 3 || code == 4) answer.name = received.substr(at, value);
-      if (type != 'u') at += value + 1;
-    }
-    received.erase(0, size);
-    return answer;
-  }
-  std::string readToEnd() {
-    while (fill(received.size() + 1)) {
-    }
-    return std::exchange(received, "");
-  }
-  // Until both directions are closed.
-  bool waitForHangUp() {
-    pollfd entry{socket.get(), 0, 0};
-    return ::poll(&entry, 1, static_cast<int>(std::chrono::milliseconds(deadline).count())) == 1;
+    EXPECT_TRUE(reads("OK ") && reads("\r\n"));
   }
   // Whether a call is answered.
-  bool isServed() {
-    if (!send(callMessage("Echo", "served?"))) return false;
-    const auto answer = next();
-    return answer && answer->text == "served?";
-  }
-
- private:
-  // Whether at least `size` bytes are there.
-  bool fill(std::size_t size) {
-    char buffer[4096];
-    while (received.size() < size) {
-      const ssize_t count = ::recv(socket.get(), buffer, sizeof buffer, 0);
-      EXPECT_FALSE(count < 0 && errno == EAGAIN) << "nothing comes";
-      if (count <= 0) return false;
-      received.append(buffer, static_cast<std::size_t>(count));
-    }
-    return true;
-  }
+  bool isServed() { return send(callMessage("Echo", "served?")) && reads(text("served?")); }
 
   UniqueDescriptor socket;
+  std::function<void()> meanwhile;
   std::string received;
+  std::size_t used = 0;
+  bool ended = false;
 };
 
 inline UniqueDescriptor listenAt(const std::string& path) {
@@ -172,69 +123,41 @@ inline UniqueDescriptor listenAt(const std::string& path) {
 inline std::size_t openDescriptors() {
   return static_cast<std::size_t>(std::distance(std::filesystem::directory_iterator("/proc/self/fd"), {}));
 }
-inline std::size_t residentBytes() {
-  std::size_t total = 0, resident = 0;
-  std::ifstream("/proc/self/statm") >> total >> resident;
-  return resident * 4096;
-}
 
 // Operations: Echo answers at once, Hold when the test says so, Wide takes a t. Every client is admitted,
-// unless the test decides.
+// unless the test decides. All on the test's thread.
 struct World : testing::Test {
-  explicit World(limits::Patience patience = {never, never, never, never}) : hearthsOwn(listenAt(path)) {
+  explicit World(limits::Patience patience = {never, never, never, never}) {
     const BusInterface served{"/test",
                               "test.Interface",
                               {{"Echo", "s", "s"}, {"Hold", "s", "s"}, {"Wide", "t", ""}},
                               {{"Changed", "s"}, {"Other", "s"}}};
     server = std::make_unique<BusServer>(served, patience);
     server->listen(UniqueDescriptor(::dup(hearthsOwn.get())), [this](PeerIdentity, BusServer::Decide decide) {
-      std::lock_guard lock(mutex);
       if (decides) return decide(admission());
       undecided.push_back(std::move(decide));
-      changed.notify_all();
-    });
-    watch =
-        loop.watchDescriptor(server->descriptor(), EPOLLIN, [this](std::uint32_t) { server->dispatch(); });
-    thread = std::thread([this] { loop.run(); });
-  }
-  ~World() override {
-    endServer();
-    loop.stop();
-    thread.join();
-  }
-  void endServer() {
-    onLoop([this] {
-      watch = EventSource();
-      server.reset();
     });
   }
 
-  // On the loop's thread; waits for it.
-  void onLoop(const std::function<void()>& work) {
-    std::promise<void> done;
-    loop.async([&] {
-      work();
-      done.set_value();
-    });
-    done.get_future().wait();
+  void turn() {
+    if (server) server->dispatch();
   }
-  // `condition` is asked with `mutex` held.
   bool waitFor(const std::function<bool()>& condition) {
-    std::unique_lock lock(mutex);
-    return changed.wait_for(lock, deadline, condition);
+    return eventually([&] { return turn(), condition(); });
+  }
+  Wire connect() {
+    return Wire(path, [this] { turn(); });
   }
   // Admitted, and through the handshake.
   Wire client() {
-    Wire wire(path);
+    Wire wire = connect();
     wire.shakeHands();
     return wire;
   }
   // The held call of that index, with its text.
   void complete(std::size_t index) {
-    std::unique_lock lock(mutex);
     const Held call = held.at(index);
     held.erase(held.begin() + static_cast<std::ptrdiff_t>(index));
-    lock.unlock();
     call.completion(List{call.text});
   }
   BusServer::Admission admission() {
@@ -248,21 +171,16 @@ struct World : testing::Test {
   struct Handler : BusHandler {
     explicit Handler(World& world_) : world(world_) {}
     void call(std::size_t operation, List arguments, BusCompletion completion) override {
-      const auto* argument = arguments.front().as<std::string>();
-      std::lock_guard lock(world.mutex);
-      world.calls.push_back(argument ? *argument : "");
+      const auto argument = *arguments.front().as<std::string>();
+      world.calls.push_back(argument);
       if (operation == 0) completion(std::move(arguments));
-      if (operation == 1) world.held.push_back({*argument, std::move(completion)});
-      if (operation == 2) completion(List());
-      world.changed.notify_all();
+      if (operation == 1) world.held.push_back({argument, std::move(completion)});
     }
     void closed() override {
       if (connection) std::erase(world.connections, std::exchange(connection, nullptr));
-      std::lock_guard lock(world.mutex);
       ++world.closed;
-      world.changed.notify_all();
     }
-    std::shared_ptr<BusConnection> connection;  // the loop's thread's
+    std::shared_ptr<BusConnection> connection;
     World& world;
   };
 
@@ -272,21 +190,14 @@ struct World : testing::Test {
   };
   TemporaryFolder folder;
   const std::string path = folder.path + "/socket";
-  UniqueDescriptor hearthsOwn;  // as a service manager keeps the socket of its job
-
-  std::mutex mutex;  // guards everything below, up to the loop
-  std::condition_variable changed;
+  const UniqueDescriptor hearthsOwn = listenAt(path);  // as a service manager keeps the socket of its job
   std::vector<std::string> calls;
   std::vector<Held> held;
   std::vector<BusServer::Decide> undecided;
-  std::atomic<bool> decides = true;
+  bool decides = true;
   int closed = 0;
-
-  EventLoop loop;
-  std::vector<std::shared_ptr<BusConnection>> connections;  // the loop's thread's, in order of admission
+  std::vector<std::shared_ptr<BusConnection>> connections;  // in order of admission
   std::unique_ptr<BusServer> server;
-  EventSource watch;
-  std::thread thread;
 };
 
 }  // namespace platform::linux_

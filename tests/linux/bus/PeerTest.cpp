@@ -1,9 +1,6 @@
 // Who is at the other end, and what the administrator grants him.
-#include <gmock/gmock.h>
-#include <sys/socket.h>
 #include <sys/stat.h>
 #include <sys/wait.h>
-#include <unistd.h>
 
 #include "platform/linux/Entitlements.hpp"
 #include "platform/linux/LinuxFileSystem.hpp"
@@ -42,7 +39,7 @@ TEST(PeerIdentityTest, AProcessThatHasEndedHasNoExecutable) {
   const UniqueDescriptor listener = listenAt(folder.path + "/socket");
   for (const bool reaped : {false, true}) {
     const pid_t child = ::fork();
-    if (child == 0) ::_exit(Wire(folder.path + "/socket").descriptor() < 0);
+    if (child == 0) ::_exit(!fakes::socketAt(folder.path + "/socket", ::connect));
     siginfo_t ended{};
     ASSERT_EQ(::waitid(P_PID, static_cast<id_t>(child), &ended, WEXITED | (reaped ? 0 : WNOWAIT)), 0);
     const UniqueDescriptor socket(::accept(listener.get(), nullptr, nullptr));
