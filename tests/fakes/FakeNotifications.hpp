@@ -7,41 +7,10 @@
 
 namespace fakes {
 
-struct FakeNamedNotificationCentre : NamedNotificationCentre {
-  explicit FakeNamedNotificationCentre(std::shared_ptr<ManualPool> mainQueue_)
-      : mainQueue(std::move(mainQueue_)) {}
-
-  void addObserver(std::weak_ptr<void> observer, Callback callback, std::string_view name) override {
-    const void* address = observer.lock().get();
-    observers.push_back({std::move(observer), address, callback, std::string(name)});
-  }
-  void removeObserver(const void* observer, std::string_view name) override {
-    std::erase_if(observers, [&](const auto& each) { return each.address == observer && each.name == name; });
-  }
-  // One call for each observer; a call under way reaches an observer that was removed but lives.
-  void deliver(std::string_view name) {
-    for (const Observation& entry : observers) {
-      if (entry.name != name) continue;
-      mainQueue->async([entry] {
-        if (const auto observer = entry.observer.lock()) entry.callback(observer, entry.name);
-      });
-    }
-  }
-
-  struct Observation {
-    std::weak_ptr<void> observer;
-    const void* address;
-    Callback callback;
-    std::string name;
-  };
-  std::vector<Observation> observers;
-  const std::shared_ptr<ManualPool> mainQueue;
-};
-
-class FakeNamedNotifications : public NamedNotifications {
+class FakeNamedNotifications : public NamedNotifications, public NamedNotificationCentre {
  public:
-  FakeNamedNotifications(Effects& effects_, FakeNamedNotificationCentre& centre_)
-      : effects(effects_), centre(centre_) {}
+  FakeNamedNotifications(Effects& effects_, std::shared_ptr<ManualPool> mainQueue_)
+      : effects(effects_), mainQueue(std::move(mainQueue_)) {}
 
   // The common start of names is not recorded.
   void post(std::string_view name) override {
@@ -58,7 +27,6 @@ class FakeNamedNotifications : public NamedNotifications {
         if (take(token, *registration)) registration->handler(token);
       });
     }
-    centre.deliver(name);
   }
   std::uint32_t registerHandler(std::string_view name, std::int32_t& token, std::shared_ptr<WorkQueue> queue,
                                 Handler handler) override {
@@ -74,6 +42,16 @@ class FakeNamedNotifications : public NamedNotifications {
     registrations.erase(token);
   }
 
+  void addObserver(std::weak_ptr<void> observer, Callback callback, std::string_view name) override {
+    const auto call = [observer, callback, text = std::string(name)](std::int32_t) {
+      if (const auto live = observer.lock()) callback(live, text);
+    };
+    registerHandler(name, observers[{observer.lock().get(), std::string(name)}], mainQueue, call);
+  }
+  void removeObserver(const void* observer, std::string_view name) override {
+    cancel(observers[{observer, std::string(name)}]);
+  }
+
   struct Registration {
     std::string name;
     std::shared_ptr<WorkQueue> queue;
@@ -87,12 +65,13 @@ class FakeNamedNotifications : public NamedNotifications {
   bool take(std::int32_t token, Registration& registration) {
     std::lock_guard lock(mutex);
     registration.pending = false;
-    return registrations.contains(token) || registration.queue != centre.mainQueue;
+    return registrations.contains(token) || registration.queue != mainQueue;
   }
 
   Effects& effects;
-  FakeNamedNotificationCentre& centre;
-  std::mutex mutex;  // guards the registrations
+  const std::shared_ptr<ManualPool> mainQueue;
+  std::map<std::pair<const void*, std::string>, std::int32_t> observers;  // their tokens
+  std::mutex mutex;                                                       // guards the registrations
   std::int32_t lastToken = 0;
 };
 

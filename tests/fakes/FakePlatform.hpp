@@ -94,13 +94,10 @@ class FakePlatform : public platform::Platform {
   SystemControl& systemControl() override { return kernel; }
   DeviceProperties& deviceProperties() override { return device; }
   NamedNotifications& namedNotifications() override { return named; }
-  NamedNotificationCentre* namedNotificationCentre() override { return &namedCentre; }
+  NamedNotificationCentre* namedNotificationCentre() override { return &named; }
   NotificationCentre& notificationCentre() override { return centre; }
   std::shared_ptr<UserPreferences> userPreferences() override { return user; }
-  std::shared_ptr<CloudStore> makeCloudStore(std::string_view identifier, int typeCode) override {
-    cloudStoresMade.push_back(std::string(identifier) + " " + std::to_string(typeCode));
-    return cloud;
-  }
+  std::shared_ptr<CloudStore> makeCloudStore(std::string_view, int) override { return cloud; }
   RadixController& radixController() override { return radix; }
   EventStreams& eventStreams() override { return streams; }
   std::shared_ptr<ServiceListener> makeServiceListener(std::string_view) override {
@@ -118,13 +115,11 @@ class FakePlatform : public platform::Platform {
   ManualClock manualClock;
   FakeSystemControl kernel;
   FakeDeviceProperties device;
-  FakeNamedNotificationCentre namedCentre{loop.queue};
-  FakeNamedNotifications named{effects, namedCentre};
+  FakeNamedNotifications named{effects, loop.queue};
   NotificationCentre centre;
   const std::shared_ptr<FakeUserPreferences> user =
       std::make_shared<FakeUserPreferences>("user", effects, delivery);
   const std::shared_ptr<FakeCloudStore> cloud = std::make_shared<FakeCloudStore>(effects, delivery, centre);
-  std::vector<std::string> cloudStoresMade;  // "identifier typeCode"
   FakeRadixController radix{effects};
   FakeEventStreams streams{effects};
   std::vector<std::shared_ptr<FakeServiceListener>> listeners;

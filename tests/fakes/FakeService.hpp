@@ -16,8 +16,7 @@ class FakeClientConnection : public ClientConnection {
     const auto found = entitlements.find(name);
     return found == entitlements.end() ? std::nullopt : std::optional(found->second);
   }
-  void setExportedInterface(std::shared_ptr<const InterfaceDescription> description) override {
-    exportedInterface = std::move(description);
+  void setExportedInterface(std::shared_ptr<const InterfaceDescription>) override {
     effects.record(Effects::client, "exported interface");
   }
   void setExportedObject(std::shared_ptr<RadixUserControllerInterface> object) override {
@@ -28,8 +27,7 @@ class FakeClientConnection : public ClientConnection {
     invalidationHandler = std::move(handler);
     effects.record(Effects::client, "invalidation handler");
   }
-  void setRemoteObjectInterface(std::shared_ptr<const InterfaceDescription> description) override {
-    remoteInterface = std::move(description);
+  void setRemoteObjectInterface(std::shared_ptr<const InterfaceDescription>) override {
     effects.record(Effects::client, "remote interface");
   }
   void resume() override { effects.record(Effects::client, "resumed"); }
@@ -40,7 +38,6 @@ class FakeClientConnection : public ClientConnection {
     if (const auto handler = std::exchange(invalidationHandler, nullptr)) handler();
   }
 
-  std::shared_ptr<const InterfaceDescription> exportedInterface, remoteInterface;
   std::shared_ptr<RadixUserControllerInterface> exportedObject;
   std::optional<bool> admitted;
 

@@ -43,7 +43,6 @@ TEST_F(PairwellDaemonTest, LaunchesInOrderAndActivatesEverything) {
           "daemon default: Start KeyValueStoreCustomObserver", "kvs default: Cloud KVS synchronized: true",
           "kvs default: Cloud KVS snapshot: [:]", "debugManager default: Activate Debug Manager",
           "conduit default: Activate Pairwell Controller Conduit Service"));
-  EXPECT_THAT(platform.cloudStoresMade, ElementsAre("com.kestrel.bluetooth.cloud.settings 2"));
   EXPECT_EQ(platform.streams.handlers.size(), 2u);
   ASSERT_EQ(platform.listeners.size(), 1u);
   EXPECT_TRUE(platform.listeners[0]->resumed);
@@ -58,20 +57,17 @@ struct LockableInfo : SystemInfo {
 };
 
 TEST_F(PairwellDaemonTest, WaitsForTheFirstUnlockAndActivatesOnce) {
-  const std::string line = "daemon default: ", before = line + "pairwelld is before first unlock",
-                    unlocked = line + "Device first unlocked notification";
+  const std::string before = "daemon default: pairwelld is before first unlock",
+                    unlocked = "daemon default: Device first unlocked notification";
   const auto post = [this] {
     platform.named.postFromElsewhere("com.kestrel.mobile.lockvaultd.lock_status");
     run();
   };
   const auto info = std::make_shared<LockableInfo>();
-  auto waiting = std::make_shared<PairwellDaemon>();
+  const auto waiting = std::make_shared<PairwellDaemon>();
   waiting->setSystemInfo(info);
-  EXPECT_EQ(waiting->lockVaultToken, 0);
   waiting->activate();
-  EXPECT_EQ(waiting->lockVaultToken, 1);
   post();
-  EXPECT_EQ(waiting->lockVaultToken, 2);
   EXPECT_THAT(log(), ElementsAre(before, unlocked, before));
   EXPECT_EQ(platform.named.registrations.size(), 1u);
   mark();
@@ -81,72 +77,65 @@ TEST_F(PairwellDaemonTest, WaitsForTheFirstUnlockAndActivatesOnce) {
   EXPECT_EQ(waiting->lockVaultToken, -1);
   EXPECT_THAT(platform.named.cancelled, ElementsAre(1, 2));
   EXPECT_EQ(log()[0], unlocked);
-  EXPECT_THAT(log(), testing::Contains(line + "Activate pairwelld services").Times(1));
+  EXPECT_THAT(log(), testing::Contains("daemon default: Activate pairwelld services").Times(1));
   dropSubscriptions(*waiting->keyValueStoreManager);
   letGo(*waiting->debugManager());
 }
 
-struct HistoryDaemon : Daemon {
-  void start() override {}
-  void migrate(const SystemVersionNumber& from, const SystemVersionNumber& to) override {
-    calls += from.rawValue + " to " + to.rawValue + ";";
-  }
-  void firstLaunchSinceBoot() override { calls += "first launch;"; }
-  std::string calls;
-};
-
 TEST_F(PairwellDaemonTest, LaunchHistoryTellsUpdatesAndBootsApart) {
-  const Calls noLines, same = {"daemon default: This is *NOT* the first run since reboot"},
-                       reboot = {"daemon default: This is the first run since reboot"},
-                       unrecorded = {"daemon default: No lastLaunchBootSessionUUID on record", reboot[0]};
-  constexpr const char *none = nullptr, *older = "11234567-89AB-CDEF-0123-456789ABCDEF";
-  const char* const now = bootSession.c_str();
-  constexpr const char* lower = "01234567-89ab-cdef-0123-456789abcdef";
+  const std::string none = "No lastLaunchBootSessionUUID on record", launch = "First launch since boot...",
+                    same = "This is *NOT* the first run since reboot",
+                    reboot = "This is the first run since reboot";
+  const std::string older = "11234567-89AB-CDEF-0123-456789ABCDEF";
   const struct {
-    const char *name, *storedVersion, *storedSession, *testLast, *testCurrent, *build, *calls;
-    const char *versionAfter, *sessionAfter;
-    const Calls& lines;
+    const char* name;
+    std::optional<Value> storedVersion, storedSession;
+    const char* build;
+    Calls lines;
+    std::optional<Value> versionAfter;
   } table[] = {
-      {"empty store", none, none, none, none, "20A362", "first launch;", "20A362", now, unrecorded},
-      {"nothing new", "20A362", now, none, none, "20A362", "", "20A362", now, same},
-      {"session in lower case", "20A362", lower, none, none, "20A362", "", "20A362", lower, same},
-      {"reboot", "20A362", older, none, none, "20A362", "first launch;", "20A362", now, reboot},
-      {"update and reboot", "20A362", older, none, none, "21A1", "20A362 to 21A1;first launch;", "21A1", now,
-       reboot},
-      {"session that is none", "20A1", "yesterday", none, none, "20A1", "first launch;", "20A1", now,
-       unrecorded},
-      {"stored version that is none", "x", now, none, none, "20A362", "", "20A362", now, same},
-      {"build whose print differs", "19A57", now, none, none, "19A5007", "19A57 to 19A5007;", "19A57", now,
-       same},
-      {"build that does not parse", "20A362", none, none, none, "Debian", "", "20A362", none, noLines},
-      {"both overrides", "20A3", none, "20A1", "20A2", "20A3", "20A1 to 20A2;first launch;", "20A3", now,
-       unrecorded},
-      {"current alone", "20A362", now, none, "20A2", "Debian", "", "20A362", now, same},
+      {"empty store", {}, {}, "20A362", {none, reboot, launch}, "20A362"},
+      {"nothing new", "20A362", bootSession, "20A362", {same}, "20A362"},
+      {"update and reboot", "20A2", older, "21A1", {"Migrating from 20A2 to 21A1", reboot, launch}, "21A1"},
+      {"back", "21A1", bootSession, "20A2", {"Back-migrating from 21A1 to 20A2", same}, "20A2"},
+      {"session that is none", "20A1", "yesterday", "20A1", {none, reboot, launch}, "20A1"},
+      {"stored version that is none", "x", bootSession, "20A362", {same}, "20A362"},
+      {"print that differs",
+       "19A57",
+       bootSession,
+       "19A5007",
+       {"Back-migrating from 19A57 to 19A5007", same},
+       "19A57"},
+      {"build that does not parse", "20A362", {}, "Debian", {}, "20A362"},
   };
-  const auto value = [](const char* text) { return text ? std::optional<Value>(text) : std::nullopt; };
-  const auto parsed = [](const char* text) {
-    return text ? SystemVersionNumber::fromString(text) : std::nullopt;
+  PairwellDaemon history;
+  const auto linesOf = [&](const auto&... versions) {
+    mark();
+    history.recordLaunch(versions...);
+    Calls lines;
+    for (const auto& line : log()) lines.push_back(line.substr(std::string("daemon default: ").size()));
+    return lines;
   };
   for (const auto& row : table) {
     SCOPED_TRACE(row.name);
-    platform.user->store("LastOSLaunchVersion", value(row.storedVersion));
-    platform.user->store("lastLaunchBootSessionUUID", value(row.storedSession));
+    platform.user->store("LastOSLaunchVersion", row.storedVersion);
+    platform.user->store("lastLaunchBootSessionUUID", row.storedSession);
     platform.device.answers["BuildVersion"] = row.build;
-    mark();
-    HistoryDaemon history;
-    history.recordLaunch(parsed(row.testLast), parsed(row.testCurrent));
-    EXPECT_EQ(history.calls, row.calls);
-    EXPECT_EQ(log(), row.lines);
-    EXPECT_EQ(platform.user->value("LastOSLaunchVersion"), value(row.versionAfter));
-    EXPECT_EQ(platform.user->value("lastLaunchBootSessionUUID"), value(row.sessionAfter));
+    EXPECT_EQ(linesOf(std::nullopt, std::nullopt), row.lines);
+    EXPECT_EQ(platform.user->value("LastOSLaunchVersion"), row.versionAfter);
+    EXPECT_EQ(platform.user->value("lastLaunchBootSessionUUID"),
+              row.lines.empty() ? row.storedSession : bootSession);
   }
+  platform.user->store("lastLaunchBootSessionUUID", bootSession);
+  EXPECT_THAT(linesOf("20A1"_osVersion, "20A2"_osVersion), ElementsAre("Migrating from 20A1 to 20A2", same));
+  EXPECT_EQ(platform.user->value("LastOSLaunchVersion"), Value("20A362")) << "a test's versions are not kept";
 }
 
 TEST_F(PairwellDaemonTest, LaunchHistoryStopsTheProcessWhereItCannotGoOn) {
-  HistoryDaemon history;
+  PairwellDaemon history;
   EXPECT_EQ(textOfStop([&] { history.recordLaunch("20A1"_osVersion, {}); }), "No testCurrentversion!");
   EXPECT_THAT(log(), IsEmpty());
-  for (const char* session : {"", "not a UUID", "01234567-89AB-CDEF-0123-456789ABCDE\xe9"}) {
+  for (const char* session : {"not a UUID", "01234567-89AB-CDEF-0123-456789ABCDE\xe9"}) {
     platform.kernel.bootSession = session;
     EXPECT_EQ(textOfStop([&] { history.recordLaunch({}, {}); }), "Unable to get kern.bootsessionuuid!");
     EXPECT_THAT(log(), IsEmpty());
@@ -166,16 +155,6 @@ TEST_F(PairwellDaemonTest, SystemInfoTakesOnlyTheRightTypeAndLogsErrors) {
   EXPECT_EQ(info.chipID(), std::nullopt);
   EXPECT_THAT(log(),
               ElementsAre("daemon error: SextantCopyAnswerWithError error for key: ProductType -> -5"));
-}
-
-TEST_F(PairwellDaemonTest, MigrationHookNamesItsDirection) {
-  PairwellDaemon hooks;
-  hooks.migrate("20A362"_osVersion, "21A5248v"_osVersion);
-  hooks.migrate("21A5248v"_osVersion, "20A362"_osVersion);
-  hooks.migrate("21A5248"_osVersion, "21A6248"_osVersion);
-  EXPECT_THAT(log(), ElementsAre("daemon default: Migrating from 20A362 to 21A5248v",
-                                 "daemon default: Back-migrating from 21A5248v to 20A362",
-                                 "daemon default: Back-migrating from 21A5248 to 21A6248"));
 }
 
 }  // namespace

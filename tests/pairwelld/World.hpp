@@ -59,13 +59,13 @@ struct World : testing::Test {
   void changeUser() { platform.user->changeFromElsewhere(overrideKey, 60); }
   void changeRoot() { platform.named.postFromElsewhere("com.kestrel.bluetooth.prefsChanged"); }
   void changeCloud() { platform.cloud->changeFromElsewhere({{"other", 1}, {"another", 2}}); }
-  // A client comes to the first listener, or to another.
-  std::shared_ptr<fakes::FakeClientConnection> offerClient(
-      std::int32_t process, platform::Dictionary entitlements = {{"com.kestrel.bluetooth.system", true}},
-      fakes::FakeServiceListener* listener = nullptr) {
+  // A client comes to the newest listener.
+  std::shared_ptr<fakes::FakeClientConnection> offerClient(std::int32_t process,
+                                                           platform::Dictionary entitlements = {
+                                                               {"com.kestrel.bluetooth.system", true}}) {
     auto client =
         std::make_shared<fakes::FakeClientConnection>(platform.effects, process, std::move(entitlements));
-    (listener ? listener : platform.listeners[0].get())->offer(client);
+    platform.listeners.back()->offer(client);
     run();
     return client;
   }

@@ -118,13 +118,11 @@ TEST_F(KeyValueStoreManagerTest, OutsideCloudChangesCountByReasonAndKeys) {
     Calls calls;
   } table[] = {
       {"server", change(0, List{flagKey, "c"}), {"1 cloud flag", "1 cloud c"}},
-      {"first download", change(1, List{"c"}), {"1 cloud c"}},
       {"quota", change(2, List{"c"}), {}},
       {"account", change(3, List{}), {"1 cloud -"}},
       {"unknown", change(4, List{"c"}), {}},
       {"reason that is no number", change("0", List{"c"}), {}},
       {"keys that are no texts", change(0, List{"c", 1}), {}},
-      {"empty", Dictionary{}, {}},
       {"no user information", {}, {}},
   };
   for (const auto& row : table) {
