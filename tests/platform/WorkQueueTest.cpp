@@ -4,7 +4,6 @@
 
 #include <atomic>
 #include <deque>
-#include <future>
 #include <stdexcept>
 #include <thread>
 
@@ -52,32 +51,6 @@ TEST(SerialQueueTest, APoolThreadIsReturnedAfterItsTurn) {
   ASSERT_EQ(pool->jobs.size(), 1u);
   pool->runOne();
   EXPECT_EQ(ran, 100);
-}
-
-// A pool of one whose thread drains the queue: the caller is given the queue when its turn comes, and what
-// came after it waits for the pool.
-TEST(SerialQueueTest, ACallerThatWaitsIsGivenTheQueueInItsTurn) {
-  auto pool = std::make_shared<ThreadPool>(1);
-  const auto queue = Queues(pool).serial("q", QueueRank::state);
-  std::promise<void> inside, go;
-  std::string order;
-  queue->async([&] {
-    inside.set_value();
-    go.get_future().wait();
-    order += 'a';
-  });
-  inside.get_future().wait();
-  std::thread caller([&] {
-    queue->async([&] { order += 'b'; });
-    go.set_value();
-    queue->sync([&, caller = std::this_thread::get_id()] {
-      EXPECT_EQ(caller, std::this_thread::get_id());
-      order += 'c';
-    });
-    queue->async([&] { order += 'd'; });
-  });
-  caller.join();
-  queue->sync([&] { EXPECT_EQ(order, "abcd"); });
 }
 
 TEST(SerialQueueTest, TheLastReferenceMayGoInsideAnItem) {
