@@ -3,26 +3,20 @@
 #include <fcntl.h>
 #include <sys/epoll.h>
 #include <sys/eventfd.h>
-#include <sys/resource.h>
-#include <sys/socket.h>
-#include <systemd/sd-bus.h>
 
 #include <algorithm>
-#include <cerrno>
-#include <cstring>
 #include <map>
 #include <mutex>
 
 #include "platform/LogSink.hpp"
 #include "platform/Platform.hpp"
+#include "platform/linux/BusAcceptor.hpp"
 #include "platform/linux/BusLimits.hpp"
 #include "platform/linux/BusSession.hpp"
 #include "platform/linux/DeadlineTimer.hpp"
 
 namespace platform::linux_ {
 namespace {
-
-using Clock = std::chrono::steady_clock;
 
 const Logger& log() {
   static const Logger logger = hearthLog("bus");
@@ -41,9 +35,10 @@ class BusServer::State : public BusSessionHost, public std::enable_shared_from_t
   State(BusInterface interface, limits::Patience patience)
       : epoll(::epoll_create1(EPOLL_CLOEXEC)),
         _service(std::move(interface), patience),
-        wakeUp(::eventfd(0, EFD_CLOEXEC | EFD_NONBLOCK)) {
+        wakeUp(::eventfd(0, EFD_CLOEXEC | EFD_NONBLOCK)),
+        acceptor(epoll.get(), listenerTag, patience.accept) {
     if (!epoll || !wakeUp || deadlines.descriptor() < 0)
-      platform::stop(std::string("bus server: ") + std::strerror(errno));
+      platform::stop(std::string("bus server: ") + lastError().message());
     control(EPOLL_CTL_ADD, wakeUp.get(), EPOLLIN, wakeUpTag);
     control(EPOLL_CTL_ADD, deadlines.descriptor(), EPOLLIN, timerTag);
   }
@@ -64,19 +59,13 @@ class BusServer::State : public BusSessionHost, public std::enable_shared_from_t
   }
 
   void listen(UniqueDescriptor socket, Admitter admitter_) {
-    listener = std::move(socket);
-    ::fcntl(listener.get(), F_SETFL, ::fcntl(listener.get(), F_GETFL) | O_NONBLOCK);
     admitter = std::move(admitter_);
-    control(EPOLL_CTL_ADD, listener.get(), EPOLLIN, listenerTag);
+    acceptor.listen(std::move(socket));
   }
 
   void stopListening() {
-    // The service manager holds the same socket: closing ours alone would leave it watched, and clients that
-    // come later would wake the loop for ever.
-    if (listener) ::epoll_ctl(epoll.get(), EPOLL_CTL_DEL, listener.get(), nullptr);
-    listener.reset();
+    acceptor.stop();
     deadlines.set(listenerTag, std::nullopt);
-    paused = false;
   }
 
   std::shared_ptr<BusConnection> adopt(UniqueDescriptor socket, PeerIdentity peer,
@@ -132,7 +121,7 @@ class BusServer::State : public BusSessionHost, public std::enable_shared_from_t
     event.events = events;
     event.data.u64 = tag;
     if (::epoll_ctl(epoll.get(), operation, descriptor, &event) < 0)
-      platform::stop(std::string("bus server: epoll: ") + std::strerror(errno));
+      platform::stop(std::string("bus server: epoll: ") + lastError().message());
   }
 
   void handle(std::uint64_t tag, std::uint32_t events) {
@@ -143,7 +132,8 @@ class BusServer::State : public BusSessionHost, public std::enable_shared_from_t
     } else if (tag == timerTag) {
       handleTimer();
     } else if (tag == listenerTag) {
-      acceptSome();
+      acceptor.acceptSome([this](UniqueDescriptor socket) { offer(std::move(socket)); });
+      deadlines.set(listenerTag, acceptor.deadline());
     } else if (tag % 2 == 0) {
       withSession(tag / 2, [&](BusSession& session) { session.ready(events); });
     } else {
@@ -234,41 +224,22 @@ class BusServer::State : public BusSessionHost, public std::enable_shared_from_t
     if (peer.process) ::epoll_ctl(epoll.get(), EPOLL_CTL_DEL, peer.process->get(), nullptr);
     if (--perUser[peer.uid] == 0) perUser.erase(peer.uid);
     entry.session->finish();
-    if (paused) resume();
+    resumeAccepting();
   }
 
   void handleTimer() {
     for (const std::uint64_t number : deadlines.takePassed()) {
       if (number == listenerTag) {
-        resume();
+        resumeAccepting();
       } else {
         withSession(number, [](BusSession& session) { session.deadlinePassed(); });
       }
     }
   }
 
-  void acceptSome() {
-    // In turns, so that those who are connected already have theirs.
-    for (int turn = 0; turn < 16 && listener; ++turn) {
-      if (!hasSpareDescriptors()) return pause();
-      UniqueDescriptor socket(::accept4(listener.get(), nullptr, nullptr, SOCK_CLOEXEC | SOCK_NONBLOCK));
-      if (socket) {
-        exhausted = false;
-        offer(std::move(socket));
-      } else if (errno == EAGAIN) {
-        return;
-      } else if (errno != ECONNABORTED && errno != EINTR) {
-        return pause();
-      }
-    }
-  }
-
-  // The kernel gives out the lowest free number.
-  bool hasSpareDescriptors() const {
-    const UniqueDescriptor lowest(::fcntl(epoll.get(), F_DUPFD_CLOEXEC, 0));
-    rlimit limit{};
-    if (!lowest || ::getrlimit(RLIMIT_NOFILE, &limit) != 0) return false;
-    return static_cast<rlim_t>(lowest.get()) + limits::spareDescriptors < limit.rlim_cur;
+  void resumeAccepting() {
+    acceptor.resume();
+    deadlines.set(listenerTag, std::nullopt);
   }
 
   void offer(UniqueDescriptor socket) {
@@ -329,19 +300,6 @@ class BusServer::State : public BusSessionHost, public std::enable_shared_from_t
     changed(session.number);
   }
 
-  void pause() {
-    if (!std::exchange(exhausted, true)) log().error("at the limit of descriptors: accepting rests");
-    control(EPOLL_CTL_MOD, listener.get(), 0, listenerTag);
-    paused = true;
-    deadlines.set(listenerTag, Clock::now() + _service.patience.accept);
-  }
-
-  void resume() {
-    paused = false;
-    deadlines.set(listenerTag, std::nullopt);
-    if (listener) control(EPOLL_CTL_MOD, listener.get(), EPOLLIN, listenerTag);
-  }
-
   static inline thread_local const State* dispatching = nullptr;
 
   const UniqueDescriptor epoll;
@@ -349,10 +307,8 @@ class BusServer::State : public BusSessionHost, public std::enable_shared_from_t
   const UniqueDescriptor wakeUp;
   DeadlineTimer deadlines;  // of sessions, and of the listener's rest
 
-  UniqueDescriptor listener;
+  BusAcceptor acceptor;
   Admitter admitter;
-  bool paused = false;
-  bool exhausted = false;
   bool full = false;
 
   std::uint64_t nextSession = firstSession;
