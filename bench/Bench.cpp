@@ -54,7 +54,7 @@ void report(const char* what, double figure, const char* unit) {
 }
 
 const platform::linux_::BusInterface& clientInterface() {
-  static const auto interface = platform::linux_::clientInterface(serviceName);
+  static const auto interface = platform::linux_::clientInterface(pairwell::names::service);
   return interface;
 }
 
@@ -90,7 +90,7 @@ std::vector<double> timeSwitches(Device& device) {
   auto watcher = BusClient::connect(device.paths().hearthdSocket(), 5s);
   if (!watcher) throw std::runtime_error("hearthd does not answer");
   mustAnswer((*watcher)->call(platform::linux_::hearthInterface(), "Watch",
-                              {"com.kestrel.pairwell.settingsChanged"}, 5s));
+                              {std::string(pairwell::names::settingsChanged)}, 5s));
   std::vector<double> times;
   for (std::size_t count = 0; count < switches; ++count) {
     const double start = now();

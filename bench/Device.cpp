@@ -29,8 +29,8 @@ Device::Device(const std::string& programs, const std::string& benchmark) {
   const std::string init = root + "/bin/hearthctl --root " + root + " init >/dev/null";
   if (std::system(init.c_str()) != 0) throw std::runtime_error("hearthctl init failed");
   std::ofstream(_paths.entitlements() + "/bench.json")
-      << "{\"executable\": \"" << benchmark
-      << "\", \"entitlements\": {\"com.kestrel.bluetooth.system\": true}}\n";
+      << "{\"executable\": \"" << benchmark << "\", \"entitlements\": {\""
+      << pairwell::names::systemEntitlement << "\": true}}\n";
 }
 
 Device::~Device() {

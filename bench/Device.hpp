@@ -6,12 +6,11 @@
 #include <memory>
 #include <string>
 
+#include "pairwelld/Names.hpp"
 #include "platform/linux/BusClient.hpp"
 #include "platform/linux/Paths.hpp"
 
 namespace bench {
-
-inline constexpr const char* serviceName = "com.kestrel.pairwell.conduit";
 
 class Device {
  public:
@@ -26,7 +25,7 @@ class Device {
   pid_t hearthd() const { return pid; }
   pid_t pairwelld() const;
   const platform::linux_::Paths& paths() const { return _paths; }
-  std::string clientSocket() const { return _paths.serviceSocket(serviceName); }
+  std::string clientSocket() const { return _paths.serviceSocket(pairwell::names::service); }
   // Connected and authenticated, trying until it is served.
   std::unique_ptr<platform::linux_::BusClient> client() const;
 

@@ -1,6 +1,7 @@
 #include "hearthd/AlarmFile.hpp"
 
 #include <system_error>
+#include <utility>
 
 #include "platform/LogSink.hpp"
 #include "platform/linux/Json.hpp"
@@ -17,8 +18,8 @@ const platform::Logger& log() {
 
 }  // namespace
 
-AlarmFile::AlarmFile(platform::linux_::FileSystem& files_, const std::string& folder)
-    : files(files_), path(folder + "/alarms.json") {}
+AlarmFile::AlarmFile(platform::linux_::FileSystem& files_, std::string path_)
+    : files(files_), path(std::move(path_)) {}
 
 Alarms AlarmFile::load() {
   const auto bytes = platform::linux_::readFile(files, path, fileLimit);

@@ -11,8 +11,8 @@ namespace hearth {
 
 class AlarmFile {
  public:
-  // `folder` is made when it is needed.
-  AlarmFile(platform::linux_::FileSystem& files, const std::string& folder);
+  // Its folder is made when it is needed.
+  AlarmFile(platform::linux_::FileSystem& files, std::string path);
 
   // A damaged file is moved aside, with a line in the log; one that cannot be read stays, and nothing can be
   // saved.

@@ -10,6 +10,7 @@
 
 #include "hearthd/Connection.hpp"
 #include "hearthd/ListeningSocket.hpp"
+#include "platform/EventStreams.hpp"
 #include "platform/LogSink.hpp"
 #include "platform/linux/HearthInterface.hpp"
 
@@ -19,8 +20,6 @@ namespace {
 using platform::linux_::HearthSignal;
 using platform::linux_::PeerIdentity;
 using platform::linux_::UniqueDescriptor;
-
-constexpr const char* matchingStream = "com.kestrel.tidingsd.matching";
 
 const platform::Logger& log() {
   static const platform::Logger logger = platform::hearthLog("hearthd");
@@ -54,7 +53,7 @@ ServiceManager::ServiceManager(platform::linux_::EventLoop& loop_, platform::lin
     : loop(loop_),
       paths(std::move(paths_)),
       files(files_),
-      alarmFile(files_, paths.hearthd()),
+      alarmFile(files_, paths.alarms()),
       alarms(alarmFile.load()),
       server(platform::linux_::hearthInterface()) {}
 
@@ -183,7 +182,8 @@ void ServiceManager::tell(const std::string& name) {
     const auto connection = found->second;  // writing may find it dead
     connection->emit(static_cast<std::size_t>(HearthSignal::notification), {name}, "notification:" + name);
   }
-  for (const std::string& job : broker.matchingJobs(name)) deliver({job, matchingStream, name});
+  for (const std::string& job : broker.matchingJobs(name))
+    deliver({job, std::string(platform::EventStreams::matching), name});
 }
 
 std::vector<std::string> ServiceManager::consumers(const std::string& stream) const {
@@ -196,9 +196,8 @@ std::vector<std::string> ServiceManager::consumers(const std::string& stream) co
 }
 
 bool ServiceManager::owns(const std::string& job, const std::string& stream) const {
-  return std::any_of(allJobs.begin(), allJobs.end(), [&](const auto& candidate) {
-    return candidate->description().name == job && contains(candidate->description().streams, stream);
-  });
+  const Job* found = findJob(job);
+  return found && contains(found->description().streams, stream);
 }
 
 template <class Change>
@@ -271,7 +270,7 @@ void ServiceManager::emitEvent(const EventKey& key, std::int64_t generation) {
                    kind + key.stream + ":" + key.name);
 }
 
-Job* ServiceManager::findJob(const std::string& name) {
+Job* ServiceManager::findJob(const std::string& name) const {
   for (const auto& job : allJobs) {
     if (job->description().name == name) return job.get();
   }

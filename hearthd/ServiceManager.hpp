@@ -56,7 +56,7 @@ class ServiceManager {
 
   // No job is started any more.
   bool isStopping() const { return stopping; }
-  Job* findJob(const std::string& name);
+  Job* findJob(const std::string& name) const;
   const std::vector<std::unique_ptr<Job>>& jobs() const { return allJobs; }
 
  private:

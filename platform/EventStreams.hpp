@@ -16,6 +16,9 @@ class EventStreams {
  public:
   virtual ~EventStreams() = default;
 
+  // A stream's events are alarms, or the named notifications that a job's file lists.
+  static constexpr std::string_view alarms = "com.kestrel.alarm";
+  static constexpr std::string_view matching = "com.kestrel.tidingsd.matching";
   // The entry of an event that holds its name.
   static constexpr std::string_view nameKey = "Name";
 

@@ -6,6 +6,14 @@
 
 namespace platform {
 
+std::optional<Date> Date::ofSeconds(double secondsSince1970) {
+  constexpr std::int64_t nanosecondsPerSecond = 1'000'000'000;
+  constexpr double lastSecond = 9223372036;
+  const double seconds = std::trunc(secondsSince1970);
+  if (!(std::abs(seconds) <= lastSecond)) return std::nullopt;  // so that NaN is refused, too
+  return Date{static_cast<std::int64_t>(seconds) * nanosecondsPerSecond};
+}
+
 bool operator==(const Value& a, const Value& b) { return a.storage == b.storage; }
 
 std::optional<bool> toBool(const Value& value) {

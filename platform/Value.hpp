@@ -19,6 +19,9 @@ using Time = std::chrono::duration<double>;
 // A moment as a property value: nanoseconds since 1970-01-01 00:00:00 UTC, as alarm descriptors count.
 struct Date {
   std::int64_t nanoseconds = 0;
+  // In whole seconds, the fraction dropped. Absent for what is not finite or lies outside
+  // -9223372036…9223372036, some 292 years around 1970: a clamped one is a moment that nobody meant.
+  static std::optional<Date> ofSeconds(double secondsSince1970);
   friend bool operator==(const Date&, const Date&) = default;
 };
 

@@ -4,6 +4,7 @@
 #include <utility>
 
 #include "pairwelld/Log.hpp"
+#include "pairwelld/Names.hpp"
 #include "platform/Platform.hpp"
 
 namespace pairwell {
@@ -13,7 +14,6 @@ using Defaults = KeyValueStoreManager::Defaults;
 
 constexpr platform::Time defaultPeriod{345600};  // 4 days
 constexpr std::string_view alarmName = platform::rawValue(Defaults::velaLogCloudCollectionEnabled);
-constexpr std::string_view settingsChanged = "com.kestrel.pairwell.settingsChanged";
 
 double secondsSince1970() { return platform::current().clock().now().count(); }
 
@@ -79,7 +79,7 @@ void DebugManager::startLimitedLogging(double storedEndTime) {
   kvs->setValue(KeyValueSource::cloud, end, Defaults::velaLogCloudCollectionEnabledExpiration);
   SystemNotificationManager::shared()->scheduleAlarm(alarmName, end);
   _audioAccessoryLimitedLoggingEnabled = true;
-  platform::current().namedNotifications().post(settingsChanged);
+  platform::current().namedNotifications().post(names::settingsChanged);
 }
 
 void DebugManager::stopLimitedLogging() {
@@ -89,12 +89,12 @@ void DebugManager::stopLimitedLogging() {
   kvs->setValue(KeyValueSource::cloud, std::nullopt, Defaults::velaLogCloudCollectionEnabledExpiration);
   SystemNotificationManager::shared()->cancelAlarm(alarmName);
   _audioAccessoryLimitedLoggingEnabled = false;
-  platform::current().namedNotifications().post(settingsChanged);
+  platform::current().namedNotifications().post(names::settingsChanged);
 }
 
 double DebugManager::endTime() {
   const double end = kvs->getDouble(KeyValueSource::cloud, Defaults::velaLogCloudCollectionEnabledExpiration);
-  return SystemNotificationManager::alarmDate(end) ? end : 0.0;
+  return platform::Date::ofSeconds(end) ? end : 0.0;
 }
 
 platform::Time DebugManager::expirationDate() {

@@ -19,4 +19,31 @@ concept Subscribable = requires(Publisher& publisher,
   { publisher.subscribe(subscriber) } -> std::same_as<Subscription<typename Publisher::Subscriber>>;
 };
 
+// What publishers have in common. The removal is queued, and needs a publisher only when its turn comes.
+template <class Publisher>
+void unsubscribeFrom(Publisher& publisher, const Subscription<typename Publisher::Subscriber>& subscription) {
+  publisher.subscriptionQueue->async([weak = publisher.weak_from_this(), subscription] {
+    const auto self = weak.lock();
+    if (!self) return;
+    self->subscriptionQueue->assertCurrent();
+    std::erase(self->subscriptions, subscription);
+  });
+}
+
+template <class Publisher>
+Subscription<typename Publisher::Subscriber> subscribeTo(
+    Publisher& publisher, const std::shared_ptr<typename Publisher::Subscriber>& subscriber) {
+  using Handle = Subscription<typename Publisher::Subscriber>;
+  const Handle subscription(
+      subscriber, [weak = publisher.weak_from_this()](const Handle& handle) -> platform::Result<void> {
+        if (const auto self = weak.lock()) unsubscribeFrom(*self, handle);
+        return {};
+      });
+  publisher.subscriptionQueue->sync([&] {
+    publisher.subscriptionQueue->assertCurrent();
+    publisher.subscriptions.push_back(subscription);
+  });
+  return subscription;
+}
+
 }  // namespace pairwell

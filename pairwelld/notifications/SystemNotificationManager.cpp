@@ -15,8 +15,6 @@ const platform::SlotKey sharedKey;
 constexpr std::string_view alarmStream =
     platform::rawValue(SystemNotificationManager::Constants::systemAlarm);
 constexpr std::string_view dateKey = "Date";
-constexpr std::int64_t nanosecondsPerSecond = 1'000'000'000;
-constexpr double lastAlarmSecond = 9223372036;
 
 }  // namespace
 
@@ -44,7 +42,7 @@ void SystemNotificationManager::scheduleAlarm(std::string_view name, platform::T
 
 void SystemNotificationManager::scheduleAlarm(std::string_view name, double secondsSince1970) {
   Log::notification().default_("Scheduling alarm: %s for %f", name, secondsSince1970);
-  const auto date = alarmDate(secondsSince1970);
+  const auto date = platform::Date::ofSeconds(secondsSince1970);
   if (!date) {
     Log::notification().error("Alarm rejected, its time is out of range: %s for %f", name, secondsSince1970);
     return;
@@ -61,27 +59,7 @@ void SystemNotificationManager::cancelAlarm(std::string_view name) {
 
 Subscription<SystemNotificationManagerSubscribing> SystemNotificationManager::subscribe(
     const std::shared_ptr<Subscriber>& subscriber) {
-  std::optional<Subscription<Subscriber>> subscription;
-  subscriptionQueue->sync([&] {
-    subscriptionQueue->assertCurrent();
-    subscription.emplace(
-        subscriber,
-        [weak = weak_from_this()](const Subscription<Subscriber>& handle) -> platform::Result<void> {
-          if (auto self = weak.lock()) self->unsubscribe(handle);
-          return {};
-        });
-    subscriptions.push_back(*subscription);
-  });
-  return *subscription;
-}
-
-void SystemNotificationManager::unsubscribe(const Subscription<Subscriber>& subscription) {
-  subscriptionQueue->async([weak = weak_from_this(), subscription] {
-    auto self = weak.lock();
-    if (!self) return;
-    self->subscriptionQueue->assertCurrent();
-    std::erase(self->subscriptions, subscription);
-  });
+  return subscribeTo(*this, subscriber);
 }
 
 void SystemNotificationManager::handle(const platform::Dictionary& event) {
@@ -97,12 +75,6 @@ void SystemNotificationManager::handle(const platform::Dictionary& event) {
   for (const auto& subscription : current) {
     subscription.subscriber()->didReceiveNotification(SystemNotificationSource::alarm, *name);
   }
-}
-
-std::optional<platform::Date> SystemNotificationManager::alarmDate(double secondsSince1970) {
-  const double seconds = std::trunc(secondsSince1970);
-  if (!(std::abs(seconds) <= lastAlarmSecond)) return std::nullopt;  // so that NaN is refused, too
-  return platform::Date{static_cast<std::int64_t>(seconds) * nanosecondsPerSecond};
 }
 
 }  // namespace pairwell

@@ -8,6 +8,7 @@
 
 #include "pairwelld/notifications/Subscribable.hpp"
 #include "pairwelld/notifications/Subscription.hpp"
+#include "platform/EventStreams.hpp"
 #include "platform/RawValue.hpp"
 #include "platform/ThreadAnnotations.hpp"
 #include "platform/Value.hpp"
@@ -39,8 +40,7 @@ class SystemNotificationManager : public std::enable_shared_from_this<SystemNoti
   virtual ~SystemNotificationManager() = default;
 
   // Any thread. The fraction of a second is dropped, so an alarm may fire up to a second early. A time
-  // without an alarm date is rejected with a logged error, and an earlier alarm of the name stays as it was:
-  // a clamped date would fire at a moment that nobody asked for.
+  // without a date is rejected with a logged error, and an earlier alarm of the name stays as it was.
   virtual void scheduleAlarm(std::string_view name, platform::Time date);
   virtual void scheduleAlarm(std::string_view name, double secondsSince1970);
   virtual void cancelAlarm(std::string_view name);
@@ -48,15 +48,10 @@ class SystemNotificationManager : public std::enable_shared_from_this<SystemNoti
   // Any thread; waits for subscriptionQueue.
   Subscription<Subscriber> subscribe(const std::shared_ptr<Subscriber>& subscriber);
 
-  // Absent for what is not finite or, in whole seconds, lies outside -9223372036…9223372036, some 292 years
-  // around 1970.
-  static std::optional<platform::Date> alarmDate(double secondsSince1970);
-
  protected:
   SystemNotificationManager();
 
  private:
-  void unsubscribe(const Subscription<Subscriber>& subscription);
   void handle(const platform::Dictionary& event);
 };
 
@@ -70,6 +65,6 @@ inline constexpr platform::RawValues<pairwell::SystemNotificationSource, 1>
 template <>
 inline constexpr platform::RawValues<pairwell::SystemNotificationManager::Constants, 1>
     platform::rawValues<pairwell::SystemNotificationManager::Constants> = {
-        {{pairwell::SystemNotificationManager::Constants::systemAlarm, "com.kestrel.alarm"}}};
+        {{pairwell::SystemNotificationManager::Constants::systemAlarm, platform::EventStreams::alarms}}};
 
 static_assert(pairwell::Subscribable<pairwell::SystemNotificationManager>);

@@ -33,7 +33,7 @@ void TarnNotificationManager::unregisterHelper(const TarnNotificationHelper& hel
 
 void TarnNotificationManager::setUp() {
   platform::current().eventStreams().setHandler(
-      "com.kestrel.tidingsd.matching", platform::current().runLoop().mainQueue(),
+      platform::EventStreams::matching, platform::current().runLoop().mainQueue(),
       // Strong: the stream is handled for as long as the process lives.
       [self = shared_from_this()](const platform::Dictionary& event) { self->handle(event); });
 }

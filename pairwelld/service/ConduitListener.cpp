@@ -4,6 +4,7 @@
 #include <utility>
 
 #include "pairwelld/Log.hpp"
+#include "pairwelld/Names.hpp"
 #include "pairwelld/debug/DebugManager.hpp"
 #include "pairwelld/service/ConduitConnection.hpp"
 #include "platform/Platform.hpp"
@@ -11,7 +12,6 @@
 namespace pairwell {
 namespace {
 
-constexpr std::string_view systemEntitlement = "com.kestrel.bluetooth.system";
 constexpr std::string_view internalEntitlement = "com.kestrel.bluetooth.internal";
 
 // Only the boolean grants: 1 or "true" do not.
@@ -39,7 +39,7 @@ void ConduitListener::setConnections(Connections connections) { connections_.swa
 
 std::shared_ptr<platform::ServiceListener> ConduitListener::conduitListener() {
   if (!conduitListener_) {
-    conduitListener_ = platform::current().makeServiceListener("com.kestrel.pairwell.conduit");
+    conduitListener_ = platform::current().makeServiceListener(names::service);
     conduitListener_->setDelegate(weak_from_this());
     conduitListener_->setQueue(serialQueue);
   }
@@ -100,13 +100,13 @@ bool ConduitListener::listenerShouldAcceptNewConnection(
 }
 
 bool ConduitListener::isEntitled(platform::ClientConnection& connection) {
-  return grants(connection, systemEntitlement) || grants(connection, internalEntitlement);
+  return grants(connection, names::systemEntitlement) || grants(connection, internalEntitlement);
 }
 
 void ConduitListener::logDenial(platform::ClientConnection& connection) {
   if (platform::current().deviceProperties().isInternalBuild() != 0) {
     Log::conduit().error("Conduit connection denied, %d, add %s entitlement", connection.processIdentifier(),
-                         systemEntitlement);
+                         names::systemEntitlement);
   } else {
     Log::conduit().error("Conduit connection denied, %d", connection.processIdentifier());
   }

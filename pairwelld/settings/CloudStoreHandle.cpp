@@ -1,5 +1,6 @@
 #include "pairwelld/settings/CloudStoreHandle.hpp"
 
+#include "pairwelld/Names.hpp"
 #include "platform/Platform.hpp"
 
 namespace pairwell {
@@ -12,7 +13,7 @@ constexpr int cloudStoreTypeCode = 2;
 
 std::shared_ptr<platform::CloudStore> cloudStoreHandle() {
   return platform::current().slot<std::shared_ptr<platform::CloudStore>>(cloudStoreKey, [] {
-    return platform::current().makeCloudStore("com.kestrel.bluetooth.cloud.settings", cloudStoreTypeCode);
+    return platform::current().makeCloudStore(names::cloudStore, cloudStoreTypeCode);
   });
 }
 

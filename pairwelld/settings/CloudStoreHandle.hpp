@@ -10,8 +10,6 @@ namespace pairwell {
 
 // Posted in the process after each of its own cloud writes.
 inline constexpr std::string_view cloudStoreChangedNotification = "com.kestrel.pairwell.cloud.storeChanged";
-// Posted system-wide after each change of the root preferences, by whoever makes it.
-inline constexpr std::string_view rootPrefsChangedNotification = "com.kestrel.bluetooth.prefsChanged";
 
 // One object for manager and observer, who matches notifications against it. Made on first use. Any thread.
 std::shared_ptr<platform::CloudStore> cloudStoreHandle();

@@ -4,6 +4,7 @@
 #include <utility>
 
 #include "pairwelld/Log.hpp"
+#include "pairwelld/Names.hpp"
 #include "pairwelld/settings/CloudStoreHandle.hpp"
 #include "platform/Platform.hpp"
 
@@ -80,7 +81,7 @@ void KeyValueStoreCustomObserver::observeCloudStore() {
 void KeyValueStoreCustomObserver::observeRootPreferences() {
   // A failed registration leaves root changes unnoticed; the status is not looked at.
   platform::current().namedNotifications().registerHandler(
-      rootPrefsChangedNotification, rootPrefsChangeToken,
+      names::rootPrefsChanged, rootPrefsChangeToken,
       platform::current().queues().global(platform::QualityOfService::utility),
       [weak = weak_from_this()](std::int32_t) {
         Log::kvs().default_("Root KVS Notification");  // due even if the observer has gone

@@ -4,6 +4,7 @@
 #include <utility>
 
 #include "pairwelld/Log.hpp"
+#include "pairwelld/Names.hpp"
 #include "pairwelld/settings/CloudStoreHandle.hpp"
 #include "platform/Platform.hpp"
 
@@ -107,7 +108,7 @@ void KeyValueStoreManager::setRootValue(const std::optional<platform::Value>& va
                      [&] { return written.error().message(); });
     return;
   }
-  platform::current().namedNotifications().post(rootPrefsChangedNotification);
+  platform::current().namedNotifications().post(names::rootPrefsChanged);
 }
 
 void KeyValueStoreManager::setValue(const std::vector<KeyValueSource>& sources,
@@ -117,27 +118,11 @@ void KeyValueStoreManager::setValue(const std::vector<KeyValueSource>& sources,
 
 Subscription<KeyValueStoreManagerSubscribing> KeyValueStoreManager::subscribe(
     const std::shared_ptr<Subscriber>& subscriber) {
-  std::optional<Subscription<Subscriber>> subscription;
-  subscriptionQueue->sync([&] {
-    subscriptionQueue->assertCurrent();
-    subscription.emplace(
-        subscriber,
-        [weak = weak_from_this()](const Subscription<Subscriber>& handle) -> platform::Result<void> {
-          if (auto self = weak.lock()) self->unsubscribe(handle);
-          return {};
-        });
-    subscriptions.push_back(*subscription);
-  });
-  return *subscription;
+  return subscribeTo(*this, subscriber);
 }
 
 void KeyValueStoreManager::unsubscribe(const Subscription<Subscriber>& subscription) {
-  subscriptionQueue->async([weak = weak_from_this(), subscription] {
-    auto self = weak.lock();
-    if (!self) return;
-    self->subscriptionQueue->assertCurrent();
-    std::erase(self->subscriptions, subscription);
-  });
+  unsubscribeFrom(*this, subscription);
 }
 
 void KeyValueStoreManager::handleStoreChange(KeyValueSource source, const std::vector<std::string>& keys) {
@@ -146,7 +131,7 @@ void KeyValueStoreManager::handleStoreChange(KeyValueSource source, const std::v
     return;
   }
   for (const std::string& key : keys) notifySubscribers(source, key);
-  platform::current().namedNotifications().post("com.kestrel.pairwell.prefsChanged");
+  platform::current().namedNotifications().post(names::prefsChanged);
 }
 
 void KeyValueStoreManager::notifySubscribers(KeyValueSource source, const std::optional<std::string>& key) {

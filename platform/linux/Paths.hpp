@@ -27,8 +27,11 @@ struct Paths {
     return var + "/settings/cloud/" + std::string(identifier) + ".json";
   }
   std::string hearthd() const { return var + "/hearthd"; }
+  std::string alarms() const { return hearthd() + "/alarms.json"; }
   std::string hearthdSocket() const { return run + "/hearthd.sock"; }
-  std::string serviceSocket(const std::string& service) const { return run + "/" + service + ".sock"; }
+  std::string serviceSocket(std::string_view service) const {
+    return run + "/" + std::string(service) + ".sock";
+  }
 };
 
 }  // namespace platform::linux_

@@ -21,13 +21,14 @@ const std::map<std::string, std::string> layers = {
     {"pairwelld/main.cpp", "\"platform/|\"pairwelld/"},
     {"pairwelld/notifications/",
      "\"platform/(?!linux/)|\"pairwelld/(notifications/|Log.hpp|TarnNotificationHelper.hpp)"},
-    {"pairwelld/settings/", "\"platform/(?!linux/)|\"pairwelld/(settings/|notifications/|Log.hpp)"},
-    {"pairwelld/debug/", "\"platform/(?!linux/)|\"pairwelld/(debug/|settings/|notifications/|Log.hpp)"},
-    {"pairwelld/service/", "\"platform/(?!linux/)|\"pairwelld/(service/|debug/|Log.hpp)"},
+    {"pairwelld/settings/", "\"platform/(?!linux/)|\"pairwelld/(settings/|notifications/|Log.hpp|Names.hpp)"},
+    {"pairwelld/debug/",
+     "\"platform/(?!linux/)|\"pairwelld/(debug/|settings/|notifications/|Log.hpp|Names.hpp)"},
+    {"pairwelld/service/", "\"platform/(?!linux/)|\"pairwelld/(service/|debug/|Log.hpp|Names.hpp)"},
     {"hearthd/", "\"platform/|\"hearthd/|<systemd/|<CLI/|<sys/|<linux/|POSIX"},
     {"hearthd/core/", "\"platform/(?!linux/)|\"hearthd/core/"},
     {"tools/",
-     "\"platform/|\"tools/|\"pairwelld/settings/(Defaults|KeyValueSource).hpp|"
+     "\"platform/|\"tools/|\"pairwelld/(Names|settings/(Defaults|KeyValueSource)).hpp|"
      "\"pairwelld/service/RadixDistributedDebugLogging.hpp|<CLI/|<sys/|POSIX"},
 };
 const std::string posix = "<(unistd|fcntl|poll|signal|dirent|pwd|grp|spawn|sched|netinet/in)\\.h>";

@@ -7,11 +7,13 @@
 #include <thread>
 #include <utility>
 
+#include "pairwelld/Names.hpp"
 #include "pairwelld/settings/Defaults.hpp"
+#include "platform/EventStreams.hpp"
 #include "platform/linux/Entitlements.hpp"
 #include "platform/linux/Json.hpp"
 #include "platform/linux/LinuxEnvironment.hpp"
-#include "tools/End.hpp"
+#include "tools/StoredSettings.hpp"
 #include "tools/hearthctl/Settings.hpp"
 
 namespace tools {
@@ -30,19 +32,13 @@ constexpr std::size_t fileLimit = 64 << 20;
 // What a switch writes is written in far less.
 constexpr std::chrono::milliseconds switchTime{300};
 
-const std::string daemonJob = "com.kestrel.pairwelld";
+const std::string daemonJob(pairwell::names::job);
 const std::string flagKey(platform::rawValue(Defaults::velaLogCloudCollectionEnabled));
 const std::string endKey(platform::rawValue(Defaults::velaLogCloudCollectionEnabledExpiration));
 
 bool flagIn(const Dictionary& values) {
   const Value* flag = platform::find(values, flagKey);
   return flag && platform::toBool(*flag).value_or(false);
-}
-
-std::optional<double> endIn(const Dictionary& values) {
-  const Value* found = platform::find(values, endKey);
-  const auto end = found ? platform::toDouble(*found) : std::nullopt;
-  return end && isEnd(*end) ? end : std::nullopt;
 }
 
 struct Finding {
@@ -147,7 +143,7 @@ Dictionary Look::readObject(const std::string& path, const std::string& remedy) 
 
 // What is no alarm is left out, as there is nothing to compare it with.
 std::vector<Alarm> Look::alarmsFromFile() {
-  const std::string path = paths.hearthd() + "/alarms.json";
+  const std::string path = paths.alarms();
   say("hearthd does not run; the alarms are those of " + path);
   const Dictionary whole = readObject(path, "mend it before hearthd starts, which would move it aside");
   const auto* list = platform::find<List>(whole, "alarms");
@@ -185,7 +181,7 @@ std::optional<Period> Look::readPeriod(const std::vector<Alarm>& alarms) {
   Period period{flagIn(contents[KeyValueSource::root]), flagIn(contents[KeyValueSource::cloud]),
                 endIn(contents[KeyValueSource::cloud]), std::nullopt};
   for (const Alarm& alarm : alarms) {
-    if (alarm.job == daemonJob && alarm.stream == "com.kestrel.alarm" && alarm.name == flagKey)
+    if (alarm.job == daemonJob && alarm.stream == platform::EventStreams::alarms && alarm.name == flagKey)
       period.alarm = alarm.date;
   }
   return period;

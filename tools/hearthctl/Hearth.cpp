@@ -1,4 +1,5 @@
 #include "tools/hearthctl/Hearth.hpp"
+#include "pairwelld/Names.hpp"
 
 #include <algorithm>
 #include <chrono>
@@ -103,7 +104,7 @@ Exit Hearth::cancelAlarms(Output& output, const std::string& name) {
 }
 
 void Hearth::announceRootChange() {
-  const auto posted = call(HearthOperation::post, {"com.kestrel.bluetooth.prefsChanged"});
+  const auto posted = call(HearthOperation::post, {std::string(pairwell::names::rootPrefsChanged)});
   if (!posted) say("the change is made, but nobody was told: " + socket + ": " + posted.error().message());
 }
 

@@ -7,6 +7,8 @@
 #include <system_error>
 #include <utility>
 
+#include "pairwelld/Names.hpp"
+#include "platform/EventStreams.hpp"
 #include "platform/linux/Entitlements.hpp"
 #include "platform/linux/Json.hpp"
 
@@ -14,7 +16,9 @@ namespace tools {
 namespace {
 
 namespace fs = std::filesystem;
+namespace names = pairwell::names;
 using platform::Dictionary;
+using platform::EventStreams;
 using platform::List;
 using platform::Result;
 using platform::linux_::EntitlementGrant;
@@ -28,15 +32,15 @@ Dictionary deviceFile(const Device& device) {
 }
 
 Dictionary jobFile(const fs::path& programs) {
-  return {{"name", "com.kestrel.pairwelld"},
+  return {{"name", std::string(names::job)},
           {"program", (programs / "pairwelld").string()},
-          {"services", List{"com.kestrel.pairwell.conduit"}},
-          {"streams", List{"com.kestrel.alarm", "com.kestrel.tidingsd.matching"}}};
+          {"services", List{std::string(names::service)}},
+          {"streams", List{std::string(EventStreams::alarms), std::string(EventStreams::matching)}}};
 }
 
 Dictionary entitlementFile(const fs::path& programs) {
   return {{"executable", (programs / "pairwellctl").string()},
-          {"entitlements", Dictionary{{"com.kestrel.bluetooth.system", true}}}};
+          {"entitlements", Dictionary{{std::string(names::systemEntitlement), true}}}};
 }
 
 // Exclusive, so that nothing is overwritten, not even what appears meanwhile.

@@ -17,6 +17,7 @@
 #include "platform/linux/ReplicaFileCloudStore.hpp"
 #include "platform/linux/SettingsDocument.hpp"
 #include "platform/linux/SettingsFile.hpp"
+#include "tools/StoredSettings.hpp"
 
 namespace tools {
 namespace {
@@ -68,12 +69,6 @@ bool runEditor(const std::string& path) {
 
 }  // namespace
 
-std::string settingsPath(const platform::linux_::Paths& paths, KeyValueSource source) {
-  if (source == KeyValueSource::user) return paths.userSettings();
-  if (source == KeyValueSource::root) return paths.rootSettings();
-  return paths.cloudSettings("com.kestrel.bluetooth.cloud.settings");
-}
-
 std::optional<Value> valueFromText(const std::string& text, const std::string& type) {
   const auto mayBe = [&](const char* name) { return type.empty() || type == name; };
   if (mayBe("bool") && (text == "true" || text == "false")) return Value(text == "true");
@@ -93,27 +88,21 @@ Result<Dictionary> parseObject(std::string_view text, std::string& problem) {
   return Outcome::malformedFile;
 }
 
-Settings::Settings(const platform::linux_::Paths& paths, KeyValueSource source_,
+Settings::Settings(const platform::linux_::Paths& paths_, KeyValueSource source_,
                    platform::linux_::FileSystem& files_, Hearth& hearth_)
-    : source(source_), path(settingsPath(paths, source_)), files(files_), hearth(hearth_) {}
+    : paths(paths_), source(source_), path(settingsPath(paths_, source_)), files(files_), hearth(hearth_) {}
 
-// Not through a SettingsFile, which would move a damaged file aside: to look must change nothing.
 Result<Dictionary> Settings::values(std::string& problem) const {
-  const auto text = platform::linux_::readFile(files, path, SettingsFile::sizeLimit);
-  if (!text) {
-    const std::string aside = path + ".damaged-1";
-    const bool isMissing = text.error() == std::errc::no_such_file_or_directory;
-    if (isMissing && !files.identity(aside)) return Dictionary();
-    // A running daemon still holds its last good contents, which a new file would take from it.
-    problem = isMissing ? "was damaged, and is now " + aside +
-                              ": mend that, remove its checksum line and move it back, or delete it"
-                        : text.error().message();
-    return text.error();
-  }
-  const auto document = platform::linux_::decodeSettings(*text, problem);
-  if (!document) return document.error();
-  const Dictionary& values = platform::linux_::settingsValues(*document);
-  return source == KeyValueSource::cloud ? platform::linux_::cloudValues(values) : values;
+  auto stored = storedValues(files, paths, source, problem);
+  if (stored || stored.error() == Outcome::malformedFile) return stored;
+  const std::string aside = path + ".damaged-1";
+  const bool isMissing = stored.error() == std::errc::no_such_file_or_directory;
+  if (isMissing && !files.identity(aside)) return Dictionary();
+  // A running daemon still holds its last good contents, which a new file would take from it.
+  problem = isMissing ? "was damaged, and is now " + aside +
+                            ": mend that, remove its checksum line and move it back, or delete it"
+                      : stored.error().message();
+  return stored;
 }
 
 Exit Settings::list(Output& output) const {

@@ -15,8 +15,6 @@
 
 namespace tools {
 
-std::string settingsPath(const platform::linux_::Paths& paths, pairwell::KeyValueSource source);
-
 // What a text means as "bool", "int", "double" or "string", or, without a type, as the first of them that it
 // is. Absent where it is none.
 std::optional<platform::Value> valueFromText(const std::string& text, const std::string& type);
@@ -26,7 +24,7 @@ platform::Result<platform::Dictionary> parseObject(std::string_view text, std::s
 
 class Settings {
  public:
-  // The last two outlive the object.
+  // All but `source` outlive the object.
   Settings(const platform::linux_::Paths& paths, pairwell::KeyValueSource source,
            platform::linux_::FileSystem& files, Hearth& hearth);
 
@@ -50,6 +48,7 @@ class Settings {
   platform::Result<void> install(const platform::Dictionary& before, const platform::Dictionary& after);
   platform::Result<void> installWhole(const platform::Dictionary& document);
 
+  const platform::linux_::Paths& paths;
   const pairwell::KeyValueSource source;
   const std::string path;
   platform::linux_::FileSystem& files;
