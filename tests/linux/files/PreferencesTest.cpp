@@ -44,9 +44,6 @@ TEST_F(PreferencesTest, OutsideChangeIsReportedOnceWithExactlyTheKeysThatDiffer)
   files.put(path, files.bytes(path));
   deliver();
   EXPECT_THAT(observer->take(), IsEmpty()) << "a not-a-number is itself";
-  files.put(path, "damage");
-  deliver();
-  EXPECT_THAT(observer->take(), IsEmpty());
 }
 
 TEST_F(PreferencesTest, ForeignChangeFirstMetInAnOwnWriteIsReportedLaterAndOnce) {
@@ -91,8 +88,7 @@ TEST_F(PreferencesTest, FailuresAreLoggedAndTheOldContentsStay) {
 
   neighbour->setValue(3, "a");
   files.unreadable.insert(path);
-  EXPECT_EQ(store->doubleForKey("a"), 1.0);
-  EXPECT_EQ(store->doubleForKey("a"), 1.0);
+  for (int read = 0; read < 2; ++read) EXPECT_EQ(store->doubleForKey("a"), 1.0);
   EXPECT_THAT(logged(), ElementsAre(HasSubstr(path + ": cannot be read: Permission denied")));
   FileRadixController root(files, path);
   EXPECT_EQ(root.readPrefKeys({"a"}).error(), std::errc::permission_denied);
