@@ -62,6 +62,7 @@ platform::Result<void> ServiceManager::start(std::function<void()> ready) {
   whenReady = std::move(ready);
   for (JobDescription& description : readJobs(files, paths.jobs(), paths.root))
     addJob(std::move(description));
+  if (allJobs.empty()) log().default_("%s: no jobs; hearthctl init lays out a device", paths.jobs());
   for (const auto& job : allJobs) job->start();
   startedAll = true;
   jobChanged();

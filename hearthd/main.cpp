@@ -6,6 +6,7 @@
 #include <systemd/sd-daemon.h>
 #include <unistd.h>
 
+#include <cstdio>
 #include <cstdlib>
 #include <filesystem>
 #include <optional>
@@ -28,6 +29,7 @@ using platform::linux_::UniqueDescriptor;
 
 constexpr int failed = 1;
 constexpr int wrongUsage = 2;
+constexpr const char* usage = "usage: hearthd [--root DIR]";
 
 // Empty for the system's folders.
 std::optional<std::string> rootFromArguments(int count, char** arguments) {
@@ -95,9 +97,10 @@ void announceReady() {
 }  // namespace
 
 int main(int count, char** arguments) {
+  if (count == 2 && std::string_view(arguments[1]) == "--help") return std::puts(usage), 0;
   const auto root = rootFromArguments(count, arguments);
   if (!root) {
-    say("usage: hearthd [--root DIR]\n");
+    say(std::string(usage) + "\n");
     return wrongUsage;
   }
   prepareProcess();

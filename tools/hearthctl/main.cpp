@@ -6,6 +6,7 @@
 
 #include "platform/linux/LinuxFileSystem.hpp"
 #include "platform/linux/Paths.hpp"
+#include "tools/CommandLine.hpp"
 #include "tools/Output.hpp"
 #include "tools/hearthctl/Check.hpp"
 #include "tools/hearthctl/Hearth.hpp"
@@ -17,9 +18,7 @@ namespace {
 using platform::linux_::HearthOperation;
 using tools::Exit;
 
-struct Options {
-  std::string root;
-  bool json = false;
+struct Options : tools::CommonOptions {
   tools::Device device{"", "21A5248v", false};
   std::string source, key, value, type;
   std::string name, stream;
@@ -123,22 +122,9 @@ Exit run(const std::string& command, const std::string& part, const Options& opt
 int main(int count, char** arguments) {
   Options options;
   CLI::App app("Operates hearthd and the settings of a device.", "hearthctl");
-  app.fallthrough();  // --json and --root may come last
-  app.require_subcommand(1);
-  app.add_option("--root", options.root, "the folder of the device; by default the system's")
-      ->envname("HEARTH_ROOT");
-  app.add_flag("--json", options.json, "print one JSON object a line");
-  app.failure_message([](const CLI::App*, const CLI::Error& error) {
-    return "hearthctl: " + std::string(error.what()) + "\n";
-  });
   addCommands(app, options);
-  try {
-    app.parse(count, arguments);
-  } catch (const CLI::ParseError& error) {
-    return app.exit(error) == 0 ? tools::done : tools::wrongUsage;
-  }
+  if (const auto exit = tools::parse(app, options, count, arguments)) return *exit;
 
-  if (options.root.size() > 1 && options.root.ends_with('/')) options.root.pop_back();
   tools::SayingLog log;
   platform::installLogSink(log);
   const CLI::App& command = *app.get_subcommands().front();

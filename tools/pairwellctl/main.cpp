@@ -7,6 +7,7 @@
 #include <utility>
 
 #include "pairwelld/service/RadixDistributedDebugLogging.hpp"
+#include "tools/CommandLine.hpp"
 #include "tools/Output.hpp"
 #include "tools/pairwellctl/Client.hpp"
 
@@ -19,10 +20,8 @@ using tools::Client;
 using tools::Exit;
 using tools::Output;
 
-struct Options {
-  std::string root;
+struct Options : tools::CommonOptions {
   double timeout = 5;
-  bool json = false;
   std::uint32_t status = 0;
   std::string state;
 };
@@ -109,18 +108,10 @@ Exit run(const CLI::App& command, Client& client, const Options& options) {
 
 int main(int count, char** arguments) {
   Options options;
-  CLI::App app("Reads and sets pairwelld's audio-accessory debug logging.");
-  app.fallthrough();  // --json and --root may come last
-  app.require_subcommand(1);
-  app.add_option("--root", options.root, "the folder of the device; by default the system's")
-      ->envname("HEARTH_ROOT");
+  CLI::App app("Reads and sets pairwelld's audio-accessory debug logging.", "pairwellctl");
   app.add_option("--timeout", options.timeout, "seconds to wait for an answer")
       ->capture_default_str()
       ->check(CLI::Range(0.001, 1e6));
-  app.add_flag("--json", options.json, "print one JSON object a line");
-  app.failure_message([](const CLI::App*, const CLI::Error& error) {
-    return "pairwellctl: " + std::string(error.what()) + "\n";
-  });
   app.add_subcommand("status", "print the logging status, its number and text")
       ->require_subcommand(0, 1)
       ->add_subcommand("set", "set the logging status")
@@ -131,11 +122,7 @@ int main(int count, char** arguments) {
       ->check(CLI::IsMember({"on", "off"}));
   app.add_subcommand("given-name", "print the current user's given name");
   app.add_subcommand("watch", "print the state whenever it has changed");
-  try {
-    app.parse(count, arguments);
-  } catch (const CLI::ParseError& error) {
-    return app.exit(error) == 0 ? tools::done : tools::wrongUsage;
-  }
+  if (const auto exit = tools::parse(app, options, count, arguments)) return *exit;
 
   Client client(platform::linux_::Paths::ofArgument(options.root),
                 std::chrono::milliseconds(std::llround(options.timeout * 1000)));
