@@ -3,22 +3,22 @@
 namespace tools {
 namespace {
 
-void pointToCommonOptions(CLI::App& app, const std::string& program) {
+void shareCommonOptions(CLI::App& app, const std::string& program) {
   for (CLI::App* command : app.get_subcommands([](const CLI::App*) { return true; })) {
+    command->fallthrough();
     command->footer("--root and --json: see " + program + " --help");
-    pointToCommonOptions(*command, program);
+    shareCommonOptions(*command, program);
   }
 }
 
 }  // namespace
 
 std::optional<Exit> parse(CLI::App& app, CommonOptions& options, int count, char** arguments) {
-  app.fallthrough();
   app.require_subcommand(1);
   app.add_option("--root", options.root, "the folder of the device; by default the system's")
       ->envname("HEARTH_ROOT");
   app.add_flag("--json", options.json, "print one JSON object a line");
-  pointToCommonOptions(app, app.get_name());
+  shareCommonOptions(app, app.get_name());
   try {
     app.parse(count, arguments);
   } catch (const CLI::RequiredError& error) {
