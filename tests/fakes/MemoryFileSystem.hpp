@@ -96,14 +96,8 @@ class MemoryFileSystem : public FileSystem {
     makeFolders(path);
     return {};
   }
-  Result<std::vector<std::string>> list(const std::string& folder) override {
-    if (const int error = check(folder)) return code(error);
-    std::vector<std::string> names;
-    for (const auto& [path, node] : now) {
-      if (parentOf(path) == folder) names.push_back(path.substr(folder.size() + 1));
-    }
-    return names;
-  }
+  // What lies in memory is never listed.
+  Result<std::vector<std::string>> list(const std::string&) override { return code(ENOSYS); }
   // One that is held cannot be waited for on a single thread.
   Result<std::unique_ptr<FileLock>> lock(const std::string& path) override {
     const int error = check(path);

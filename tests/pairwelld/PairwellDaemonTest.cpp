@@ -8,17 +8,6 @@ namespace {
 const std::string bootSession = "01234567-89AB-CDEF-0123-456789ABCDEF";
 
 struct PairwellDaemonTest : World {
-  // The whole program, until its loop has nothing left to do.
-  void launch() {
-    platform.cutSubscriptions.push_back([] {
-      const auto running = std::dynamic_pointer_cast<PairwellDaemon>(daemon());
-      if (!running) return;
-      dropSubscriptions(*running->keyValueStoreManager);
-      letGo(*running->debugManager());
-      daemon().reset();
-    });
-    EXPECT_EQ(runPairwellDaemon(), 0);
-  }
   static std::string textOfStop(const std::function<void()>& work) {
     try {
       work();
@@ -30,7 +19,7 @@ struct PairwellDaemonTest : World {
 };
 
 TEST_F(PairwellDaemonTest, LaunchesInOrderAndActivatesEverything) {
-  launch();
+  EXPECT_EQ(runPairwellDaemon(), 0);
   run();
   EXPECT_THAT(
       effects(Effects::log | Effects::store),
@@ -49,6 +38,9 @@ TEST_F(PairwellDaemonTest, LaunchesInOrderAndActivatesEverything) {
   const auto running = std::dynamic_pointer_cast<PairwellDaemon>(daemon());
   ASSERT_TRUE(running);
   EXPECT_EQ(running->conduitListener()->debugManager, running->debugManager());
+  dropSubscriptions(*running->keyValueStoreManager);
+  letGo(*running->debugManager());
+  daemon().reset();
 }
 
 struct LockableInfo : SystemInfo {

@@ -27,12 +27,10 @@ struct NotificationsTest : World {
     return callsAfterEvent("com.kestrel.tidingsd.matching", {{"Name", name}});
   }
   // Registered: it lives until it is unregistered.
-  TarnNotificationHelper& helper(const std::string& label, const Calls& names) {
+  void helper(const std::string& label, const Calls& names) {
     std::map<std::string, TarnNotificationHelper::Callback> handlers;
     for (const auto& name : names) handlers[name] = [this, label, name] { calls.push_back(label + name); };
-    const auto made = TarnNotificationHelper::create(handlers);
-    helpers.push_back(made);
-    return *made;
+    helpers.push_back(TarnNotificationHelper::create(handlers));
   }
 
   std::vector<std::weak_ptr<TarnNotificationHelper>> helpers;
@@ -42,7 +40,6 @@ TEST_F(NotificationsTest, SubscribersAreCalledInOrderUntilTheyHaveLeft) {
   const auto a = makeSubscriber("a"), b = makeSubscriber("b"), c = makeSubscriber("c");
   const auto first = alarms()->subscribe(a), second = alarms()->subscribe(b), third = alarms()->subscribe(c);
   const auto again = alarms()->subscribe(a);
-  EXPECT_FALSE(first == again);
   std::vector<std::optional<std::error_code>> results;
   a->onCall = [&] {
     a->onCall = nullptr;
@@ -96,18 +93,16 @@ TEST_F(NotificationsTest, AlarmsDropTheFractionAndRefuseWhatHasNoDate) {
               ElementsAre("notification default: Canceling alarm: x", "alarm x cleared"));
 }
 
-TEST_F(NotificationsTest, AHelperAnswersToItsNamesOnBothRoutes) {
+TEST_F(NotificationsTest, AHelperAnswersToItsNamesOnBothRoutesWhileRegistered) {
   const std::string channel = "daemon default: ", invoking = channel + "Invoking callback, notification, ",
                     matching =
                         channel + "On conduit event stream, com.kestrel.tidingsd.matching, notification ";
   TarnNotificationManager::shared()->setUp();
-  EXPECT_THAT(callsAfterMatch("a"), IsEmpty());
   helper("1", {"b", "a"});
-  EXPECT_THAT(log(), ElementsAre(matching + "a", channel + "Setup tarn callback handlers",
+  EXPECT_THAT(log(), ElementsAre(channel + "Setup tarn callback handlers",
                                  channel + "Setting up tarn callback handler for a",
                                  channel + "Setting up tarn callback handler for b"));
   helper("2", {"a"});
-  helper("none", {});
   mark();
   EXPECT_THAT(callsAfterMatch("a"), ElementsAre("1a", "2a"));
   EXPECT_THAT(callsAfterMatch("A"), IsEmpty());
@@ -117,16 +112,12 @@ TEST_F(NotificationsTest, AHelperAnswersToItsNamesOnBothRoutes) {
   EXPECT_THAT(calls, ElementsAre("1b"));
   EXPECT_THAT(log(), ElementsAre(matching + "a", invoking + "a", invoking + "a", matching + "A",
                                  channel + "Got tarn notification, b", invoking + "b"));
-}
-
-TEST_F(NotificationsTest, AHelperLivesAsLongAsItsRegistration) {
-  helper("1", {"b", "a"});
   mark();
   TarnNotificationManager::shared()->unregisterHelper(*helpers[0].lock());
   EXPECT_TRUE(helpers[0].expired());
-  EXPECT_THAT(log(), ElementsAre("daemon default: Remove tarn callback handler for a",
-                                 "daemon default: Remove tarn callback handler for b"));
-  EXPECT_TRUE(platform.named.registrations.empty());
+  EXPECT_THAT(log(), ElementsAre(channel + "Remove tarn callback handler for a",
+                                 channel + "Remove tarn callback handler for b"));
+  EXPECT_EQ(platform.named.registrations.size(), 1u);
 }
 
 }  // namespace
