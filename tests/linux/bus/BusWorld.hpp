@@ -29,8 +29,6 @@ inline std::string text(const std::string& value) {
 inline std::string answerTo(std::uint32_t serial) { return std::string("\5\1u\0", 4) + number(serial); }
 
 struct CallOptions {
-  std::string path = "/test";
-  std::string interface = "test.Interface";
   std::uint8_t flags = 0;
   std::uint32_t serial = 1;
 };
@@ -44,8 +42,8 @@ inline std::string callMessage(const std::string& member, const std::string& arg
     align(fields);
     fields += std::string{code, 1, type, 0} + value;
   };
-  add(1, 'o', text(options.path));
-  add(2, 's', text(options.interface));
+  add(1, 'o', text("/test"));
+  add(2, 's', text("test.Interface"));
   add(3, 's', text(member));
   add(8, 'g', std::string("\1s\0", 3));
   const std::string body = text(argument);
