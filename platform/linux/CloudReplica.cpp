@@ -4,6 +4,7 @@
 #include <tuple>
 #include <utility>
 
+#include "platform/UUID.hpp"
 #include "platform/linux/SettingsDocument.hpp"
 
 namespace platform::linux_ {
@@ -17,16 +18,25 @@ std::optional<std::int64_t> stampPart(const Dictionary& entry, std::string_view 
   return number && *number >= 0 && *number <= greatestStamp ? std::optional(*number) : std::nullopt;
 }
 
-CloudStamp greatestOf(const Dictionary& entries) {
-  CloudStamp greatest;
-  for (const auto& [key, value] : entries) {
-    if (const auto entry = CloudEntry::fromValue(value)) greatest = std::max(greatest, entry->stamp);
-  }
-  return greatest;
-}
-
 std::int64_t microsecondsOf(Time time) {
   return static_cast<std::int64_t>(std::clamp(time.count() * 1e6, 0.0, static_cast<double>(greatestStamp)));
+}
+
+// The stamp of a burst that begins with `write`: of now, behind everything that is known. Stamps of more than
+// a day ahead are some clock's fault, and are not followed, or that clock would rule the others for good;
+// only the value that is written over, which has to lose, draws its own along.
+CloudStamp nextStamp(const Dictionary& entries, const CloudWrite& write) {
+  constexpr std::int64_t day = 86'400'000'000;
+  const std::int64_t now = microsecondsOf(write.now);
+  std::int64_t next = now;
+  for (const auto& [key, value] : entries) {
+    const auto entry = CloudEntry::fromValue(value);
+    if (entry && entry->stamp.microseconds <= now + day) next = std::max(next, entry->stamp.microseconds + 1);
+  }
+  const auto there = CloudEntry::find(entries, write.key);
+  if (!there || there->stamp.microseconds < next) return {next, 0};
+  if (there->stamp.microseconds < greatestStamp) return {there->stamp.microseconds + 1, 0};
+  return {greatestStamp, there->stamp.tick + 1};
 }
 
 bool isEcho(const CloudWrite& write) {
@@ -91,6 +101,12 @@ bool CloudEntry::outranks(const CloudEntry& other) const {
   return describe(toValue()) > describe(other.toValue());
 }
 
+std::string cloudDeviceOf(Dictionary& document) {
+  Value& device = document["device"];
+  if (!device.as<std::string>()) device = UUID::random().text();
+  return *device.as<std::string>();
+}
+
 Dictionary cloudValues(const Dictionary& entries) {
   Dictionary values;
   for (const auto& [key, value] : entries) {
@@ -132,7 +148,7 @@ bool CloudBursts::write(Dictionary& entries, const CloudWrite& write) {
   expiring.clear();  // any other write, an echo too, ends what belongs to the expiry
   if (!joins(entries, write)) {
     if (isEcho(write)) return false;
-    stamp = {std::max(microsecondsOf(write.now), greatestOf(entries).microseconds + 1), 0};
+    stamp = nextStamp(entries, write);
   }
   lastWrite = write.now;
   return place(entries, write);

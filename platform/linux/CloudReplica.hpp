@@ -13,8 +13,8 @@
 namespace platform::linux_ {
 
 // A hybrid logical timestamp. Ordinary writes count in `microseconds` alone: the clock's, or one more than
-// the greatest that the replica knows. `tick` is left to expiries, which rank right after what they end and
-// before anything else.
+// the greatest that the replica knows, those left out that are more than a day ahead of the clock. `tick` is
+// left to expiries, which rank right after what they end and before anything else.
 struct CloudStamp {
   std::int64_t microseconds = 0;  // since 1970
   std::int64_t tick = 0;
@@ -37,6 +37,9 @@ struct CloudEntry {
   // A total order, but for equals: replicas must not differ for ever, even if two values carry one stamp.
   bool outranks(const CloudEntry& other) const;
 };
+
+// The name of the device that `document`, the whole replica, belongs to; made with its first write.
+std::string cloudDeviceOf(Dictionary& document);
 
 // The values that are there, tombstones left out.
 Dictionary cloudValues(const Dictionary& entries);

@@ -3,21 +3,9 @@
 #include <utility>
 
 #include "platform/LogSink.hpp"
-#include "platform/UUID.hpp"
 #include "platform/linux/SettingsDocument.hpp"
 
 namespace platform::linux_ {
-namespace {
-
-// The device's name, made with its first write.
-std::string deviceOf(Dictionary& document) {
-  Value& device = document["device"];
-  if (!device.as<std::string>()) device = UUID::random().text();
-  return *device.as<std::string>();
-}
-
-}  // namespace
-
 std::shared_ptr<ReplicaFileCloudStore> ReplicaFileCloudStore::create(FileSystem& files, WorkQueue* delivery,
                                                                      NotificationCentre& centre, Clock& clock,
                                                                      std::string path) {
@@ -62,7 +50,7 @@ Result<void> ReplicaFileCloudStore::write(const std::optional<Value>& value, std
   CloudBursts next = bursts;
   bool changed = false;
   const auto written = file->update([&](Dictionary& document) {
-    write.device = deviceOf(document);
+    write.device = cloudDeviceOf(document);
     write.now = clock.now();
     return changed = next.write(settingsValues(document), write);
   });
@@ -77,7 +65,7 @@ Result<void> ReplicaFileCloudStore::write(const std::optional<Value>& value, std
 
 Result<void> ReplicaFileCloudStore::replaceValues(const Dictionary& values) {
   return file->update([&](Dictionary& document) {
-    const std::string device = deviceOf(document);
+    const std::string device = cloudDeviceOf(document);
     Dictionary& entries = settingsValues(document);
     CloudBursts own;
     bool changed = false;

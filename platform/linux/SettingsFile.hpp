@@ -27,7 +27,7 @@ class SettingsFile : public std::enable_shared_from_this<SettingsFile> {
   // On the delivery thread, no lock held.
   using Changed = std::function<void(const Dictionary& before, const Dictionary& after)>;
 
-  static constexpr std::size_t sizeLimit = 1 << 20;  // a thousand times what a store holds
+  static constexpr std::size_t sizeLimit = 4 << 20;  // four times what an account may hold
 
   // `files` outlives the object.
   static std::shared_ptr<SettingsFile> create(FileSystem& files, std::string path);

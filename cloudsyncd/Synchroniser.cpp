@@ -1,0 +1,253 @@
+#include "cloudsyncd/Synchroniser.hpp"
+
+#include <algorithm>
+#include <utility>
+
+#include "cloudsyncd/core/Document.hpp"
+#include "cloudsyncd/core/Replica.hpp"
+#include "platform/LogSink.hpp"
+#include "platform/linux/CloudReplica.hpp"
+#include "platform/linux/SettingsDocument.hpp"
+
+namespace cloudsync {
+namespace {
+
+using platform::CloudStore;
+using platform::Dictionary;
+using platform::Outcome;
+using platform::Result;
+using platform::linux_::mergeCloudEntries;
+using platform::linux_::settingsValues;
+
+// A disk that is full is not free a moment later, and one who has freed it wants to see it noticed.
+constexpr std::chrono::milliseconds shortestDelay{1000};
+constexpr std::chrono::milliseconds longestDelay{60'000};
+
+const platform::Logger& log() {
+  static const platform::Logger logger = platform::hearthLog("cloud");
+  return logger;
+}
+
+}  // namespace
+
+Synchroniser::Synchroniser(Surroundings surroundings)
+    : around(std::move(surroundings)), delay(shortestDelay) {}
+
+void Synchroniser::connected() {
+  isConnected = true;
+  problem.clear();
+  disconnectedSince.reset();
+  std::erase_if(devices, [this](const auto& entry) { return !seen.contains(entry.first); });
+  log().default_("connected to account %s", around.account);
+  takeIn();
+}
+
+void Synchroniser::disconnected(const std::string& problem_) {
+  isConnected = false;
+  isPublishing = false;
+  seen.clear();
+  if (!disconnectedSince) disconnectedSince = around.wall.now();
+  if (std::exchange(problem, problem_) != problem_) log().error("not connected: %s", problem);
+  settle(problem);
+}
+
+void Synchroniser::received(const std::string& name, std::string_view text) {
+  seen.insert(name);
+  std::string why;
+  auto document = decodeDocument(text, around.account, name, why);
+  if (!document) return refuse(name, why);
+  Device& device = devices[name];
+  device.problem.clear();
+  device.entries = std::move(document->entries);
+  const auto replica = around.replica.contents();
+  if (name == ownDevice() && document->writer != around.writer && !isOwnWriter(*replica, document->writer) &&
+      !std::exchange(isForeign, true)) {
+    log().error(
+        "somebody else publishes under this device's name: it is a copy of another's disk, or was restored "
+        "from a "
+        "backup. It goes on reading, and publishes again after: hearthctl cloud new-identity");
+  }
+  // What comes before the connection stands is taken in as one.
+  if (isConnected) takeIn(device.entries);
+}
+
+void Synchroniser::unreadable(const std::string& device, const std::string& why) {
+  seen.insert(device);
+  refuse(device, why);
+}
+
+void Synchroniser::refuse(const std::string& device, const std::string& why) {
+  if (std::exchange(devices[device].problem, why) != why) {
+    log().error("the document of device %s is refused: %s", device, why);
+  }
+}
+
+void Synchroniser::removed(const std::string& device) {
+  devices.erase(device);
+  publishIfNews();
+}
+
+Dictionary Synchroniser::allDocuments() const {
+  Dictionary all;
+  for (const auto& [name, device] : devices) mergeCloudEntries(device.entries, all);
+  return all;
+}
+
+std::string Synchroniser::ownDevice() const {
+  const auto* device = platform::find<std::string>(*around.replica.contents(), "device");
+  return device ? *device : "";
+}
+
+void Synchroniser::takeIn() {
+  takeIn(allDocuments());
+  if (!retry) publishIfNews();
+}
+
+void Synchroniser::takeIn(const Dictionary& entries) {
+  bool changed = false;
+  std::error_code refused;
+  auto written = around.replica.update([&](Dictionary& replica) {
+    const auto answer = change(replica, entries);
+    if (!answer) refused = answer.error();
+    return changed = answer && *answer;
+  });
+  if (refused) written = refused;
+  if (!written) return retryLater("the replica cannot be written", written.error());
+  retry.reset();
+  delay = shortestDelay;
+  failure.clear();
+  if (changed) lastIn = around.wall.now();
+  settle("");
+}
+
+// Whether it changes the replica.
+Result<bool> Synchroniser::change(Dictionary& replica, const Dictionary& entries) {
+  if (!knownDevice.empty() && !replica.contains("device")) replica["device"] = knownDevice;
+  knownDevice = platform::linux_::cloudDeviceOf(replica);
+  const auto account = accountOf(replica);
+  if (account == around.account) return mergeCloudEntries(entries, settingsValues(replica));
+  if (around.changing) {
+    if (const auto allowed = around.changing(); !allowed) return allowed.error();
+  }
+  if (!account) {
+    join(replica, around.account, allDocuments());
+  } else {
+    if (const auto kept = keepAside(replica, *account); !kept) return kept.error();
+    changeAccount(replica, around.account, allDocuments());
+  }
+  return true;
+}
+
+Result<void> Synchroniser::keepAside(const Dictionary& replica, const std::string& account) {
+  const auto text = platform::linux_::encodeSettings(replica);
+  return text ? platform::linux_::replaceFile(around.files, around.path + ".account-" + account, *text)
+              : Result<void>(text.error());
+}
+
+void Synchroniser::replicaChanged(const Dictionary& before, const Dictionary& after) {
+  if (accountOf(after) != around.account) {
+    // Deleted under us. Published as it is, the empty one would read as "off" everywhere.
+    if (isConnected) takeIn();
+    return;
+  }
+  const bool isNewDevice = platform::valueOf(before, "device") != platform::valueOf(after, "device");
+  if (isNewDevice) isForeign = false;
+  if (isNewDevice || settingsValues(before) != settingsValues(after)) pacing.written(around.steady());
+}
+
+void Synchroniser::publishIfNews() {
+  const auto replica = around.replica.contents();
+  if (accountOf(*replica) == around.account && !newsIn(settingsValues(*replica), allDocuments()).empty()) {
+    pacing.written(around.steady());
+  }
+}
+
+std::optional<Steady> Synchroniser::deadline() const {
+  const bool canPublish = isConnected && !isPublishing && !isForeign;
+  const auto send = canPublish ? pacing.deadline() : std::nullopt;
+  if (!send || !retry) return send ? send : retry;
+  return std::max(*send, *retry);  // what cannot be written cannot be published either
+}
+
+void Synchroniser::timePassed() {
+  const auto due = deadline();
+  if (!due || around.steady() < *due) return;
+  if (std::exchange(retry, std::nullopt) && isConnected) takeIn();
+  if (!retry && isConnected && !isPublishing && !isForeign && pacing.deadline()) publish();
+}
+
+void Synchroniser::publish() {
+  const auto text = encode();
+  if (!text) {
+    if (text.error() == Outcome::tooLarge) return exceedsQuota();
+    return retryLater("nothing can be published", text.error());
+  }
+  pacing.sent();
+  isPublishing = true;
+  around.transport.publish(ownDevice(), *text);
+}
+
+// The replica as a document; before, the file has to know its writer.
+Result<std::string> Synchroniser::encode() {
+  Result<std::string> text{std::string()};
+  const auto written = around.replica.update([&](Dictionary& replica) {
+    const std::string device = platform::linux_::cloudDeviceOf(replica);
+    underWay = settingsValues(std::as_const(replica));
+    text = encodeDocument({around.account, device, around.writer, underWay});
+    if (!text || isOwnWriter(replica, around.writer)) return false;
+    addWriter(replica, around.writer);
+    return true;
+  });
+  return written ? text : Result<std::string>(written.error());
+}
+
+void Synchroniser::published(const std::error_code& error) {
+  isPublishing = false;
+  if (error == std::errc::message_size) return exceedsQuota();
+  if (error) {
+    pacing.written(around.steady());
+    return retryLater("nothing can be published", error);
+  }
+  lastOut = around.wall.now();
+  isOverQuota = false;
+  delay = shortestDelay;
+  failure.clear();
+  devices[ownDevice()] = {std::exchange(underWay, {}), ""};
+}
+
+// What was written stays here, until another write makes it smaller.
+void Synchroniser::exceedsQuota() {
+  pacing.sent();
+  if (std::exchange(isOverQuota, true)) return;
+  log().error("the settings exceed what an account may hold: the change stays on this device");
+  const auto told = around.replica.update([](Dictionary& replica) {
+    giveReason(replica, CloudStore::ChangeReason::quotaViolation);
+    return true;
+  });
+  if (!told) log().error("%s: %s", around.path, told.error().message());
+}
+
+void Synchroniser::retryLater(const std::string& what, const std::error_code& error) {
+  const std::string text = what + ": " + error.message();
+  if (std::exchange(failure, text) != text) log().error("%s", text);
+  retry = around.steady() + delay;
+  delay = std::min(delay * 2, longestDelay);
+  settle(text);
+}
+
+void Synchroniser::settle(const std::string& text) {
+  if (!std::exchange(isSettled, true) && around.settled) around.settled(text);
+}
+
+Synchroniser::Status Synchroniser::status() const {
+  Status status{isConnected, problem, disconnectedSince, lastOut, lastIn, {}, ownDevice(), devices};
+  status.waiting = newsIn(settingsValues(*around.replica.contents()), allDocuments());
+  if (!isConnected) return status;
+  if (isForeign)
+    status.problem = "another device publishes under this one's name: hearthctl cloud new-identity";
+  if (isOverQuota) status.problem = "the settings exceed what an account may hold";
+  if (!failure.empty()) status.problem = failure;
+  return status;
+}
+
+}  // namespace cloudsync
