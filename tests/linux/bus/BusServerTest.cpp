@@ -1,7 +1,6 @@
 // Clients that do what they should not, and what the others notice of it: nothing.
 #include "platform/linux/BusServer.hpp"
 
-#include <poll.h>
 #include <sys/resource.h>
 #include <sys/wait.h>
 
@@ -41,11 +40,6 @@ TEST_F(BusServerTest, CallsThatDoNotFitGetAnErrorAndNoMore) {
   Wire wire = client();
   for (const auto& [message, answer] : rows) EXPECT_TRUE(wire.send(message) && wire.reads(answer)) << answer;
   EXPECT_THAT(calls, ElementsAre("text"));
-
-  ASSERT_TRUE(wire.send(callMessage("Echo", "", {.flags = noReplyExpected, .serial = 2}) +
-                        callMessage("Echo", "", {.serial = 3})));
-  EXPECT_TRUE(wire.reads(answerTo(3)));
-  EXPECT_THAT(wire.received, Not(HasSubstr(answerTo(2))));
 }
 
 TEST_F(BusServerTest, DamageEndsItsClientAloneAndIsNotReadOn) {
@@ -84,7 +78,7 @@ TEST_F(BusServerTest, PipelinedCallsAreAnsweredAsTheyAreCompletedThoughTheClient
   constexpr std::uint32_t count = 1000;
   std::string unsent;
   for (std::uint32_t serial = 1; serial <= count; ++serial)
-    unsent += callMessage("Hold", std::to_string(serial), {.serial = serial});
+    unsent += callMessage("Hold", std::to_string(serial), serial);
   Wire wire = client();
   std::mt19937 random(7);
   std::vector<std::string> completed;
@@ -107,9 +101,9 @@ TEST_F(BusServerTest, PipelinedCallsAreAnsweredAsTheyAreCompletedThoughTheClient
 TEST_F(BusServerTest, TheLastCallOfAClientThatHasGoneIsHandled) {
   // A process that is gone before it is even admitted.
   decides = false;
-  const std::string ahead = std::string(handshakeAhead) +
-                            callMessage("Echo", "one", {.flags = noReplyExpected}) +
-                            callMessage("Echo", "another", {.flags = noReplyExpected});
+  const std::string large(10'000, 'x');  // two are more than is read in one turn
+  const std::string ahead =
+      std::string(handshakeAhead) + callMessage("Hold", large) + callMessage("Echo", large);
   const pid_t child = ::fork();
   if (child == 0) ::_exit(Wire(path).send(ahead) ? 0 : 1);
   ASSERT_TRUE(waitFor([&] { return undecided.size() == 1; }));
@@ -118,7 +112,7 @@ TEST_F(BusServerTest, TheLastCallOfAClientThatHasGoneIsHandled) {
   EXPECT_EQ(status, 0);
   undecided.front()(admission());
   EXPECT_TRUE(waitFor([&] { return closed == 1; }));
-  EXPECT_THAT(calls, ElementsAre("one", "another"));
+  EXPECT_EQ(calls.size(), 2u);
 }
 
 TEST_F(BusServerTest, UnreadSignalsMergeByKeyAndKeepTheirOrder) {
@@ -172,8 +166,7 @@ TEST_F(BusServerTest, NothingWakesAServerThatNoLongerListens) {
   server->stopListening();
   const Wire wire = connect();  // the service manager's socket takes it
   turn();
-  pollfd entry{server->descriptor(), POLLIN, 0};
-  EXPECT_EQ(::poll(&entry, 1, 0), 0);
+  EXPECT_FALSE(isAwake());
 }
 
 TEST_F(BusServerTest, AtTheDescriptorLimitClientsWaitUntilOthersEnd) {
@@ -183,8 +176,7 @@ TEST_F(BusServerTest, AtTheDescriptorLimitClientsWaitUntilOthersEnd) {
   while (wires.size() < clients) wires.push_back(connect());
   for (std::size_t count = 0; count < clients; ++count) turn();
   EXPECT_LT(connections.size(), clients);
-  pollfd entry{server->descriptor(), POLLIN, 0};
-  EXPECT_EQ(::poll(&entry, 1, 0), 0) << "nor do they wake it";
+  EXPECT_FALSE(isAwake()) << "nor do they wake it";
   // Each one that ends lets the next one in.
   for (Wire& wire : wires) {
     wire.shakeHands();

@@ -3,6 +3,7 @@
 
 #include <gmock/gmock.h>
 #include <gtest/gtest.h>
+#include <poll.h>
 
 #include <cerrno>
 
@@ -15,7 +16,6 @@ using fakes::deadline;
 using fakes::eventually;
 using fakes::TemporaryFolder;
 inline constexpr std::chrono::hours never{1};
-inline constexpr std::uint8_t noReplyExpected = 1;
 // A client's whole handshake, as libraries send it ahead.
 inline constexpr std::string_view handshakeAhead{"\0AUTH EXTERNAL\r\nDATA\r\nBEGIN\r\n", 29};
 
@@ -28,14 +28,9 @@ inline std::string text(const std::string& value) {
 }
 inline std::string answerTo(std::uint32_t serial) { return std::string("\5\1u\0", 4) + number(serial); }
 
-struct CallOptions {
-  std::uint8_t flags = 0;
-  std::uint32_t serial = 1;
-};
-
 // A method call with a text as its argument, written by hand: libraries refuse to make bad ones.
 inline std::string callMessage(const std::string& member, const std::string& argument,
-                               const CallOptions& options = {}) {
+                               std::uint32_t serial = 1) {
   const auto align = [](std::string& bytes) { bytes.resize((bytes.size() + 7) / 8 * 8); };
   std::string fields;
   const auto add = [&](char code, char type, const std::string& value) {
@@ -47,8 +42,8 @@ inline std::string callMessage(const std::string& member, const std::string& arg
   add(3, 's', text(member));
   add(8, 'g', std::string("\1s\0", 3));
   const std::string body = text(argument);
-  std::string message{'l', 1, static_cast<char>(options.flags), 1};
-  message += number(static_cast<std::uint32_t>(body.size())) + number(options.serial) +
+  std::string message{'l', 1, 0, 1};
+  message += number(static_cast<std::uint32_t>(body.size())) + number(serial) +
              number(static_cast<std::uint32_t>(fields.size())) + fields;
   align(message);
   return message + body;
@@ -137,8 +132,12 @@ struct World : testing::Test {
     });
   }
 
+  bool isAwake() const {
+    pollfd entry{server->descriptor(), POLLIN, 0};
+    return ::poll(&entry, 1, 0) == 1;
+  }
   void turn() {
-    if (server) server->dispatch();
+    if (server && isAwake()) server->dispatch();
   }
   bool waitFor(const std::function<bool()>& condition) {
     return eventually([&] { return turn(), condition(); });
