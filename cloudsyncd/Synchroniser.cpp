@@ -150,9 +150,8 @@ void Synchroniser::replicaChanged(const Dictionary& before, const Dictionary& af
     if (isConnected) takeIn();
     return;
   }
-  const bool isNewDevice = platform::valueOf(before, "device") != platform::valueOf(after, "device");
-  if (isNewDevice) isForeign = false;
-  if (isNewDevice || settingsValues(before) != settingsValues(after)) pacing.written(around.steady());
+  if (platform::valueOf(before, "device") != platform::valueOf(after, "device")) isForeign = false;
+  publishIfNews();
 }
 
 void Synchroniser::publishIfNews() {

@@ -146,6 +146,25 @@ TEST(CloudReplicaTest, ExpiryRanksRightAfterTheSwitchThatItEnds) {
   EXPECT_TRUE(home.write("flagExpiration", std::nullopt));
 }
 
+TEST(CloudReplicaTest, AClockThatIsYearsAheadIsOverruledAndNotFollowed) {
+  Device ahead("ahead"), sane("sane");
+  ahead.now = Time(1e8);
+  ahead.switchOn(2e8);
+  sane.exchange(ahead);
+  sane.write("other", 1);
+  EXPECT_EQ(sane.stamp("other").microseconds, 1'000'000'000);
+  sane.now += Time(1);
+  sane.switchOff();
+  EXPECT_EQ(sane.stamp("flagExpiration"), sane.stamp("flag"));
+  ahead.exchange(sane);
+  EXPECT_EQ(ahead.values(), R"(["flag": false, "other": 1])");
+  for (const char* key : {"flag", "flagExpiration"}) ahead.read(key);
+  ahead.now = sane.now = Time(2000);  // mended
+  ahead.switchOn(5000);
+  sane.exchange(ahead);
+  EXPECT_EQ(sane.values(), R"(["flag": true, "flagExpiration": 5000.0, "other": 1])");
+}
+
 TEST(CloudReplicaTest, WhatIsNoEntryIsSkipped) {
   const Dictionary good{{"value", 1}, {"time", 5}, {"tick", 0}, {"device", "d"}};
   for (const auto& [name, value] : Dictionary{{"time", -1}, {"tick", "0"}, {"removed", true}}) {

@@ -1,0 +1,243 @@
+#include "cloudsyncd/Synchroniser.hpp"
+
+#include "cloudsyncd/core/Document.hpp"
+#include "cloudsyncd/core/Replica.hpp"
+#include "platform/linux/CloudReplica.hpp"
+#include "platform/linux/ReplicaFileCloudStore.hpp"
+#include "platform/linux/SettingsDocument.hpp"
+#include "tests/linux/files/World.hpp"
+
+namespace cloudsync {
+namespace {
+
+using platform::Dictionary;
+using platform::Value;
+using platform::linux_::settingsValues;
+using testing::ElementsAre;
+using testing::IsEmpty;
+
+struct FakeTransport : Transport {
+  void start(TransportClient&) override {}
+  void publish(const std::string& device, std::string document) override {
+    sent.emplace_back(device, std::move(document));
+  }
+  platform::Result<void> forget(const std::string&) override { return {}; }
+  std::optional<Steady> deadline() const override { return std::nullopt; }
+  void timePassed(Steady) override {}
+
+  std::vector<std::pair<std::string, std::string>> sent;
+};
+
+Value entry(Value value, std::int64_t time, const std::string& device = "peer") {
+  return platform::linux_::CloudEntry{std::move(value), {time, 0}, device}.toValue();
+}
+
+// A device of the account "home", its cloud store, and cloudsyncd on the same file.
+struct SynchroniserTest : platform::linux_::World {
+  SynchroniserTest() {
+    replica->startWatching(*device.delivery, [this](const Dictionary& before, const Dictionary& after) {
+      synchroniser.replicaChanged(before, after);
+    });
+  }
+
+  static std::string document(const std::string& name, const Dictionary& entries,
+                              const std::string& writer = "w") {
+    return *encodeDocument({"home", name, writer, entries});
+  }
+  void connect() {
+    synchroniser.connected();
+    deliver();
+  }
+  void write(const std::string& key, const Value& value) {
+    store->setValue(value, key);
+    deliver();
+  }
+  // Time passes to the next deadline; what was published since, if anything.
+  std::optional<Document> publishNext() {
+    if (const auto due = synchroniser.deadline()) now = *due;
+    synchroniser.timePassed();
+    if (transport.sent.empty()) return std::nullopt;
+    const auto [name, text] = transport.sent.back();
+    transport.sent.clear();
+    std::string problem;
+    const auto sent = decodeDocument(text, "home", name, problem);
+    EXPECT_TRUE(sent) << problem;
+    synchroniser.published({});
+    return *sent;
+  }
+  Dictionary whole() { return *replica->contents(); }
+  std::string values() { return platform::describe(store->dictionaryRepresentation()); }
+  void make(Dictionary contents) {
+    files.put(path, *platform::linux_::encodeSettings(contents));
+    deliver();
+  }
+
+  Steady now;
+  FakeTransport transport;
+  const std::shared_ptr<platform::linux_::ReplicaFileCloudStore> store =
+      platform::linux_::ReplicaFileCloudStore::create(files, device.delivery.get(), device.centre,
+                                                      device.manualClock, path);
+  const std::shared_ptr<platform::linux_::SettingsFile> replica =
+      platform::linux_::SettingsFile::create(files, path);
+  std::optional<std::string> settled;
+  Synchroniser synchroniser{{files, path, *replica, transport, device.manualClock, [this] { return now; },
+                             "home", "writer", [] { return platform::Result<void>(); },
+                             [this](const std::string& problem) { settled = problem; }}};
+};
+
+TEST_F(SynchroniserTest, FirstDownloadWinsAndPairsStayTogether) {
+  write("flag", true);
+  write("flagExpiration", 9e9);
+  write("own", 1);
+  synchroniser.received("peer", document("peer", {{"flag", entry(false, 1)}}));
+  EXPECT_FALSE(settled);
+  connect();
+  EXPECT_EQ(settled, "");
+  EXPECT_EQ(values(), R"(["flag": false, "own": 1])");
+  EXPECT_EQ(whole().at("reason"), Value(1));
+  const auto sent = publishNext();
+  ASSERT_TRUE(sent) << "the account lacks \"own\"";
+  EXPECT_EQ(sent->entries.size(), 2u);
+  EXPECT_THAT(synchroniser.status().waiting, IsEmpty());
+  EXPECT_FALSE(synchroniser.deadline());
+}
+
+TEST_F(SynchroniserTest, PublishesOwnWritesTogetherAndNothingThatItMerged) {
+  connect();
+  EXPECT_FALSE(publishNext()) << "there is nothing to tell";
+  synchroniser.received("peer", document("peer", {{"theirs", entry(1, 1)}}));
+  deliver();
+  EXPECT_EQ(values(), R"(["theirs": 1])");
+  EXPECT_FALSE(synchroniser.deadline());
+  for (int count = 0; count < 30; ++count) {
+    write("key", count);
+    synchroniser.timePassed();
+    EXPECT_EQ(transport.sent.size(), count * 20 >= 500 ? 1u : 0u) << count;
+    if (!transport.sent.empty()) break;
+    now += std::chrono::milliseconds(20);
+  }
+  synchroniser.disconnected("away");  // takes what is under way with it
+  write("later", 1);
+  EXPECT_FALSE(synchroniser.deadline());
+  synchroniser.received("peer", document("peer", {{"theirs", entry(1, 1)}}));
+  connect();
+  transport.sent.clear();
+  const auto sent = publishNext();
+  ASSERT_TRUE(sent);
+  EXPECT_EQ(platform::linux_::cloudValues(sent->entries).at("later"), Value(1));
+}
+
+TEST_F(SynchroniserTest, RefusesBadDocumentsWithOneLineEach) {
+  make({{"account", "home"}, {"device", "me"}});
+  connect();
+  logged();
+  const std::string good = document("peer", {{"key", entry(1, 5)}});
+  const auto with = [&](const std::string& from, const std::string& to) {
+    std::string text = good;
+    text.replace(text.find(from), from.size(), to);
+    const auto fields = platform::linux_::decodeEditedSettings(text, text);
+    return *platform::linux_::encodeSettings(*fields);
+  };
+  const std::pair<std::string, const char*> cases[] = {
+      {good.substr(0, good.size() / 2), "line"},
+      {with("\"format\": 1", "\"format\": 2"), "its format version is not 1"},
+      {with("\"home\"", "\"work\""), "it is of another account"},
+      {document("other", {}), "it is of another device"},
+      {std::string(documentBytes + 1, ' '), "larger than 1048576 bytes"},
+      {std::string(100'000, '['), "line 1"},
+  };
+  for (const auto& [text, cause] : cases) {
+    synchroniser.received("peer", text);
+    synchroniser.received("peer", text);
+    const auto lines = logged();
+    ASSERT_EQ(lines.size(), 1u) << cause;
+    EXPECT_THAT(lines[0], testing::AllOf(testing::HasSubstr("device peer"), testing::HasSubstr(cause)));
+  }
+  EXPECT_EQ(values(), "[:]");
+  synchroniser.received("peer", with("\"time\": 5", "\"time\": \"5\""));
+  EXPECT_EQ(values(), "[:]");
+  synchroniser.received("peer", good);
+  EXPECT_EQ(values(), R"(["key": 1])");
+}
+
+TEST_F(SynchroniserTest, KeepsWhatExceedsTheQuotaHereAndSaysSoOnce) {
+  Dictionary entries;
+  for (std::size_t key = 0; key < documentKeys; ++key) entries[std::to_string(key)] = entry(1, 1, "me");
+  make({{"account", "home"}, {"device", "me"}, {"values", entries}});
+  connect();
+  EXPECT_TRUE(publishNext());
+  write("more", 1);
+  EXPECT_FALSE(publishNext());
+  EXPECT_EQ(whole().at("reason"), Value(2));
+  const Value sequence = whole().at("reasonSequence");
+  write("still more", 1);
+  EXPECT_FALSE(publishNext());
+  EXPECT_EQ(whole().at("reasonSequence"), sequence);
+  EXPECT_THAT(synchroniser.status().waiting, ElementsAre("more", "still more"));
+  EXPECT_THAT(synchroniser.status().problem, testing::HasSubstr("exceed"));
+  for (const char* key : {"0", "1"}) store->setValue(std::nullopt, key);
+  deliver();
+  EXPECT_TRUE(publishNext());
+  EXPECT_EQ(synchroniser.status().problem, "");
+}
+
+TEST_F(SynchroniserTest, ACopyOfTheDiskStopsPublishingUntilItHasANameOfItsOwn) {
+  make({{"account", "home"}, {"device", "me"}, {"writers", platform::List{"former"}}});
+  synchroniser.received("me", document("me", {{"key", entry(1, 5)}}, "former"));
+  connect();
+  write("key", 2);
+  EXPECT_TRUE(publishNext());
+  synchroniser.received("me", document("me", {{"key", entry(3, 1'000'000'000'000)}}, "stranger"));
+  deliver();
+  EXPECT_EQ(values(), R"(["key": 3])");
+  write("key", 4);
+  EXPECT_FALSE(publishNext());
+  EXPECT_THAT(synchroniser.status().problem, testing::HasSubstr("new-identity"));
+  EXPECT_TRUE(platform::linux_::SettingsFile::create(files, path)->update([](Dictionary& document) {
+    makeNewIdentity(document);
+    return true;
+  }));
+  deliver();
+  const auto sent = publishNext();
+  ASSERT_TRUE(sent);
+  EXPECT_NE(sent->device, "me");
+}
+
+TEST_F(SynchroniserTest, AnotherAccountIsSwappedInWholeAndTheOldOneKept) {
+  make({{"account", "work"}, {"device", "me"}, {"values", Dictionary{{"old", entry(1, 9)}}}});
+  synchroniser.received("peer", document("peer", {{"new", entry(1, 1)}}));
+  connect();
+  EXPECT_EQ(values(), R"(["new": 1])");
+  EXPECT_EQ(whole().at("reason"), Value(3));
+  std::string problem;
+  const auto kept = platform::linux_::decodeSettings(files.bytes(path + ".account-work"), problem);
+  ASSERT_TRUE(kept) << problem;
+  EXPECT_TRUE(settingsValues(*kept).contains("old"));
+  EXPECT_FALSE(publishNext()) << "nothing of the old account is mixed in";
+}
+
+TEST_F(SynchroniserTest, AFullDiskAndALostReplicaHealByThemselves) {
+  make({{"account", "home"}, {"device", "me"}});
+  connect();
+  logged();
+  files.failFrom = 0;
+  synchroniser.received("peer", document("peer", {{"key", entry(1, 5)}}));
+  ASSERT_TRUE(synchroniser.deadline());
+  now = *synchroniser.deadline();
+  synchroniser.timePassed();
+  EXPECT_EQ(logged().size(), 2u) << "the reading and the writing, each once";
+  files.failFrom = std::numeric_limits<int>::max();
+  now = *synchroniser.deadline();
+  synchroniser.timePassed();
+  EXPECT_EQ(values(), R"(["key": 1])");
+  EXPECT_FALSE(synchroniser.deadline());
+
+  EXPECT_TRUE(files.remove(path));
+  deliver();
+  EXPECT_EQ(values(), R"(["key": 1])");
+  EXPECT_EQ(whole().at("device"), Value("me"));
+  EXPECT_THAT(transport.sent, IsEmpty());
+}
+
+}  // namespace
+}  // namespace cloudsync
