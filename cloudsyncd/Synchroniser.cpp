@@ -19,10 +19,6 @@ using platform::Result;
 using platform::linux_::mergeCloudEntries;
 using platform::linux_::settingsValues;
 
-// A disk that is full is not free a moment later, and one who has freed it wants to see it noticed.
-constexpr std::chrono::milliseconds shortestDelay{1000};
-constexpr std::chrono::milliseconds longestDelay{60'000};
-
 const platform::Logger& log() {
   static const platform::Logger logger = platform::hearthLog("cloud");
   return logger;
@@ -30,13 +26,13 @@ const platform::Logger& log() {
 
 }  // namespace
 
-Synchroniser::Synchroniser(Surroundings surroundings)
-    : around(std::move(surroundings)), delay(shortestDelay) {}
+Synchroniser::Synchroniser(Surroundings surroundings) : around(std::move(surroundings)) {}
 
 void Synchroniser::connected() {
   isConnected = true;
   problem.clear();
   disconnectedSince.reset();
+  sending.succeeded();  // what failed on the former connection says nothing of this one
   std::erase_if(devices, [this](const auto& entry) { return !seen.contains(entry.first); });
   log().default_("connected to account %s", around.account);
   takeIn();
@@ -100,7 +96,7 @@ std::string Synchroniser::ownDevice() const {
 
 void Synchroniser::takeIn() {
   takeIn(allDocuments());
-  if (!retry) publishIfNews();
+  publishIfNews();
 }
 
 void Synchroniser::takeIn(const Dictionary& entries) {
@@ -112,18 +108,21 @@ void Synchroniser::takeIn(const Dictionary& entries) {
     return changed = answer && *answer;
   });
   if (refused) written = refused;
-  if (!written) return retryLater("the replica cannot be written", written.error());
-  retry.reset();
-  delay = shortestDelay;
-  failure.clear();
+  if (!written) return fail(taking, "the replica cannot be written", written.error());
+  taking.succeeded();
   if (changed) lastIn = around.wall.now();
   settle("");
 }
 
+// The name outlives a replica that is deleted under us.
+std::string Synchroniser::nameDevice(Dictionary& replica) {
+  if (!knownDevice.empty() && !replica.contains("device")) replica["device"] = knownDevice;
+  return knownDevice = platform::linux_::cloudDeviceOf(replica);
+}
+
 // Whether it changes the replica.
 Result<bool> Synchroniser::change(Dictionary& replica, const Dictionary& entries) {
-  if (!knownDevice.empty() && !replica.contains("device")) replica["device"] = knownDevice;
-  knownDevice = platform::linux_::cloudDeviceOf(replica);
+  nameDevice(replica);
   const auto account = accountOf(replica);
   if (account == around.account) return mergeCloudEntries(entries, settingsValues(replica));
   if (around.changing) {
@@ -161,38 +160,43 @@ void Synchroniser::publishIfNews() {
   }
 }
 
+std::optional<Steady> Synchroniser::sendingDue() const {
+  if (!isConnected || isPublishing || isForeign || !pacing.deadline()) return std::nullopt;
+  return std::max(*pacing.deadline(), sending.deadline().value_or(Steady::min()));
+}
+
 std::optional<Steady> Synchroniser::deadline() const {
-  const bool canPublish = isConnected && !isPublishing && !isForeign;
-  const auto send = canPublish ? pacing.deadline() : std::nullopt;
-  if (!send || !retry) return send ? send : retry;
-  return std::max(*send, *retry);  // what cannot be written cannot be published either
+  const auto due = sendingDue();
+  if (!due || !taking.deadline()) return due ? due : taking.deadline();
+  return std::min(*due, *taking.deadline());
 }
 
 void Synchroniser::timePassed() {
-  const auto due = deadline();
-  if (!due || around.steady() < *due) return;
-  if (std::exchange(retry, std::nullopt) && isConnected) takeIn();
-  if (!retry && isConnected && !isPublishing && !isForeign && pacing.deadline()) publish();
+  const Steady now = around.steady();
+  if (taking.deadline() && *taking.deadline() <= now) {
+    taking.begin();
+    if (isConnected) takeIn();
+  }
+  if (const auto due = sendingDue(); due && *due <= now) publish();
 }
 
 void Synchroniser::publish() {
   const auto text = encode();
   if (!text) {
     if (text.error() == Outcome::tooLarge) return exceedsQuota();
-    return retryLater("nothing can be published", text.error());
+    return fail(sending, "nothing can be published", text.error());
   }
   pacing.sent();
   isPublishing = true;
-  around.transport.publish(ownDevice(), *text);
+  around.transport.publish(underWay.device, *text);
 }
 
 // The replica as a document; before, the file has to know its writer.
 Result<std::string> Synchroniser::encode() {
   Result<std::string> text{std::string()};
   const auto written = around.replica.update([&](Dictionary& replica) {
-    const std::string device = platform::linux_::cloudDeviceOf(replica);
-    underWay = settingsValues(std::as_const(replica));
-    text = encodeDocument({around.account, device, around.writer, underWay});
+    underWay = {around.account, nameDevice(replica), around.writer, settingsValues(std::as_const(replica))};
+    text = encodeDocument(underWay);
     if (!text || isOwnWriter(replica, around.writer)) return false;
     addWriter(replica, around.writer);
     return true;
@@ -205,13 +209,12 @@ void Synchroniser::published(const std::error_code& error) {
   if (error == std::errc::message_size) return exceedsQuota();
   if (error) {
     pacing.written(around.steady());
-    return retryLater("nothing can be published", error);
+    return fail(sending, "nothing can be published", error);
   }
   lastOut = around.wall.now();
   isOverQuota = false;
-  delay = shortestDelay;
-  failure.clear();
-  devices[ownDevice()] = {std::exchange(underWay, {}), ""};
+  sending.succeeded();
+  devices[underWay.device] = {std::move(underWay.entries), ""};
 }
 
 // What was written stays here, until another write makes it smaller.
@@ -226,11 +229,9 @@ void Synchroniser::exceedsQuota() {
   if (!told) log().error("%s: %s", around.path, told.error().message());
 }
 
-void Synchroniser::retryLater(const std::string& what, const std::error_code& error) {
+void Synchroniser::fail(Retry& retry, const std::string& what, const std::error_code& error) {
   const std::string text = what + ": " + error.message();
-  if (std::exchange(failure, text) != text) log().error("%s", text);
-  retry = around.steady() + delay;
-  delay = std::min(delay * 2, longestDelay);
+  if (retry.failed(around.steady(), text)) log().error("%s", text);
   settle(text);
 }
 
@@ -245,7 +246,9 @@ Synchroniser::Status Synchroniser::status() const {
   if (isForeign)
     status.problem = "another device publishes under this one's name: hearthctl cloud new-identity";
   if (isOverQuota) status.problem = "the settings exceed what an account may hold";
-  if (!failure.empty()) status.problem = failure;
+  for (const Retry* retry : {&sending, &taking}) {
+    if (!retry->problem().empty()) status.problem = retry->problem();
+  }
   return status;
 }
 

@@ -9,7 +9,9 @@
 #include <vector>
 
 #include "cloudsyncd/Transport.hpp"
+#include "cloudsyncd/core/Document.hpp"
 #include "cloudsyncd/core/Pacing.hpp"
+#include "cloudsyncd/core/Retry.hpp"
 #include "platform/Environment.hpp"
 #include "platform/Result.hpp"
 #include "platform/Value.hpp"
@@ -71,6 +73,7 @@ class Synchroniser : public TransportClient {
  private:
   platform::Dictionary allDocuments() const;
   std::string ownDevice() const;
+  std::string nameDevice(platform::Dictionary& replica);
   void takeIn();
   void takeIn(const platform::Dictionary& entries);
   platform::Result<bool> change(platform::Dictionary& replica, const platform::Dictionary& entries);
@@ -79,7 +82,8 @@ class Synchroniser : public TransportClient {
   void publish();
   platform::Result<std::string> encode();
   void exceedsQuota();
-  void retryLater(const std::string& what, const std::error_code& error);
+  std::optional<Steady> sendingDue() const;
+  void fail(Retry& retry, const std::string& what, const std::error_code& error);
   void refuse(const std::string& device, const std::string& problem);
   void settle(const std::string& problem);
 
@@ -91,13 +95,11 @@ class Synchroniser : public TransportClient {
   std::optional<platform::Time> disconnectedSince, lastOut, lastIn;
 
   Pacing pacing;
-  std::optional<Steady> retry;
-  std::chrono::milliseconds delay;
-  std::string failure;  // that has been logged
+  Retry taking, sending;
   bool isPublishing = false;
-  platform::Dictionary underWay;  // the entries that are being published
-  std::string knownDevice;        // outlives a replica that is deleted
-  bool isForeign = false;         // somebody else publishes under this device's name
+  Document underWay;  // that is being published
+  std::string knownDevice;
+  bool isForeign = false;  // somebody else publishes under this device's name
   bool isOverQuota = false;
   bool isSettled = false;
 };
