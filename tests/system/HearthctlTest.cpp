@@ -97,8 +97,11 @@ TEST_F(HearthctlTest, CheckNamesEachResidueWithItsRemedy) {
       {"false", "true", "4000000000.5", "4000000000", "cloud flag is on, and the root", "start hearthd"},
       {"false", "false", "4000000000.5", "", "2096-10-02T08:06:40+0100; the next \"on\" takes it up",
        "hearthctl settings unset cloud " + endKey},
+      {"false", "false", "1000000000", "", "a second one is needed",
+       "hearthctl settings unset cloud " + endKey},
       {"false", "false", "", "4000000000", "alarm is left", "hearthctl alarms cancel " + flagKey},
       {"true", "true", "4000000000.5", "", "no alarm for the end", "start hearthd"},
+      {"true", "true", "4000000000.5", "4000000001", "not at the end", "start hearthd"},
       {"true", "true", "1000000000", "", "the end has passed", "start hearthd"},
       {"true", "true", "", "4000000000", "without an end time", "pairwellctl logging off"}};
   EXPECT_THAT(ctl("check").output, HasSubstr("etc: there is no device"));
