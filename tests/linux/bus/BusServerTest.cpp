@@ -126,7 +126,7 @@ TEST_F(BusServerTest, UnreadSignalsMergeByKeyAndKeepTheirOrder) {
   connections[0]->emit(0, {"newest"}, "same");
   for (const std::string& part :
        {text("newest"), text("Other"), text("y"), text("Changed"), text("kept apart")})
-    EXPECT_TRUE(wire.reads(part)) << part;
+    ASSERT_TRUE(wire.reads(part)) << part;
   EXPECT_THAT(wire.received, Not(HasSubstr(text("x"))));
   EXPECT_LT(wire.received.size(), count / 2 * size);
 }
@@ -180,7 +180,7 @@ TEST_F(BusServerTest, AtTheDescriptorLimitClientsWaitUntilOthersEnd) {
   // Each one that ends lets the next one in.
   for (Wire& wire : wires) {
     wire.shakeHands();
-    EXPECT_TRUE(wire.isServed());
+    ASSERT_TRUE(wire.isServed());
     wire.socket.reset();
   }
 }

@@ -2,6 +2,8 @@
 
 #include <gtest/gtest.h>
 
+#include <random>
+
 #include "platform/linux/SettingsDocument.hpp"
 
 namespace platform::linux_ {
@@ -163,6 +165,27 @@ TEST(CloudReplicaTest, AClockThatIsYearsAheadIsOverruledAndNotFollowed) {
   ahead.switchOn(5000);
   sane.exchange(ahead);
   EXPECT_EQ(sane.values(), R"(["flag": true, "flagExpiration": 5000.0, "other": 1])");
+}
+
+TEST(CloudReplicaTest, MergingTakesTheGreaterInWhateverOrder) {
+  std::mt19937 random(7);
+  const auto below = [&](int limit) { return static_cast<int>(random() % static_cast<unsigned>(limit)); };
+  const auto merged = [](Dictionary into, const Dictionary& other) {
+    mergeCloudEntries(other, into);
+    return into;
+  };
+  for (int round = 0; round < 1000; ++round) {
+    Dictionary replicas[3];
+    for (Dictionary& replica : replicas) {
+      const std::optional<Value> value = below(3) == 0 ? std::nullopt : std::optional<Value>(below(3));
+      if (below(4) > 0) replica["a"] = CloudEntry{value, {below(2), below(2)}, "d"}.toValue();
+    }
+    const auto& [a, b, c] = replicas;
+    Dictionary both = merged(a, b);
+    ASSERT_EQ(both, merged(b, a));
+    ASSERT_EQ(merged(both, c), merged(a, merged(b, c)));
+    ASSERT_FALSE(mergeCloudEntries(b, both)) << "nothing new the second time";
+  }
 }
 
 TEST(CloudReplicaTest, WhatIsNoEntryIsSkipped) {
