@@ -13,6 +13,7 @@
 #include "hearthd/LifeLock.hpp"
 #include "platform/LogSink.hpp"
 #include "platform/linux/HearthInterface.hpp"
+#include "platform/linux/ProcessLock.hpp"
 
 namespace hearth {
 namespace {
@@ -58,7 +59,7 @@ void Job::restart() {
 
 void Job::tryToStart() {
   timer = {};
-  auto life = takeLock(surroundings.lifeLock);
+  auto life = platform::linux_::takeLock(surroundings.lifeLock);
   if (!life) return startLater({}, surroundings.lifeLock + ": " + life.error().message());
   if (!*life) return endOrphans();
   launchWith(std::move(*life));

@@ -1,12 +1,9 @@
 #include "hearthd/LifeLock.hpp"
 
-#include <fcntl.h>
 #include <signal.h>
-#include <sys/file.h>
 #include <sys/stat.h>
 #include <unistd.h>
 
-#include <cerrno>
 #include <cstdlib>
 #include <filesystem>
 #include <system_error>
@@ -39,14 +36,6 @@ bool holds(const fs::path& process, const struct stat& file) {
 }
 
 }  // namespace
-
-platform::Result<UniqueDescriptor> takeLock(const std::string& path) {
-  UniqueDescriptor file(::open(path.c_str(), O_RDONLY | O_CREAT | O_CLOEXEC | O_NONBLOCK, 0600));
-  if (!file) return platform::linux_::lastError();
-  if (::flock(file.get(), LOCK_EX | LOCK_NB) == 0) return file;
-  if (errno == EWOULDBLOCK) return UniqueDescriptor();
-  return platform::linux_::lastError();
-}
 
 std::vector<UniqueDescriptor> endHolders(const std::string& path) {
   std::vector<UniqueDescriptor> ended;

@@ -14,12 +14,12 @@
 #include <string_view>
 #include <system_error>
 
-#include "hearthd/LifeLock.hpp"
 #include "hearthd/ServiceManager.hpp"
 #include "platform/LogSink.hpp"
 #include "platform/linux/EventLoop.hpp"
 #include "platform/linux/LinuxFileSystem.hpp"
 #include "platform/linux/Paths.hpp"
+#include "platform/linux/ProcessLock.hpp"
 #include "platform/linux/ProcessSetup.hpp"
 #include "platform/linux/UnifiedLog.hpp"
 
@@ -77,7 +77,7 @@ std::optional<UniqueDescriptor> takeRoot(const platform::linux_::Paths& paths) {
     return std::nullopt;
   }
   const std::string path = paths.run + "/hearthd.lock";
-  auto lock = hearth::takeLock(path);
+  auto lock = platform::linux_::takeLock(path);
   if (!lock) {
     say("hearthd: " + path + ": " + lock.error().message() + "\n");
     return std::nullopt;
