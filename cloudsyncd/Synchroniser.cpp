@@ -45,6 +45,7 @@ void Synchroniser::disconnected(const std::string& problem_) {
   if (!disconnectedSince) disconnectedSince = around.wall.now();
   if (std::exchange(problem, problem_) != problem_) log().error("not connected: %s", problem);
   settle(problem);
+  deadlineMoved();
 }
 
 void Synchroniser::received(const std::string& name, std::string_view text) {
@@ -158,6 +159,7 @@ void Synchroniser::publishIfNews() {
   if (accountOf(*replica) == around.account && !newsIn(settingsValues(*replica), allDocuments()).empty()) {
     pacing.written(around.steady());
   }
+  deadlineMoved();
 }
 
 std::optional<Steady> Synchroniser::sendingDue() const {
@@ -206,6 +208,7 @@ Result<std::string> Synchroniser::encode() {
 
 void Synchroniser::published(const std::error_code& error) {
   isPublishing = false;
+  deadlineMoved();
   if (error == std::errc::message_size) return exceedsQuota();
   if (error) {
     pacing.written(around.steady());
@@ -233,6 +236,11 @@ void Synchroniser::fail(Retry& retry, const std::string& what, const std::error_
   const std::string text = what + ": " + error.message();
   if (retry.failed(around.steady(), text)) log().error("%s", text);
   settle(text);
+  deadlineMoved();
+}
+
+void Synchroniser::deadlineMoved() const {
+  if (around.deadlineMoved) around.deadlineMoved();
 }
 
 void Synchroniser::settle(const std::string& text) {

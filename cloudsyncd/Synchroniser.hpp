@@ -33,9 +33,11 @@ class Synchroniser : public TransportClient {
     std::string account;
     std::string writer;  // a random text, this process's identity
     // Called before the replica goes over to another account; an error stops it.
-    std::function<platform::Result<void>()> changing;
+    std::function<platform::Result<void>()> changing = {};
     // Called once: the account has been taken in, or why it can't be for now.
-    std::function<void(const std::string& problem)> settled;
+    std::function<void(const std::string& problem)> settled = {};
+    // Called whenever deadline() may be another than before.
+    std::function<void()> deadlineMoved = {};
   };
   // What is referred to outlives the object.
   explicit Synchroniser(Surroundings surroundings);
@@ -85,6 +87,7 @@ class Synchroniser : public TransportClient {
   std::optional<Steady> sendingDue() const;
   void fail(Retry& retry, const std::string& what, const std::error_code& error);
   void refuse(const std::string& device, const std::string& problem);
+  void deadlineMoved() const;
   void settle(const std::string& problem);
 
   const Surroundings around;

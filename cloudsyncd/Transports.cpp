@@ -26,40 +26,42 @@ std::optional<std::chrono::milliseconds> pollOf(std::string_view query) {
   return std::chrono::milliseconds(std::llround(seconds * 1000));
 }
 
-Result<DirectoryTransport::Place> placeOf(std::string_view rest, const std::string& account,
-                                          std::string& problem) {
-  DirectoryTransport::Place place;
-  place.account = account;
-  const auto query = rest.find('?');
-  if (query != std::string_view::npos) {
+Result<DirectoryTransport::Place> placeOf(const Membership& membership, std::string& problem) {
+  std::string_view rest = membership.url;
+  problem.clear();
+  if (!isName(membership.account))
+    problem = "an account's name has 1 to 64 letters, digits, '-', '_' and '.', the last not first";
+  if (!rest.starts_with(scheme)) {
+    problem = "unknown engine; there is dir:PATH";
+    return Outcome::malformedFile;
+  }
+  rest.remove_prefix(scheme.size());
+  DirectoryTransport::Place place{"", membership.account, std::nullopt};
+  if (const auto query = rest.find('?'); query != std::string_view::npos) {
     place.poll = pollOf(rest.substr(query + 1));
     if (!place.poll) problem = "after '?' only poll=SECONDS may stand, 0.1 to 86400";
     rest = rest.substr(0, query);
   }
   while (rest.size() > 1 && rest.ends_with('/')) rest.remove_suffix(1);
   if (!rest.starts_with('/')) problem = "dir: needs an absolute path";
-  if (!problem.empty()) return Outcome::malformedFile;
   place.folder = rest;
-  return place;
+  return problem.empty() ? Result<DirectoryTransport::Place>(place) : Outcome::malformedFile;
 }
 
 }  // namespace
 
-Result<std::shared_ptr<Transport>> makeTransport(const std::string& url, const std::string& account,
+Result<std::shared_ptr<Transport>> makeTransport(const Membership& membership,
                                                  const Surroundings& surroundings, std::string& problem) {
-  problem.clear();
-  if (!isName(account)) {
-    problem = "an account's name has 1 to 64 letters, digits, '-', '_' and '.', the last not first";
-    return Outcome::malformedFile;
-  }
-  if (!url.starts_with(scheme)) {
-    problem = "unknown engine; there is dir:PATH";
-    return Outcome::malformedFile;
-  }
-  const auto place = placeOf(std::string_view(url).substr(scheme.size()), account, problem);
+  const auto place = placeOf(membership, problem);
   if (!place) return place.error();
   return std::shared_ptr<Transport>(
       DirectoryTransport::create(surroundings.files, surroundings.queue, surroundings.steady, *place));
+}
+
+std::string problemOf(const Membership& membership) {
+  std::string problem;
+  static_cast<void>(placeOf(membership, problem));
+  return problem;
 }
 
 }  // namespace cloudsync

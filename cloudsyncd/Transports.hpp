@@ -5,6 +5,7 @@
 #include <memory>
 #include <string>
 
+#include "cloudsyncd/CloudFile.hpp"
 #include "cloudsyncd/Transport.hpp"
 #include "platform/Result.hpp"
 #include "platform/WorkQueue.hpp"
@@ -21,8 +22,11 @@ struct Surroundings {
 // `dir:PATH`, or `dir:PATH?poll=SECONDS` for a folder whose file system gives no events.
 // Outcome::malformedFile for any other URL, and for an account that is no name; `problem` says what is wrong,
 // for people. Nothing is opened before the transport is started.
-platform::Result<std::shared_ptr<Transport>> makeTransport(const std::string& url, const std::string& account,
+platform::Result<std::shared_ptr<Transport>> makeTransport(const Membership& membership,
                                                            const Surroundings& surroundings,
                                                            std::string& problem);
+
+// What makeTransport() would refuse it for; empty if nothing.
+std::string problemOf(const Membership& membership);
 
 }  // namespace cloudsync

@@ -19,6 +19,7 @@ struct Paths {
   std::string run;   // ROOT/run, or /run/pairwell
 
   std::string device() const { return etc + "/device.json"; }
+  std::string cloud() const { return etc + "/cloud.json"; }
   std::string jobs() const { return etc + "/jobs"; }
   std::string entitlements() const { return etc + "/entitlements.d"; }
   std::string userSettings() const { return var + "/settings/user/com.kestrel.pairwelld.json"; }

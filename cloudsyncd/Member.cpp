@@ -1,0 +1,147 @@
+#include "cloudsyncd/Member.hpp"
+
+#include <algorithm>
+#include <chrono>
+#include <utility>
+
+#include "pairwelld/Names.hpp"
+#include "platform/LogSink.hpp"
+#include "platform/UUID.hpp"
+#include "platform/linux/CloudReplica.hpp"
+
+namespace cloudsync {
+namespace {
+
+using platform::Dictionary;
+using platform::List;
+using platform::Result;
+using platform::Value;
+using platform::linux_::CloudEntry;
+
+Steady steadyNow() { return std::chrono::steady_clock::now(); }
+
+// When the device itself last changed something, in seconds since 1970.
+std::optional<double> newestChange(const std::string& name, const Dictionary& entries) {
+  std::optional<double> newest;
+  for (const auto& [key, value] : entries) {
+    const auto entry = CloudEntry::fromValue(value);
+    if (!entry || entry->device != name) continue;
+    newest = std::max(newest.value_or(0), static_cast<double>(entry->stamp.microseconds) / 1e6);
+  }
+  return newest;
+}
+
+void insertTime(Dictionary& fields, const char* name, const std::optional<platform::Time>& time) {
+  if (time) fields.emplace(name, time->count());
+}
+
+List describeDevices(const std::map<std::string, Synchroniser::Device>& devices) {
+  List rows;
+  for (const auto& [name, device] : devices) {
+    Dictionary row{{"device", name}};
+    if (const auto newest = newestChange(name, device.entries)) row.emplace("newest", *newest);
+    if (!device.problem.empty()) row.emplace("problem", device.problem);
+    rows.push_back(std::move(row));
+  }
+  return rows;
+}
+
+}  // namespace
+
+Member::Member(platform::linux_::EventLoop& loop_, platform::linux_::FileSystem& files_,
+               platform::linux_::Paths paths_)
+    : loop(loop_),
+      files(files_),
+      paths(std::move(paths_)),
+      replicaPath(paths.cloudSettings(pairwell::names::cloudStore)),
+      writer(platform::UUID::random().text()),
+      replica(platform::linux_::SettingsFile::create(files, replicaPath)) {}
+
+void Member::start() {
+  replica->startWatching(loop, [this](const Dictionary& before, const Dictionary& after) {
+    if (current) current->synchroniser->replicaChanged(before, after);
+  });
+  std::string wrong;
+  const auto membership = readCloudFile(files, paths.cloud(), wrong);
+  if (membership) current = connect(*membership, nullptr, nullptr, wrong);
+  if (current) return current->synchroniser->start();
+  problem = paths.cloud() + ": " + wrong;
+  platform::hearthLog("cloud").error("%s; this device is in no account", problem);
+}
+
+std::unique_ptr<Member::Connection> Member::connect(const Membership& membership,
+                                                    std::function<void(const std::string&)> settled,
+                                                    std::function<Result<void>()> changing,
+                                                    std::string& wrong) {
+  auto transport = makeTransport(membership, {files, loop, steadyNow}, wrong);
+  if (!transport) return nullptr;
+  auto synchroniser = std::make_unique<Synchroniser>(Synchroniser::Surroundings{
+      files, replicaPath, *replica, **transport, wall, steadyNow, membership.account, writer,
+      std::move(changing), std::move(settled), [this] { rearm(); }});
+  return std::make_unique<Connection>(Connection{membership, std::move(*transport), std::move(synchroniser)});
+}
+
+// The old account stays in force until the new one has been downloaded and etc/cloud.json names it.
+void Member::use(const Membership& membership, std::function<void(const std::string&)> done) {
+  if (next) return done("another account is being tried");
+  std::string wrong;
+  const auto settled = [this, done](const std::string& failure) {
+    if (failure.empty()) std::swap(current, next);
+    // Not here: this is the synchroniser's own call.
+    loop.async([this, done, failure] {
+      next.reset();
+      rearm();
+      done(failure);
+    });
+  };
+  const auto changing = [this, membership] { return writeCloudFile(files, paths.cloud(), membership); };
+  next = connect(membership, settled, changing, wrong);
+  if (!next) return done(wrong);
+  next->synchroniser->start();
+}
+
+Result<void> Member::forget(const std::string& device) {
+  if (!current) return platform::Outcome::notConnected;
+  return current->transport->forget(device);
+}
+
+void Member::rearm() {
+  std::optional<Steady> due;
+  for (const auto* connection : {current.get(), next.get()}) {
+    if (!connection) continue;
+    for (const auto& deadline : {connection->synchroniser->deadline(), connection->transport->deadline()}) {
+      if (deadline && (!due || *deadline < *due)) due = deadline;
+    }
+  }
+  timer = {};
+  if (!due) return;
+  const auto delay = std::chrono::ceil<std::chrono::microseconds>(*due - steadyNow());
+  timer = loop.callAfter(std::max(delay, std::chrono::microseconds(0)), [this] { timePassed(); });
+}
+
+void Member::timePassed() {
+  for (const auto* connection : {current.get(), next.get()}) {
+    if (!connection) continue;
+    connection->transport->timePassed(steadyNow());
+    connection->synchroniser->timePassed();
+  }
+  rearm();
+}
+
+Dictionary Member::status() const {
+  if (!current) return {{"connected", false}, {"problem", problem}};
+  const Synchroniser::Status status = current->synchroniser->status();
+  Dictionary fields{{"url", current->membership.url},
+                    {"account", current->membership.account},
+                    {"connected", status.isConnected},
+                    {"device", status.device},
+                    {"waiting", List(status.waiting.begin(), status.waiting.end())},
+                    {"devices", Value(describeDevices(status.devices))}};
+  insertTime(fields, "since", status.disconnectedSince);
+  insertTime(fields, "out", status.lastOut);
+  insertTime(fields, "in", status.lastIn);
+  if (!status.problem.empty()) fields.emplace("problem", status.problem);
+  return fields;
+}
+
+}  // namespace cloudsync
