@@ -3,6 +3,7 @@
 
 #include <string>
 #include <system_error>
+#include <utility>
 #include <vector>
 
 #include "platform/LogSink.hpp"
@@ -20,6 +21,10 @@ class Output {
  public:
   explicit Output(bool json_) : json(json_) {}
   void add(const platform::Dictionary& object, std::vector<std::string> cells);
+  // A further line for people of the object added last.
+  void addLine(std::vector<std::string> cells) {
+    if (!json) rows.push_back(std::move(cells));
+  }
   // Prints the lines that were added, in columns.
   void print();
 

@@ -6,7 +6,11 @@
 #include <filesystem>
 #include <system_error>
 #include <utility>
+#include <vector>
 
+#include "cloudsyncd/CloudFile.hpp"
+#include "cloudsyncd/CloudInterface.hpp"
+#include "cloudsyncd/Transports.hpp"
 #include "pairwelld/Names.hpp"
 #include "platform/EventStreams.hpp"
 #include "platform/linux/Entitlements.hpp"
@@ -29,6 +33,12 @@ Dictionary deviceFile(const Device& device) {
   if (!device.name.empty()) fields.emplace("UserAssignedDeviceName", device.name);
   if (device.isInternal) fields.emplace("InternalBuild", true);
   return fields;
+}
+
+Dictionary cloudJobFile(const fs::path& programs) {
+  return {{"name", "com.kestrel.cloudsyncd"},
+          {"program", (programs / "cloudsyncd").string()},
+          {"services", List{std::string(cloudsync::cloudService)}}};
 }
 
 Dictionary jobFile(const fs::path& programs) {
@@ -74,10 +84,16 @@ Exit init(Output& output, const platform::linux_::Paths& paths, FileSystem& file
   std::error_code error;
   const fs::path programs = fs::read_symlink("/proc/self/exe", error).parent_path();
   if (error) return fail("/proc/self/exe", error);
-  const std::pair<std::string, Dictionary> wanted[] = {
+  std::vector<std::pair<std::string, Dictionary>> wanted = {
       {paths.device(), deviceFile(device)},
       {paths.jobs() + "/com.kestrel.pairwelld.json", jobFile(programs)},
       {paths.entitlements() + "/pairwellctl.json", entitlementFile(programs)}};
+  if (!device.cloud.empty()) {
+    if (const auto problem = cloudsync::problemOf({device.cloud, device.account}); !problem.empty())
+      return say(problem), wrongUsage;
+    wanted.emplace_back(paths.cloud(), cloudsync::fieldsOf({device.cloud, device.account}));
+    wanted.emplace_back(paths.jobs() + "/com.kestrel.cloudsyncd.json", cloudJobFile(programs));
+  }
   for (const auto& [path, fields] : wanted) {
     const auto written = writeNew(files, path, fields);
     if (!written && written.error() != std::errc::file_exists) return fail(path, written.error());

@@ -13,9 +13,10 @@ struct Device {
   std::string name;  // empty: the machine's
   std::string build;
   bool isInternal = false;
+  std::string cloud = {}, account = {};  // the URL, empty for a device on its own
 };
 
-// Device, job and entitlements, for the pairwelld and the pairwellctl that lie beside this program. A file
+// Device, jobs and entitlements, for the programs that lie beside this one. A file
 // that is there stays as it is.
 Exit init(Output& output, const platform::linux_::Paths& paths, platform::linux_::FileSystem& files,
           const Device& device);

@@ -9,6 +9,7 @@
 #include "tools/CommandLine.hpp"
 #include "tools/Output.hpp"
 #include "tools/hearthctl/Check.hpp"
+#include "tools/hearthctl/Cloud.hpp"
 #include "tools/hearthctl/Hearth.hpp"
 #include "tools/hearthctl/Init.hpp"
 #include "tools/hearthctl/Settings.hpp"
@@ -59,11 +60,35 @@ void addNotify(CLI::App& app, Options& options) {
       ->check(CLI::Range(0.0, 1e6));
 }
 
+void addCloud(CLI::App& app, Options& options) {
+  auto* cloud = app.add_subcommand("cloud", "the account that shares the cloud store")->require_subcommand(1);
+  cloud->add_subcommand("status", "print how the exchange with the other devices stands");
+  auto* use = cloud->add_subcommand("use", "change to another account; the old one's values are kept aside");
+  use->add_option("URL", options.device.cloud, "dir:PATH, or dir:PATH?poll=SECONDS")->required();
+  use->add_option("--account", options.device.account)->required();
+  cloud->add_subcommand("forget", "take a lost device's document out of the account")
+      ->add_option("DEVICE", options.name)
+      ->required();
+  cloud->add_subcommand("new-identity", "make this copy of another device's disk a device of its own");
+}
+
+Exit runCloud(const std::string& command, const Options& options, tools::Cloud cloud, tools::Output& output) {
+  if (command == "status") return cloud.status(output);
+  if (command == "use") return cloud.use(options.device.cloud, options.device.account);
+  if (command == "forget") return cloud.forget(options.name);
+  return cloud.makeNewIdentity(output);
+}
+
 void addCommands(CLI::App& app, Options& options) {
   auto* init = app.add_subcommand("init", "lay out etc/ of a root; files that are there are kept");
   init->add_option("--device-name", options.device.name, "by default the machine's host name");
   init->add_option("--build", options.device.build, "the operating system's build")->capture_default_str();
   init->add_flag("--internal", options.device.isInternal, "an internal build of the operating system");
+  auto* url = init->add_option("--cloud", options.device.cloud,
+                               "where the account's devices meet: dir:PATH, or dir:PATH?poll=SECONDS");
+  auto* account = init->add_option("--account", options.device.account, "the account there");
+  url->needs(account);
+  account->needs(url);
   auto* jobs = app.add_subcommand("jobs", "print the jobs, or control one")->require_subcommand(0, 1);
   for (const char* action : {"start", "stop", "restart"}) {
     jobs->add_subcommand(action, std::string(action) + " a job")
@@ -77,6 +102,7 @@ void addCommands(CLI::App& app, Options& options) {
   auto* event = app.add_subcommand("event", "deliver an event by hand");
   event->add_option("STREAM", options.stream)->required();
   event->add_option("NAME", options.name)->required();
+  addCloud(app, options);
   app.add_subcommand("grants", "print what is granted to which program, and what does not count");
   app.add_subcommand("check", "say whether stores and alarms agree; exit 1 if not");
 }
@@ -102,6 +128,7 @@ Exit run(const std::string& command, const std::string& part, const Options& opt
   if (command == "init") return tools::init(output, paths, files, options.device);
   if (command == "grants") return tools::listGrants(output, paths, files);
   if (command == "check") return tools::check(output, paths, files, hearth);
+  if (command == "cloud") return runCloud(part, options, {paths, files}, output);
   if (command == "event")
     return hearth.perform(HearthOperation::deliverEvent, {options.stream, options.name});
   if (command == "alarms")

@@ -1,0 +1,125 @@
+#include "tools/hearthctl/Cloud.hpp"
+
+#include <utility>
+
+#include "cloudsyncd/CloudInterface.hpp"
+#include "cloudsyncd/core/Replica.hpp"
+#include "pairwelld/Names.hpp"
+#include "platform/linux/BusClient.hpp"
+#include "platform/linux/CloudReplica.hpp"
+#include "platform/linux/Json.hpp"
+#include "platform/linux/SettingsFile.hpp"
+#include "tools/StoredSettings.hpp"
+
+namespace tools {
+namespace {
+
+using platform::Dictionary;
+using platform::List;
+using platform::Result;
+using platform::Value;
+using std::chrono::milliseconds;
+
+constexpr milliseconds patience{5000};
+// An engine may be far, or not there at all, which takes its own time to find out.
+constexpr milliseconds downloadPatience{30'000};
+
+std::string textIn(const Dictionary& fields, std::string_view name) {
+  const auto* text = platform::find<std::string>(fields, name);
+  return text ? *text : "";
+}
+
+std::string timeIn(const Dictionary& fields, std::string_view name) {
+  const auto* time = platform::find<double>(fields, name);
+  return time ? describeTime(*time) : "never";
+}
+
+const List& listIn(const Dictionary& fields, std::string_view name) {
+  static const List none;
+  const auto* list = platform::find<List>(fields, name);
+  return list ? *list : none;
+}
+
+// The lines for people.
+std::vector<std::vector<std::string>> linesOf(const Dictionary& status) {
+  std::vector<std::vector<std::string>> lines;
+  const bool isConnected = platform::find(status, "connected") && *platform::find<bool>(status, "connected");
+  if (status.contains("url"))
+    lines.push_back({"engine", textIn(status, "url") + ", account " + textIn(status, "account")});
+  lines.push_back({"connected", isConnected                ? "yes"
+                                : status.contains("since") ? "no, since " + timeIn(status, "since")
+                                                           : "no"});
+  if (status.contains("problem")) lines.push_back({"problem", textIn(status, "problem")});
+  lines.push_back({"last out", timeIn(status, "out")});
+  lines.push_back({"last in", timeIn(status, "in")});
+  std::string waiting;
+  for (const Value& key : listIn(status, "waiting"))
+    waiting += (waiting.empty() ? "" : ", ") + *key.as<std::string>();
+  lines.push_back({"waiting to go out", waiting.empty() ? "nothing" : waiting});
+  for (const Value& row : listIn(status, "devices")) {
+    const auto& device = *row.as<Dictionary>();
+    const std::string name = textIn(device, "device");
+    std::string line = name + (name == textIn(status, "device") ? " (this one)" : "") + ", newest change " +
+                       timeIn(device, "newest");
+    if (device.contains("problem")) line += ", refused: " + textIn(device, "problem");
+    lines.push_back({"device", std::move(line)});
+  }
+  return lines;
+}
+
+}  // namespace
+
+Cloud::Cloud(const platform::linux_::Paths& paths_, platform::linux_::FileSystem& files_)
+    : paths(paths_), files(files_), socket(paths_.serviceSocket(cloudsync::cloudService)) {}
+
+Result<List> Cloud::call(const std::string& operation, const List& arguments, milliseconds timeout) {
+  answer.clear();
+  auto client = platform::linux_::BusClient::connect(socket, patience);
+  if (!client) return client.error();
+  return resultsOf((*client)->call(cloudsync::cloudInterface(), operation, arguments, timeout), answer);
+}
+
+Exit Cloud::status(Output& output) {
+  const auto results = call("Status", {}, patience);
+  if (!results) return fail(results.error());
+  std::string problem;
+  const auto value = platform::linux_::parseJson(*results->at(0).as<std::string>(), problem);
+  const auto* fields = value ? value->as<Dictionary>() : nullptr;
+  if (!fields) return say(socket + ": " + problem), failed;
+  const auto lines = linesOf(*fields);
+  output.add(*fields, lines.front());
+  for (std::size_t line = 1; line < lines.size(); ++line) output.addLine(lines[line]);
+  output.print();
+  return done;
+}
+
+Exit Cloud::use(const std::string& url, const std::string& account) {
+  const auto results = call("Use", {url, account}, downloadPatience);
+  return results
+             ? done
+             : tools::fail(answer.empty() ? socket : "the account is not changed", results.error(), answer);
+}
+
+Exit Cloud::forget(const std::string& device) {
+  const auto results = call("Forget", {device}, patience);
+  return results ? done : fail(results.error());
+}
+
+Exit Cloud::makeNewIdentity(Output& output) {
+  const std::string path = paths.cloudSettings(pairwell::names::cloudStore);
+  std::string name, problem;
+  if (const auto there = storedValues(files, paths, pairwell::KeyValueSource::cloud, problem);
+      !there && there.error() == platform::Outcome::malformedFile)
+    return say(path + ": " + problem + "; nothing is changed"), failed;
+  const auto written = platform::linux_::SettingsFile::create(files, path)->update([&](Dictionary& replica) {
+    cloudsync::makeNewIdentity(replica);
+    name = platform::linux_::cloudDeviceOf(replica);
+    return true;
+  });
+  if (!written) return tools::fail(path, written.error());
+  output.add({{"device", name}}, {name});
+  output.print();
+  return done;
+}
+
+}  // namespace tools

@@ -1,0 +1,38 @@
+// The account that a device shares its cloud store with: looked at and changed through cloudsyncd.
+#pragma once
+
+#include <chrono>
+#include <string>
+
+#include "platform/Result.hpp"
+#include "platform/Value.hpp"
+#include "platform/linux/FileSystem.hpp"
+#include "platform/linux/Paths.hpp"
+#include "tools/Output.hpp"
+
+namespace tools {
+
+class Cloud {
+ public:
+  // The references outlive the object.
+  Cloud(const platform::linux_::Paths& paths, platform::linux_::FileSystem& files);
+
+  // The commands; each prints, and answers how to exit.
+  Exit status(Output& output);
+  Exit use(const std::string& url, const std::string& account);
+  Exit forget(const std::string& device);
+  // Also without cloudsyncd.
+  Exit makeNewIdentity(Output& output);
+
+ private:
+  platform::Result<platform::List> call(const std::string& operation, const platform::List& arguments,
+                                        std::chrono::milliseconds patience);
+  Exit fail(std::error_code error) const { return tools::fail(socket, error, answer); }
+
+  const platform::linux_::Paths& paths;
+  platform::linux_::FileSystem& files;
+  const std::string socket;
+  std::string answer;  // the error that cloudsyncd answered
+};
+
+}  // namespace tools
