@@ -58,9 +58,7 @@ void DirectoryTransport::connect() {
   if (!there) return disconnect(there.error());
   if (const auto made = files.makeFolder(folder); !made) return disconnect(made.error());
   if (!place.poll) {
-    auto begun = files.watch(folder, [this](const std::string& name) { changed(name); });
-    if (!begun) return disconnect(begun.error());
-    watch = std::move(*begun);
+    if (const auto begun = beginWatching(); !begun) return disconnect(begun.error());
   }
   known.clear();
   isConnected = true;
@@ -70,10 +68,24 @@ void DirectoryTransport::connect() {
   client->connected();
 }
 
+Result<void> DirectoryTransport::beginWatching() {
+  auto inner = files.watch(folder, [this](const std::string& name) { changed(name); });
+  if (!inner) return inner.error();
+  auto outer = files.watch(place.folder, [this](const std::string& name) {
+    // It was renamed or deleted, and what is there in its place by now is another.
+    if (name.empty() && isConnected) disconnect(std::make_error_code(std::errc::no_such_file_or_directory));
+  });
+  if (!outer) return outer.error();
+  watch = std::move(*inner);
+  outerWatch = std::move(*outer);
+  return {};
+}
+
 // Tried again from the beginning: what comes back may be another folder.
 void DirectoryTransport::disconnect(const std::error_code& error) {
   isConnected = false;
   watch.reset();
+  outerWatch.reset();
   nextLook.reset();
   retry.failed(steady(), "");
   client->disconnected(place.folder + ": " + error.message());

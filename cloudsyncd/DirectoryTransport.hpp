@@ -42,6 +42,7 @@ class DirectoryTransport : public Transport, public std::enable_shared_from_this
                      std::function<Steady()> steady, Place place);
   void later(std::function<void(DirectoryTransport&)> work);
   void connect();
+  platform::Result<void> beginWatching();
   void disconnect(const std::error_code& error);
   void look();
   void lookAt(const std::string& device);
@@ -61,7 +62,8 @@ class DirectoryTransport : public Transport, public std::enable_shared_from_this
   // What is there, as it was last read; a file that could not be read has none.
   std::map<std::string, std::optional<platform::linux_::FileIdentity>> known;
   bool isCrowded = false;
-  std::unique_ptr<platform::linux_::FolderWatch> watch;
+  // A watch follows what it watches, not its name: one says when the folder around the account's goes.
+  std::unique_ptr<platform::linux_::FolderWatch> watch, outerWatch;
 };
 
 }  // namespace cloudsync

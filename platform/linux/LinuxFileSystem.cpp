@@ -151,7 +151,7 @@ class Watched {
         ::inotify_rm_watch(inotify.get(), current);
         current = -1;
       }
-      const bool all = (event.mask & (IN_MOVE_SELF | IN_DELETE_SELF)) != 0;
+      const bool all = (event.mask & (IN_MOVE_SELF | IN_DELETE_SELF | IN_UNMOUNT)) != 0;
       if (all || !name.empty()) report(all ? "" : name);
     }
   }
