@@ -110,6 +110,7 @@ void Look::lookAtJobs() {
 void Look::lookAtFiles() {
   if (!files.identity(paths.etc)) add(paths.etc + ": there is no device", "hearthctl init");
   readObject(paths.device(), "mend it");
+  readObject(paths.cloud(), "mend it, and hearthctl jobs restart com.kestrel.cloudsyncd");
   if (const auto names = files.list(paths.jobs())) {
     for (const std::string& name : *names) {
       if (name.ends_with(".json")) readObject(paths.jobs() + "/" + name, "mend it, and start hearthd anew");

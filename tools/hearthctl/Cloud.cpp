@@ -95,9 +95,9 @@ Exit Cloud::status(Output& output) {
 
 Exit Cloud::use(const std::string& url, const std::string& account) {
   const auto results = call("Use", {url, account}, downloadPatience);
-  return results
-             ? done
-             : tools::fail(answer.empty() ? socket : "the account is not changed", results.error(), answer);
+  if (results) return done;
+  return answer.empty() ? fail(results.error())
+                        : tools::fail("the account is not changed", results.error(), answer);
 }
 
 Exit Cloud::forget(const std::string& device) {
