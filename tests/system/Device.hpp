@@ -36,7 +36,7 @@ struct Device : testing::Test {
   Device() {
     fs::permissions(root, fs::perms(0755));  // for clients of other users
     fs::create_directory(root / "bin");
-    for (const char* program : {"hearthd", "pairwelld", "hearthctl", "pairwellctl"})
+    for (const char* program : {"hearthd", "pairwelld", "hearthctl", "pairwellctl", "cloudsyncd"})
       fs::copy_file(fs::path(PROGRAMS) / program, root / "bin" / program);
     ::setenv("HEARTH_ROOT", root.c_str(), 1);
     ::setenv("PATH", ((root / "bin").string() + ":/usr/bin:/bin").c_str(), 1);

@@ -1,0 +1,234 @@
+// Devices of one account, real processes that meet in a shared folder.
+#include <map>
+
+#include "tests/system/Device.hpp"
+
+namespace processes {
+namespace {
+
+// Each device is a folder below the root, the programs lie in the root itself.
+struct CloudTest : Device {
+  CloudTest() {
+    fs::create_directory(share);
+    for (const char* name : {"one", "two"}) EXPECT_EQ(join(name, url).status, 0);
+  }
+  ~CloudTest() override {
+    for (const auto& entry : std::map(running)) {
+      EXPECT_EQ(stop(entry.first), 0) << log(entry.first);
+    }
+  }
+
+  Outcome join(const std::string& name, const std::string& at) {
+    return on(name, "hearthctl", "init --cloud '" + at + "' --account home");
+  }
+  Outcome on(const std::string& name, const std::string& program, const std::string& arguments) {
+    return run(program + " --root " + (root / name).string() + " " + arguments);
+  }
+  Outcome cloud(const std::string& name, const std::string& arguments) {
+    return on(name, "hearthctl", "cloud " + arguments);
+  }
+
+  void start(const std::string& name) {
+    const std::string command = "env HEARTH_LOG_LEVEL=info HEARTH_LOG_PRIVATE=show hearthd --root ";
+    running[name] = spawn(command + (root / name).string(), name);
+    ASSERT_TRUE(eventually([&] { return on(name, "pairwellctl", "status").status == 0; })) << log(name);
+    ASSERT_TRUE(comesToSay(name, "connected          "));
+  }
+  int stop(const std::string& name, int signal = SIGTERM) {
+    const pid_t pid = running[name];
+    running.erase(name);
+    ::kill(pid, signal);
+    return finish(pid, name).status;
+  }
+  std::string log(const std::string& name) const { return contents(root / (name + ".err")); }
+  std::size_t timesLogged(const std::string& name, const std::string& text) const {
+    const std::string all = log(name);
+    std::size_t count = 0;
+    for (auto at = all.find(text); at != std::string::npos; at = all.find(text, at + 1)) ++count;
+    return count;
+  }
+  testing::AssertionResult comesToSay(const std::string& name, const std::string& text) {
+    if (eventually([&] { return cloud(name, "status").output.find(text) != std::string::npos; }))
+      return testing::AssertionSuccess();
+    return testing::AssertionFailure() << cloud(name, "status").output << log(name);
+  }
+
+  void switchTo(const std::string& name, const std::string& state) {
+    EXPECT_EQ(on(name, "pairwellctl", "logging " + state).status, 0);
+  }
+  std::string setting(const std::string& name, const std::string& key) {
+    return on(name, "hearthctl", "settings get cloud " + key).output;
+  }
+  // Whether the device comes to be on, its stores as well as what it answers, until the end that the other
+  // has.
+  testing::AssertionResult followsOn(const std::string& name, const std::string& other) {
+    return comesTo(name, [&] {
+      return on(name, "pairwellctl", "logging").output.starts_with("on until ") &&
+             on(name, "hearthctl", "alarms").output.find(flagKey) != std::string::npos &&
+             setting(other, endKey) != "" && setting(name, endKey) == setting(other, endKey);
+    });
+  }
+  testing::AssertionResult followsOff(const std::string& name) {
+    return comesTo(name, [&] {
+      return on(name, "pairwellctl", "logging").output == "off\n" && setting(name, endKey) == "" &&
+             on(name, "hearthctl", "alarms").output == "";
+    });
+  }
+  testing::AssertionResult comesTo(const std::string& name, const std::function<bool()>& condition) {
+    if (eventually(condition)) return testing::AssertionSuccess();
+    return testing::AssertionFailure() << log(name);
+  }
+
+  const fs::path share = root / "share";
+  const std::string url = "dir:" + share.string();
+  std::map<std::string, pid_t> running;
+};
+
+TEST_F(CloudTest, SwitchIsSharedAndWhoeverWasDownCatchesUp) {
+  for (const char* name : {"one", "two"}) start(name);
+  switchTo("one", "on");
+  EXPECT_TRUE(followsOn("two", "one"));
+  switchTo("two", "off");
+  EXPECT_TRUE(followsOff("one"));
+
+  EXPECT_EQ(stop("two", SIGKILL), -SIGKILL);
+  switchTo("one", "on");
+  ASSERT_TRUE(comesToSay("one", "waiting to go out  nothing"));
+  start("two");
+  EXPECT_TRUE(followsOn("two", "one"));
+  for (const char* name : {"one", "two"}) EXPECT_EQ(on(name, "hearthctl", "check").status, 0);
+
+  const Outcome second = run("env HEARTH_ROOT=" + (root / "two").string() + " cloudsyncd");
+  EXPECT_EQ(second.status, 1);
+  EXPECT_EQ(second.errors, "cloudsyncd: already running\n");
+  EXPECT_EQ(on("two", "hearthctl", "jobs stop com.kestrel.cloudsyncd").status, 0);
+  ASSERT_TRUE(comesTo(
+      "two", [&] { return on("two", "hearthctl", "jobs").output.find("stopped") != std::string::npos; }));
+  switchTo("two", "off");
+  const pid_t byHand = spawn("env HEARTH_ROOT=" + (root / "two").string() + " cloudsyncd", "hand");
+  EXPECT_TRUE(followsOff("one")) << "without hearthd, too";
+  ::kill(byHand, SIGTERM);
+  EXPECT_EQ(finish(byHand, "hand").status, 0);
+}
+
+TEST_F(CloudTest, FolderThatGoesAwayIsSaidAndComesBack) {
+  const fs::path elsewhere = root / "elsewhere";
+  for (const char* name : {"one", "two"}) start(name);
+  ASSERT_TRUE(comesToSay("one", "connected          yes"));
+  fs::rename(share, elsewhere);
+  ASSERT_TRUE(comesToSay("one", "connected          no, since 20"));
+  switchTo("one", "on");
+  EXPECT_TRUE(comesToSay("one", "waiting to go out  " + flagKey + ", " + endKey));
+  EXPECT_THAT(cloud("one", "status").output,
+              HasSubstr("problem            " + share.string() + ": No such file"));
+  EXPECT_EQ(timesLogged("one", "not connected: "), 1u);
+  fs::rename(elsewhere, share);
+  EXPECT_TRUE(followsOn("two", "one"));
+  EXPECT_TRUE(comesToSay("one", "waiting to go out  nothing"));
+}
+
+TEST_F(CloudTest, AnotherAccountIsTakenWholeOrNotAtAll) {
+  for (const char* name : {"one", "two"}) start(name);
+  EXPECT_EQ(cloud("two", "use " + url + " --account work").status, 0);
+  on("two", "hearthctl", "settings set cloud theirs 2");
+  EXPECT_TRUE(comesToSay("two", "waiting to go out  nothing"));
+  on("one", "hearthctl", "settings set cloud ours 1");
+
+  const std::string before = contents(root / "one/etc/cloud.json");
+  const Outcome away = cloud("one", "use dir:/nowhere --account work");
+  EXPECT_EQ(away.status, 1);
+  EXPECT_THAT(away.errors, HasSubstr("/nowhere: No such file or directory"));
+  for (const char* wrong : {"ftp:x --account work", "dir:relative --account work", "dir:/tmp --account .."})
+    EXPECT_NE(cloud("one", std::string("use ") + wrong).status, 0) << wrong;
+  EXPECT_EQ(contents(root / "one/etc/cloud.json"), before);
+  EXPECT_THAT(cloud("one", "status").output, HasSubstr(url + ", account home\n"));
+  EXPECT_EQ(setting("one", "ours"), "1\n");
+
+  EXPECT_EQ(cloud("one", "use " + url + " --account work").status, 0);
+  EXPECT_EQ(on("one", "hearthctl", "settings list cloud").output, "theirs  2\n");
+  EXPECT_TRUE(eventually([&] {
+    return timesLogged(
+               "one",
+               "Cloud KVS Notification: [\"ChangeReason\": 3, \"ChangedKeys\": [\"ours\", \"theirs\"]]") == 1;
+  })) << log("one");
+  EXPECT_THAT(
+      contents(root / "one/var/settings/cloud/com.kestrel.bluetooth.cloud.settings.json.account-home"),
+      HasSubstr("\"ours\""));
+  stop("one");
+  start("one");
+  EXPECT_THAT(cloud("one", "status").output, HasSubstr(url + ", account work\n"));
+  switchTo("one", "on");
+  EXPECT_TRUE(followsOn("two", "one"));
+}
+
+TEST_F(CloudTest, CopyOfADiskIsToldToTakeANewIdentity) {
+  start("one");
+  switchTo("one", "on");
+  ASSERT_TRUE(comesToSay("one", "device             "));
+  stop("one");
+  for (const char* part : {"etc", "var"}) {
+    fs::create_directories(root / "copy");
+    fs::copy(root / "one" / part, root / "copy" / part, fs::copy_options::recursive);
+  }
+  start("one");
+  switchTo("one", "off");
+  EXPECT_TRUE(comesToSay("one", "waiting to go out  nothing"));
+  start("copy");
+  EXPECT_TRUE(followsOff("copy")) << "it reads on";
+  EXPECT_TRUE(comesToSay("copy", "hearthctl cloud new-identity"));
+  switchTo("copy", "on");
+  EXPECT_TRUE(comesToSay("copy", "waiting to go out  " + flagKey));
+  EXPECT_EQ(cloud("copy", "new-identity").status, 0);
+  EXPECT_TRUE(followsOn("one", "copy"));
+  EXPECT_EQ(timesLogged("copy", "publishes under this device's name"), 1u);
+  EXPECT_EQ(timesLogged("one", "publishes under this device's name"), 0u);
+}
+
+TEST_F(CloudTest, StrangersDocumentsAreRefusedOnceAndForgotten) {
+  for (const char* name : {"one", "two"}) start(name);
+  const std::string problem = "the document of device stranger is refused: ";
+  for (const char* text : {"{", "{", "{"}) {
+    write("share/home/stranger.json", text);
+    switchTo("two", "on");
+    EXPECT_TRUE(followsOn("one", "two"));
+    switchTo("two", "off");
+    EXPECT_TRUE(followsOff("one"));
+  }
+  EXPECT_EQ(timesLogged("one", problem), 1u) << log("one");
+  EXPECT_TRUE(comesToSay("one", "device             stranger, newest change never, refused: "));
+  EXPECT_EQ(cloud("one", "forget stranger").status, 0);
+  EXPECT_FALSE(fs::exists(share / "home/stranger.json"));
+  EXPECT_TRUE(
+      eventually([&] { return cloud("one", "status").output.find("stranger") == std::string::npos; }));
+  EXPECT_THAT(cloud("one", "--json status").output,
+              AllOf(testing::StartsWith("{\"account\":\"home\",\"connected\":true,"), HasSubstr("\"in\":1"),
+                    HasSubstr("\"newest\":1")));
+  if (::geteuid() != 0) GTEST_SKIP() << "only root can be another user";
+  EXPECT_EQ(run("hearthctl --root " + (root / "one").string() + " cloud forget x", nobody).status, 4);
+}
+
+TEST_F(CloudTest, WhatIsWrongIsSaidBeforeAnythingIsWritten) {
+  for (const char* wrong : {"--cloud dir:/tmp", "--account home", "--cloud http:x --account home",
+                            "--cloud dir:tmp --account home", "--cloud dir:/tmp?poll=0 --account home",
+                            "--cloud dir:/tmp --account a/b"})
+    EXPECT_EQ(on("three", "hearthctl", std::string("init ") + wrong).status, 2) << wrong;
+  EXPECT_FALSE(fs::exists(root / "three"));
+  const std::string before = contents(root / "one/etc/cloud.json");
+  EXPECT_THAT(join("one", url + "?poll=1").output, HasSubstr("kept"));
+  EXPECT_EQ(contents(root / "one/etc/cloud.json"), before);
+  const Outcome unreachable = cloud("one", "status");
+  EXPECT_EQ(unreachable.status, 3);
+  EXPECT_THAT(unreachable.errors, HasSubstr("cloudsyncd"));
+
+  write("one/etc/cloud.json", "{\n oops}");
+  start("one");
+  EXPECT_EQ(timesLogged("one", "one/etc/cloud.json: line 2"), 1u) << log("one");
+  EXPECT_THAT(on("one", "hearthctl", "check").output, HasSubstr("one/etc/cloud.json: line 2"));
+  EXPECT_EQ(cloud("one", "use '" + url + "?poll=0.1' --account home").status, 0) << "which mends it";
+  start("two");
+  switchTo("two", "on");
+  EXPECT_TRUE(followsOn("one", "two")) << "by looking alone";
+}
+
+}  // namespace
+}  // namespace processes
