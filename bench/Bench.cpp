@@ -1,28 +1,24 @@
 // Measures a whole device beside the bare work, in one run. Usage: pairwell_bench PROGRAMS OUTPUT.json
 #include <unistd.h>
 
-#include <algorithm>
 #include <cstdio>
 #include <filesystem>
 #include <fstream>
-#include <functional>
+#include <map>
 #include <stdexcept>
 #include <string>
 #include <thread>
+#include <utility>
 
+#include "bench/Account.hpp"
 #include "bench/Device.hpp"
 #include "bench/Peers.hpp"
-#include "platform/linux/BusServiceListener.hpp"
-#include "platform/linux/HearthInterface.hpp"
-#include "platform/linux/Json.hpp"
+#include "bench/Report.hpp"
 
 namespace bench {
 namespace {
 
 using namespace std::chrono_literals;
-using platform::Dictionary;
-using platform::List;
-using platform::Value;
 using platform::linux_::BusClient;
 
 constexpr std::size_t calls = 20'000;
@@ -30,43 +26,11 @@ constexpr std::size_t switches = 200;
 constexpr int starts = 20;
 constexpr auto idleTime = 30s;
 
-struct Figure {
-  double p50, p99;
-};
-
-Figure percentiles(std::vector<double> times) {
-  std::sort(times.begin(), times.end());
-  return {times.at(times.size() / 2), times.at(times.size() * 99 / 100)};
-}
-
-Dictionary results;
-
-void report(const char* what, Figure figure, const char* unit) {
-  std::printf("%-46s p50 %9.1f %s   p99 %9.1f %s\n", what, figure.p50, unit, figure.p99, unit);
-  std::fflush(stdout);
-  results.emplace(what, Dictionary{{"p50", figure.p50}, {"p99", figure.p99}, {"unit", unit}});
-}
-
-void report(const char* what, double figure, const char* unit) {
-  std::printf("%-46s %13.2f %s\n", what, figure, unit);
-  std::fflush(stdout);
-  results.emplace(what, Dictionary{{"value", figure}, {"unit", unit}});
-}
-
-const platform::linux_::BusInterface& clientInterface() {
-  static const auto interface = platform::linux_::clientInterface(pairwell::names::service);
-  return interface;
-}
-
-void mustAnswer(const platform::Result<platform::linux_::BusReply>& reply) {
-  if (!reply || !std::holds_alternative<List>(*reply)) throw std::runtime_error("a call failed");
-}
-
 std::vector<double> timeCalls(BusClient& client, const std::string& operation) {
   std::vector<double> times;
-  for (std::size_t call = 0; call < calls; ++call) {
+  for (std::size_t count = 0; count < calls; ++count) {
     const double start = now();
-    mustAnswer(client.call(clientInterface(), operation, {}, 5s));
+    call(client, clientInterface(), operation);
     times.push_back(now() - start);
   }
   return times;
@@ -87,17 +51,13 @@ void measureReads(Device& device) {
 // A switch counts as done when its announcement arrives: by then both stores and the alarm are durable.
 std::vector<double> timeSwitches(Device& device) {
   const auto client = device.client();
-  auto watcher = BusClient::connect(device.paths().hearthdSocket(), 5s);
-  if (!watcher) throw std::runtime_error("hearthd does not answer");
-  mustAnswer((*watcher)->call(platform::linux_::hearthInterface(), "Watch",
-                              {std::string(pairwell::names::settingsChanged)}, 5s));
+  const auto watcher = device.hearthdClient();
+  watch(*watcher, pairwell::names::settingsChanged);
   std::vector<double> times;
   for (std::size_t count = 0; count < switches; ++count) {
     const double start = now();
-    mustAnswer(
-        client->call(clientInterface(), "SetKestrelAudioAccessoryLimitedLogging", {count % 2 == 0}, 5s));
-    const auto signal = (*watcher)->nextSignal(5s);
-    if (!signal || !*signal) throw std::runtime_error("a switch was not announced");
+    call(*client, clientInterface(), "SetKestrelAudioAccessoryLimitedLogging", {count % 2 == 0});
+    awaitSignal(*watcher);
     times.push_back(now() - start);
   }
   return times;
@@ -129,18 +89,26 @@ long wakeUps(pid_t pid) {
   return sum;
 }
 
-void measureIdle(Device& device) {
-  const pid_t daemon = device.pairwelld();
-  report("pairwelld, resident", static_cast<double>(statusNumber(daemon, "", "VmRSS")) / 1024, "MiB");
-  report("hearthd, resident", static_cast<double>(statusNumber(device.hearthd(), "", "VmRSS")) / 1024, "MiB");
-  report("pairwelld, resident and not shared",
-         static_cast<double>(statusNumber(daemon, "", "RssAnon")) / 1024, "MiB");
+void reportMemory(const std::string& name, pid_t pid) {
+  const auto mebibytes = [&](const char* field) {
+    return static_cast<double>(statusNumber(pid, "", field)) / 1024;
+  };
+  report(name + ", resident", mebibytes("VmRSS"), "MiB");
+  report(name + ", resident and not shared", mebibytes("RssAnon"), "MiB");
+}
+
+// `member` shares an account.
+void measureIdle(Device& device, Device& member) {
+  const std::pair<std::string, pid_t> processes[] = {{"pairwelld", device.job("pairwelld")},
+                                                     {"hearthd", device.hearthd()},
+                                                     {"cloudsyncd", member.job("cloudsyncd")}};
+  for (const auto& [name, pid] : processes) reportMemory(name, pid);
   std::this_thread::sleep_for(1s);  // answers to the clients that just left
-  const long before = wakeUps(daemon), beforeHearthd = wakeUps(device.hearthd());
+  std::map<std::string, long> before;
+  for (const auto& [name, pid] : processes) before[name] = wakeUps(pid);
   std::this_thread::sleep_for(idleTime);
-  report("pairwelld, wake-ups in 30 idle seconds", static_cast<double>(wakeUps(daemon) - before), "");
-  report("hearthd, wake-ups in 30 idle seconds",
-         static_cast<double>(wakeUps(device.hearthd()) - beforeHearthd), "");
+  for (const auto& [name, pid] : processes)
+    report(name + ", wake-ups in 30 idle seconds", static_cast<double>(wakeUps(pid) - before[name]), "");
 }
 
 void measureStarts(Device& device) {
@@ -149,7 +117,7 @@ void measureStarts(Device& device) {
     device.stop();
     const double start = now();
     device.start();
-    mustAnswer(device.client()->call(clientInterface(), "GetCurrentUserGivenName", {}, 5s));
+    call(*device.client(), clientInterface(), "GetCurrentUserGivenName");
     times.push_back((now() - start) / 1000);
   }
   report("exec of hearthd to pairwelld's first answer", percentiles(times), "ms");
@@ -158,15 +126,19 @@ void measureStarts(Device& device) {
 void run(const std::string& programs, const std::string& output) {
   char self[4096];
   const ssize_t length = ::readlink("/proc/self/exe", self, sizeof self);
-  Device device(programs, std::string(self, static_cast<std::size_t>(length)));
+  const std::string benchmark(self, static_cast<std::size_t>(length));
+  Device device(programs, benchmark);
   device.start();
   measureReads(device);
   measureSwitches(device);
   measureStarts(device);
   device.client();
-  measureIdle(device);
-  const auto text = platform::linux_::printJson(results, platform::linux_::JsonStyle::indented);
-  if (!text || !(std::ofstream(output) << *text << '\n')) throw std::runtime_error("cannot write " + output);
+  Account account(programs, benchmark);
+  account.measureSwitches();
+  measureIdle(device, account.member());
+  account.measureCatchingUp();
+  reportMemory("cloudsyncd with 1000 keys", account.member().job("cloudsyncd"));
+  writeReport(output);
 }
 
 }  // namespace

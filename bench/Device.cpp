@@ -11,22 +11,26 @@
 #include <fstream>
 #include <stdexcept>
 #include <thread>
+#include <utility>
+
+#include "platform/linux/BusServiceListener.hpp"
+#include "platform/linux/HearthInterface.hpp"
 
 namespace bench {
 
 namespace fs = std::filesystem;
 using platform::linux_::BusClient;
 
-Device::Device(const std::string& programs, const std::string& benchmark) {
+Device::Device(const std::string& programs, const std::string& benchmark, const std::string& options) {
   char name[] = "/tmp/pairwell-bench-XXXXXX";
   if (!::mkdtemp(name)) throw std::runtime_error("no temporary folder");
   root = name;
   _paths = platform::linux_::Paths::under(root);
   fs::create_directory(root + "/bin");
-  for (const char* program : {"hearthd", "pairwelld", "hearthctl", "pairwellctl"}) {
+  for (const char* program : {"hearthd", "pairwelld", "cloudsyncd", "hearthctl", "pairwellctl"}) {
     fs::copy_file(programs + "/" + program, root + "/bin/" + program);
   }
-  const std::string init = root + "/bin/hearthctl --root " + root + " init >/dev/null";
+  const std::string init = root + "/bin/hearthctl --root " + root + " init " + options + " >/dev/null";
   if (std::system(init.c_str()) != 0) throw std::runtime_error("hearthctl init failed");
   std::ofstream(_paths.entitlements() + "/bench.json")
       << "{\"executable\": \"" << benchmark << "\", \"entitlements\": {\""
@@ -55,21 +59,51 @@ void Device::stop() {
   pid = -1;
 }
 
-pid_t Device::pairwelld() const {
-  std::ifstream children("/proc/" + std::to_string(pid) + "/task/" + std::to_string(pid) + "/children");
-  pid_t child = -1;
-  children >> child;
-  return child;
+pid_t Device::job(const std::string& program) const {
+  const auto deadline = std::chrono::steady_clock::now() + std::chrono::seconds(10);
+  const std::string process = "/proc/" + std::to_string(pid);
+  while (std::chrono::steady_clock::now() < deadline) {
+    std::ifstream children(process + "/task/" + std::to_string(pid) + "/children");
+    for (pid_t child; children >> child;) {
+      std::string name;
+      std::getline(std::ifstream("/proc/" + std::to_string(child) + "/comm"), name);
+      if (name == program) return child;
+    }
+    std::this_thread::sleep_for(std::chrono::milliseconds(1));
+  }
+  throw std::runtime_error(program + " does not run");
 }
 
-std::unique_ptr<BusClient> Device::client() const {
+std::unique_ptr<BusClient> Device::connect(const std::string& socket) {
   const auto deadline = std::chrono::steady_clock::now() + std::chrono::seconds(10);
   while (std::chrono::steady_clock::now() < deadline) {
-    auto client = BusClient::connect(clientSocket(), std::chrono::seconds(5));
+    auto client = BusClient::connect(socket, std::chrono::seconds(5));
     if (client) return std::move(*client);
     std::this_thread::sleep_for(std::chrono::microseconds(200));
   }
-  throw std::runtime_error("the client service does not answer");
+  throw std::runtime_error(socket + ": nobody answers");
+}
+
+platform::List call(BusClient& client, const platform::linux_::BusInterface& interface,
+                    const std::string& operation, const platform::List& arguments) {
+  auto reply = client.call(interface, operation, arguments, std::chrono::seconds(5));
+  auto* results = reply ? std::get_if<platform::List>(&*reply) : nullptr;
+  if (!results) throw std::runtime_error(operation + " failed");
+  return std::move(*results);
+}
+
+const platform::linux_::BusInterface& clientInterface() {
+  static const auto interface = platform::linux_::clientInterface(pairwell::names::service);
+  return interface;
+}
+
+void watch(BusClient& client, std::string_view notification) {
+  call(client, platform::linux_::hearthInterface(), "Watch", {std::string(notification)});
+}
+
+void awaitSignal(BusClient& client) {
+  const auto signal = client.nextSignal(std::chrono::seconds(5));
+  if (!signal || !*signal) throw std::runtime_error("a switch was not announced");
 }
 
 }  // namespace bench

@@ -5,6 +5,7 @@
 
 #include <memory>
 #include <string>
+#include <string_view>
 
 #include "pairwelld/Names.hpp"
 #include "platform/linux/BusClient.hpp"
@@ -16,23 +17,38 @@ class Device {
  public:
   // `programs` is the folder of the built programs; they are copied into the root, so that their owner and
   // mode serve the entitlement files. `benchmark` is this program: it is granted the client's entitlement.
-  explicit Device(const std::string& programs, const std::string& benchmark);
+  // `options` are further ones of hearthctl init.
+  Device(const std::string& programs, const std::string& benchmark, const std::string& options = "");
   ~Device();  // ends hearthd and removes the root
 
   void start();
   void stop();
 
   pid_t hearthd() const { return pid; }
-  pid_t pairwelld() const;
+  // The process of a job, by the program's name; once it runs.
+  pid_t job(const std::string& program) const;
   const platform::linux_::Paths& paths() const { return _paths; }
-  std::string clientSocket() const { return _paths.serviceSocket(pairwell::names::service); }
   // Connected and authenticated, trying until it is served.
-  std::unique_ptr<platform::linux_::BusClient> client() const;
+  std::unique_ptr<platform::linux_::BusClient> client() const {
+    return connect(_paths.serviceSocket(pairwell::names::service));
+  }
+  std::unique_ptr<platform::linux_::BusClient> hearthdClient() const {
+    return connect(_paths.hearthdSocket());
+  }
 
  private:
+  static std::unique_ptr<platform::linux_::BusClient> connect(const std::string& socket);
+
   std::string root;
   platform::linux_::Paths _paths;
   pid_t pid = -1;
 };
+
+// A call that fails ends the benchmark; `client` is one of pairwelld's, or of hearthd's.
+platform::List call(platform::linux_::BusClient& client, const platform::linux_::BusInterface& interface,
+                    const std::string& operation, const platform::List& arguments = {});
+const platform::linux_::BusInterface& clientInterface();
+void watch(platform::linux_::BusClient& client, std::string_view notification);
+void awaitSignal(platform::linux_::BusClient& client);
 
 }  // namespace bench
