@@ -13,6 +13,7 @@ namespace cloudsync {
 struct Membership {
   std::string url;
   std::string account;
+  friend bool operator==(const Membership&, const Membership&) = default;
 };
 
 // std::errc::no_such_file_or_directory without a file; Outcome::malformedFile for a wrong one, and `problem`

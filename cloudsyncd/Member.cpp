@@ -4,6 +4,7 @@
 #include <chrono>
 #include <utility>
 
+#include "cloudsyncd/core/Document.hpp"
 #include "pairwelld/Names.hpp"
 #include "platform/LogSink.hpp"
 #include "platform/UUID.hpp"
@@ -85,11 +86,13 @@ std::unique_ptr<Member::Connection> Member::connect(const Membership& membership
 void Member::use(const Membership& membership, std::function<void(const std::string&)> done) {
   if (next) return done("another account is being tried");
   std::string wrong;
-  const auto settled = [this, done](const std::string& failure) {
-    if (failure.empty()) std::swap(current, next);
-    // Not here: this is the synchroniser's own call.
+  const auto settled = [this, membership, done](std::string failure) {
+    if (failure.empty()) failure = nameInFile(membership);
+    // The former one ends at once, or it could still take the replica back to its account.
+    if (failure.empty()) current = std::move(next);
+    // Not here: this is the new synchroniser's own call.
     loop.async([this, done, failure] {
-      next.reset();
+      if (!failure.empty()) next.reset();
       rearm();
       done(failure);
     });
@@ -100,7 +103,19 @@ void Member::use(const Membership& membership, std::function<void(const std::str
   next->synchroniser->start();
 }
 
+// Where the account is the one that the replica has already, nothing has changed but the way to it. Answers
+// the problem.
+std::string Member::nameInFile(const Membership& membership) {
+  std::string ignored;
+  const auto there = readCloudFile(files, paths.cloud(), ignored);
+  if (there && *there == membership) return "";
+  const auto written = writeCloudFile(files, paths.cloud(), membership);
+  return written ? "" : paths.cloud() + ": " + written.error().message();
+}
+
 Result<void> Member::forget(const std::string& device) {
+  // It becomes part of a path.
+  if (!isName(device)) return std::make_error_code(std::errc::invalid_argument);
   if (!current) return platform::Outcome::notConnected;
   return current->transport->forget(device);
 }

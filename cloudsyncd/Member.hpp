@@ -42,6 +42,7 @@ class Member {
   std::unique_ptr<Connection> connect(const Membership& membership,
                                       std::function<void(const std::string&)> settled,
                                       std::function<platform::Result<void>()> changing, std::string& problem);
+  std::string nameInFile(const Membership& membership);
   void rearm();
   void timePassed();
 

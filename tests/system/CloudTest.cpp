@@ -154,9 +154,14 @@ TEST_F(CloudTest, AnotherAccountIsTakenWholeOrNotAtAll) {
   EXPECT_THAT(
       contents(root / "one/var/settings/cloud/com.kestrel.bluetooth.cloud.settings.json.account-home"),
       HasSubstr("\"ours\""));
+  // The same account elsewhere.
+  const std::string moved = "dir:" + (root / "moved").string();
+  fs::create_directory(root / "moved");
+  for (const char* name : {"one", "two"})
+    EXPECT_EQ(cloud(name, "use " + moved + " --account work").status, 0);
   stop("one");
   start("one");
-  EXPECT_THAT(cloud("one", "status").output, HasSubstr(url + ", account work\n"));
+  EXPECT_THAT(cloud("one", "status").output, HasSubstr(moved + ", account work\n"));
   switchTo("one", "on");
   EXPECT_TRUE(followsOn("two", "one"));
 }
@@ -196,6 +201,9 @@ TEST_F(CloudTest, StrangersDocumentsAreRefusedOnceAndForgotten) {
   }
   EXPECT_EQ(timesLogged("one", problem), 1u) << log("one");
   EXPECT_TRUE(comesToSay("one", "device             stranger, newest change never, refused: "));
+  write("share/precious.json", "");
+  EXPECT_EQ(cloud("one", "forget ../precious").status, 1);
+  EXPECT_TRUE(fs::exists(share / "precious.json"));
   EXPECT_EQ(cloud("one", "forget stranger").status, 0);
   EXPECT_FALSE(fs::exists(share / "home/stranger.json"));
   EXPECT_TRUE(
