@@ -65,7 +65,9 @@ void Synchroniser::received(const std::string& name, std::string_view text) {
         "backup. It goes on reading, and publishes again after: hearthctl cloud new-identity");
   }
   // What comes before the connection stands is taken in as one.
-  if (isConnected) takeIn(device.entries);
+  if (!isConnected) return;
+  takeIn(device.entries);
+  if (name == ownDevice()) publishIfNews();  // an engine may have gone back to an older one
 }
 
 void Synchroniser::unreadable(const std::string& device, const std::string& why) {

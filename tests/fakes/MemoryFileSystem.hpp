@@ -20,6 +20,7 @@ class MemoryFileSystem : public FileSystem {
   int calls = 0;
   int failFrom = std::numeric_limits<int>::max();
   int failure = EIO;
+  std::function<void()> onLock;        // where another process gets its chance: just before a write
   std::function<void()> onFolderSync;  // where another thread gets its chance: a file has just been replaced
   std::set<std::string> unreadable, immovable;  // paths that cannot be opened; or renamed
 
@@ -43,6 +44,12 @@ class MemoryFileSystem : public FileSystem {
     pending.push_back(path);
   }
   std::string bytes(const std::string& path) const { return now.at(path)->bytes; }
+  // What a power cut would leave of it.
+  std::string durableBytes(const std::string& path) const {
+    const auto found = durable.find(path);
+    return found == durable.end() ? "" : found->second->synced;
+  }
+  bool hasEvents() const { return !pending.empty(); }
   bool exists(const std::string& path) const { return now.contains(path); }
   // Events are held back until now.
   void deliverEvents() {
@@ -100,6 +107,7 @@ class MemoryFileSystem : public FileSystem {
   Result<std::vector<std::string>> list(const std::string&) override { return code(ENOSYS); }
   // One that is held cannot be waited for on a single thread.
   Result<std::unique_ptr<FileLock>> lock(const std::string& path) override {
+    if (onLock) onLock();
     const int error = check(path);
     if (error != 0 && (error != ENOENT || !hasFolder(parentOf(path)))) return code(error);
     if (error != 0) now[path] = std::make_shared<Node>(inodes);
