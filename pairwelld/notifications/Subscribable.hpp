@@ -2,7 +2,9 @@
 #pragma once
 
 #include <concepts>
+#include <functional>
 #include <memory>
+#include <optional>
 #include <vector>
 
 #include "pairwelld/notifications/Subscription.hpp"
@@ -30,20 +32,23 @@ void unsubscribeFrom(Publisher& publisher, const Subscription<typename Publisher
   });
 }
 
-template <class Publisher>
+// `remove` is called with the publisher and the handle to take off its list.
+template <class Publisher, class Remove>
 Subscription<typename Publisher::Subscriber> subscribeTo(
-    Publisher& publisher, const std::shared_ptr<typename Publisher::Subscriber>& subscriber) {
+    Publisher& publisher, const std::shared_ptr<typename Publisher::Subscriber>& subscriber, Remove remove) {
   using Handle = Subscription<typename Publisher::Subscriber>;
-  const Handle subscription(
-      subscriber, [weak = publisher.weak_from_this()](const Handle& handle) -> platform::Result<void> {
-        if (const auto self = weak.lock()) unsubscribeFrom(*self, handle);
-        return {};
-      });
+  std::optional<Handle> subscription;
   publisher.subscriptionQueue->sync([&] {
     publisher.subscriptionQueue->assertCurrent();
-    publisher.subscriptions.push_back(subscription);
+    subscription.emplace(
+        subscriber,
+        [weak = publisher.weak_from_this(), remove](const Handle& handle) -> platform::Result<void> {
+          if (const auto self = weak.lock()) std::invoke(remove, *self, handle);
+          return {};
+        });
+    publisher.subscriptions.push_back(*subscription);
   });
-  return subscription;
+  return *subscription;
 }
 
 }  // namespace pairwell

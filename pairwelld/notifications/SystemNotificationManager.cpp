@@ -1,7 +1,5 @@
 #include "pairwelld/notifications/SystemNotificationManager.hpp"
 
-#include <cmath>
-#include <cstdint>
 #include <utility>
 
 #include "pairwelld/Log.hpp"
@@ -59,7 +57,7 @@ void SystemNotificationManager::cancelAlarm(std::string_view name) {
 
 Subscription<SystemNotificationManagerSubscribing> SystemNotificationManager::subscribe(
     const std::shared_ptr<Subscriber>& subscriber) {
-  return subscribeTo(*this, subscriber);
+  return subscribeTo(*this, subscriber, unsubscribeFrom<SystemNotificationManager>);
 }
 
 void SystemNotificationManager::handle(const platform::Dictionary& event) {

@@ -118,7 +118,7 @@ void KeyValueStoreManager::setValue(const std::vector<KeyValueSource>& sources,
 
 Subscription<KeyValueStoreManagerSubscribing> KeyValueStoreManager::subscribe(
     const std::shared_ptr<Subscriber>& subscriber) {
-  return subscribeTo(*this, subscriber);
+  return subscribeTo(*this, subscriber, &KeyValueStoreManager::unsubscribe);
 }
 
 void KeyValueStoreManager::unsubscribe(const Subscription<Subscriber>& subscription) {
