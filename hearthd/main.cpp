@@ -97,7 +97,9 @@ void announceReady() {
 }  // namespace
 
 int main(int count, char** arguments) {
-  if (count == 2 && std::string_view(arguments[1]) == "--help") return std::puts(usage), 0;
+  for (const char* help : {"--help", "-h"}) {
+    if (count == 2 && std::string_view(arguments[1]) == help) return std::puts(usage), 0;
+  }
   const auto root = rootFromArguments(count, arguments);
   if (!root) {
     say(std::string(usage) + "\n");

@@ -24,7 +24,8 @@ std::int64_t microsecondsOf(Time time) {
 
 // The stamp of a burst that begins with `write`: of now, behind everything that is known. Stamps of more than
 // a day ahead are some clock's fault, and are not followed, or that clock would rule the others for good;
-// only the value that is written over, which has to lose, draws its own along.
+// only the value that is written over, which has to lose, draws its own along, and with it what is written
+// together.
 CloudStamp nextStamp(const Dictionary& entries, const CloudWrite& write) {
   constexpr std::int64_t day = 86'400'000'000;
   const std::int64_t now = microsecondsOf(write.now);

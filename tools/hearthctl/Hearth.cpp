@@ -1,11 +1,12 @@
 #include "tools/hearthctl/Hearth.hpp"
-#include "pairwelld/Names.hpp"
 
 #include <algorithm>
 #include <chrono>
 #include <cmath>
 #include <cstdint>
 #include <utility>
+
+#include "pairwelld/Names.hpp"
 
 namespace tools {
 namespace {
