@@ -54,6 +54,9 @@ class FileSystem {
  public:
   virtual ~FileSystem() = default;
   virtual Result<std::unique_ptr<File>> openToRead(const std::string& path) = 0;
+  // The same in a folder that strangers write to: no link is followed, and nothing but a plain file opened
+  // (Outcome::notPermitted).
+  virtual Result<std::unique_ptr<File>> openUntrusted(const std::string& path) = 0;
   // A new file, mode 0600; fails where one exists.
   virtual Result<std::unique_ptr<File>> create(const std::string& path) = 0;
   virtual Result<FileIdentity> identity(const std::string& path) = 0;

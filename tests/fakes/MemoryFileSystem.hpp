@@ -51,12 +51,18 @@ class MemoryFileSystem : public FileSystem {
   }
   bool hasEvents() const { return !pending.empty(); }
   bool exists(const std::string& path) const { return now.contains(path); }
+  // With everything in it, as if it had been moved out of sight.
+  void removeFolder(const std::string& path) {
+    std::erase_if(now, [&](const auto& entry) { return (entry.first + "/").starts_with(path + "/"); });
+    pending.push_back(path);
+  }
   // Events are held back until now.
   void deliverEvents() {
     for (const std::string& path : std::exchange(pending, {})) {
       for (const Watched& watch : std::vector(watches)) {
-        if (watch.token.expired() || watch.folder != parentOf(path)) continue;
-        watch.changed(path.substr(watch.folder.size() + 1));
+        if (watch.token.expired()) continue;
+        if (watch.folder == path) watch.changed("");
+        if (watch.folder == parentOf(path)) watch.changed(path.substr(watch.folder.size() + 1));
       }
     }
   }
@@ -65,6 +71,8 @@ class MemoryFileSystem : public FileSystem {
     if (const int error = unreadable.contains(path) ? EACCES : check(path)) return code(error);
     return open(path);
   }
+  // There are none but plain files.
+  Result<std::unique_ptr<File>> openUntrusted(const std::string& path) override { return openToRead(path); }
   Result<std::unique_ptr<File>> create(const std::string& path) override {
     const int error = check(path);
     if (error != ENOENT || !hasFolder(parentOf(path))) return code(error != 0 ? error : EEXIST);
@@ -103,8 +111,14 @@ class MemoryFileSystem : public FileSystem {
     makeFolders(path);
     return {};
   }
-  // What lies in memory is never listed.
-  Result<std::vector<std::string>> list(const std::string&) override { return code(ENOSYS); }
+  Result<std::vector<std::string>> list(const std::string& folder) override {
+    if (const int error = check(folder)) return code(error);
+    std::vector<std::string> names;
+    for (const auto& [path, node] : now) {
+      if (path != "/" && parentOf(path) == folder) names.push_back(path.substr(path.rfind('/') + 1));
+    }
+    return names;
+  }
   // One that is held cannot be waited for on a single thread.
   Result<std::unique_ptr<FileLock>> lock(const std::string& path) override {
     if (onLock) onLock();
