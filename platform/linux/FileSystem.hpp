@@ -70,9 +70,9 @@ class FileSystem {
   // Waits for the lock on `path`, a file of its own that is made if need be. Opened read-only, or every
   // release would wake the watchers of its folder.
   virtual Result<std::unique_ptr<FileLock>> lock(const std::string& path) = 0;
-  // `changed` gets the name of each file in `folder` that was replaced, written or deleted, and an empty name
-  // when everything may have changed (an overflow, the folder itself renamed or made anew). It is called on
-  // the delivery thread; after the watch has been destroyed it is not.
+  // `changed` gets the name of each file in `folder` that was replaced, written, deleted or moved away, and
+  // an empty name when everything may have changed (an overflow, the folder itself renamed or made anew). It
+  // is called on the delivery thread; after the watch has been destroyed it is not.
   virtual Result<std::unique_ptr<FolderWatch>> watch(
       const std::string& folder, std::function<void(const std::string& name)> changed) = 0;
 };
