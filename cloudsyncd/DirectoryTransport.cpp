@@ -1,5 +1,7 @@
 #include "cloudsyncd/DirectoryTransport.hpp"
 
+#include <algorithm>
+#include <cerrno>
 #include <set>
 #include <utility>
 
@@ -11,10 +13,17 @@ namespace {
 
 using platform::Outcome;
 using platform::Result;
+using platform::linux_::FileIdentity;
 
 // An account's devices are a few; this bounds what a folder full of strangers' files can cost.
 constexpr std::size_t devicesRead = 256;
 constexpr std::string_view ending = ".json";
+
+// Some file systems know times of changes to 2 s only, and give a new file the old one's number: until then
+// an identity that stays the same proves nothing.
+constexpr std::chrono::milliseconds coarsestTime{2000};
+// No event tells that what could not be read now can be.
+constexpr std::chrono::milliseconds untilReadAgain{30'000};
 
 // Absent for what is no document: temporary files, files of other programs.
 std::optional<std::string> deviceOf(const std::string& file) {
@@ -24,6 +33,24 @@ std::optional<std::string> deviceOf(const std::string& file) {
 }
 
 bool isMissing(const std::error_code& error) { return error == std::errc::no_such_file_or_directory; }
+
+// Whether a folder is not there, rather than full or read-only: its own, or the file system around it.
+bool isAway(const std::error_code& error) {
+  return isMissing(error) || error == std::errc::not_a_directory || error == std::errc::no_such_device ||
+         error == std::errc::not_connected || error == std::error_code(ESTALE, std::system_category());
+}
+
+Result<std::string> read(platform::linux_::FileSystem& files, const std::string& path) {
+  const auto file = files.openUntrusted(path);
+  if (!file) return file.error();
+  return (*file)->readAll(documentBytes);
+}
+
+// What is wrong with the file itself; empty where it may be read another time.
+std::string lastingProblem(const std::error_code& error) {
+  if (error == Outcome::tooLarge) return "it is larger than " + std::to_string(documentBytes) + " bytes";
+  return error == Outcome::notPermitted ? "it is no plain file" : "";
+}
 
 }  // namespace
 
@@ -56,13 +83,14 @@ void DirectoryTransport::later(std::function<void(DirectoryTransport&)> work) {
 void DirectoryTransport::connect() {
   const auto there = files.identity(place.folder);
   if (!there) return disconnect(there.error());
-  if (const auto made = files.makeFolder(folder); !made) return disconnect(made.error());
+  const auto made = platform::linux_::makeFolderDurably(files, folder);
+  if (!made) return disconnect(made.error());
   if (!place.poll) {
     if (const auto begun = beginWatching(); !begun) return disconnect(begun.error());
   }
   known.clear();
   isConnected = true;
-  look();
+  look(true);
   if (!isConnected) return;
   retry.succeeded();
   client->connected();
@@ -92,52 +120,55 @@ void DirectoryTransport::disconnect(const std::error_code& error) {
 }
 
 void DirectoryTransport::changed(const std::string& name) {
-  if (name.empty()) return look();
-  if (const auto device = deviceOf(name)) lookAt(*device);
+  if (name.empty()) return look(true);
+  if (const auto device = deviceOf(name)) lookAt(*device, true);
 }
 
-void DirectoryTransport::look() {
+void DirectoryTransport::look(bool all) {
   const auto names = files.list(folder);
   if (!names) return disconnect(names.error());
+  nextLook = place.poll ? std::optional(steady() + *place.poll) : std::nullopt;
   std::set<std::string> devices;
+  for (const auto& [device, seen] : known) devices.insert(device);
   for (const std::string& name : *names) {
     if (auto device = deviceOf(name)) devices.insert(std::move(*device));
   }
-  for (const auto& [device, identity] : std::map(known)) devices.insert(device);
-  for (const std::string& device : devices) lookAt(device);
-  if (place.poll) nextLook = steady() + *place.poll;
+  for (const std::string& device : devices) lookAt(device, all);
 }
 
-void DirectoryTransport::lookAt(const std::string& device) {
-  const auto before = known.find(device);
+void DirectoryTransport::lookAt(const std::string& device, bool always) {
   const auto identity = files.identity(pathOf(device));
   if (!identity && isMissing(identity.error())) {
-    if (before == known.end()) return;
-    known.erase(before);
-    return client->removed(device);
-  }
-  if (before == known.end() && known.size() >= devicesRead) {
-    if (!std::exchange(isCrowded, true))
-      platform::hearthLog("cloud").error("%s: more than %u documents; further ones are not read", folder,
-                                         static_cast<unsigned>(devicesRead));
+    if (known.erase(device) > 0) client->removed(device);
     return;
   }
-  // Where there are events, each is a change.
-  if (place.poll && before != known.end() && identity && before->second == *identity) return;
-  const auto text = identity ? platform::linux_::readFile(files, pathOf(device), documentBytes)
-                             : Result<std::string>(identity.error());
-  known[device] = identity && text ? std::optional(*identity) : std::nullopt;
+  if (!hasRoomFor(device)) return;
+  Known& seen = known[device];
+  const Steady now = steady();
+  if (!identity || seen.identity != *identity) seen = {identity ? *identity : FileIdentity(), now};
+  if (seen.isSettled && !always) return;
+  const auto text = identity ? read(files, pathOf(device)) : Result<std::string>(identity.error());
+  seen.isSettled = text && now - seen.since >= coarsestTime;
   if (text) return client->received(device, *text);
-  client->unreadable(device, text.error() == Outcome::tooLarge
-                                 ? "it is larger than " + std::to_string(documentBytes) + " bytes"
-                                 : text.error().message());
+  const std::string problem = lastingProblem(text.error());
+  seen.isSettled = !problem.empty();
+  if (!seen.isSettled) nextLook = std::min(nextLook.value_or(Steady::max()), now + untilReadAgain);
+  client->unreadable(device, seen.isSettled ? problem : text.error().message());
+}
+
+bool DirectoryTransport::hasRoomFor(const std::string& device) {
+  if (known.size() < devicesRead || known.contains(device)) return true;
+  if (!std::exchange(isCrowded, true))
+    platform::hearthLog("cloud").error("%s: more than %u documents; further ones are not read", folder,
+                                       static_cast<unsigned>(devicesRead));
+  return false;
 }
 
 void DirectoryTransport::publish(const std::string& device, std::string document) {
   const auto written = platform::linux_::replaceFile(files, pathOf(device), document);
   later([error = written ? std::error_code() : written.error()](DirectoryTransport& self) {
     if (!self.isConnected) return;
-    if (isMissing(error)) return self.disconnect(error);
+    if (isAway(error)) return self.disconnect(error);
     self.client->published(error);
   });
 }
@@ -155,9 +186,10 @@ std::optional<Steady> DirectoryTransport::deadline() const {
 void DirectoryTransport::timePassed(Steady now) {
   const auto due = deadline();
   if (!due || now < *due) return;
-  if (isConnected) return look();
   retry.begin();
-  connect();
+  nextLook.reset();
+  if (isConnected && place.poll) nextLook = now + *place.poll;
+  later([](DirectoryTransport& self) { return self.isConnected ? self.look(false) : self.connect(); });
 }
 
 }  // namespace cloudsync

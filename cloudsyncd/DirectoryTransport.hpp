@@ -44,9 +44,11 @@ class DirectoryTransport : public Transport, public std::enable_shared_from_this
   void connect();
   platform::Result<void> beginWatching();
   void disconnect(const std::error_code& error);
-  void look();
-  void lookAt(const std::string& device);
   void changed(const std::string& name);
+  // `all`: where an event says so, the identity of a file that is known already proves nothing.
+  void look(bool all);
+  void lookAt(const std::string& device, bool always);
+  bool hasRoomFor(const std::string& device);
   std::string pathOf(const std::string& device) const { return folder + "/" + device + ".json"; }
 
   platform::linux_::FileSystem& files;
@@ -58,9 +60,14 @@ class DirectoryTransport : public Transport, public std::enable_shared_from_this
 
   bool isConnected = false;
   Retry retry;
-  std::optional<Steady> nextLook;  // where it polls
-  // What is there, as it was last read; a file that could not be read has none.
-  std::map<std::string, std::optional<platform::linux_::FileIdentity>> known;
+  std::optional<Steady> nextLook;  // where it polls, or something could not be read
+  // A document that is there, as it was last looked at.
+  struct Known {
+    platform::linux_::FileIdentity identity;
+    Steady since;            // when it was first seen to have it
+    bool isSettled = false;  // while it has it, there is nothing to read any more
+  };
+  std::map<std::string, Known> known;
   bool isCrowded = false;
   // A watch follows what it watches, not its name: one says when the folder around the account's goes.
   std::unique_ptr<platform::linux_::FolderWatch> watch, outerWatch;

@@ -73,6 +73,7 @@ void Synchroniser::received(const std::string& name, std::string_view text) {
 void Synchroniser::unreadable(const std::string& device, const std::string& why) {
   seen.insert(device);
   refuse(device, why);
+  deadlineMoved();  // the transport's: it may try again
 }
 
 void Synchroniser::refuse(const std::string& device, const std::string& why) {
