@@ -140,6 +140,10 @@ TEST_F(CloudTest, AnotherAccountIsTakenWholeOrNotAtAll) {
   EXPECT_THAT(away.errors, HasSubstr("/nowhere: No such file or directory"));
   for (const char* wrong : {"ftp:x --account work", "dir:relative --account work", "dir:/tmp --account .."})
     EXPECT_NE(cloud("one", std::string("use ") + wrong).status, 0) << wrong;
+  const fs::path inTheWay = root / "one/etc/cloud.json.new";
+  fs::create_directory(inTheWay);
+  EXPECT_EQ(cloud("one", "use " + url + " --account work").status, 1) << "the file cannot be written";
+  fs::remove(inTheWay);
   EXPECT_EQ(contents(root / "one/etc/cloud.json"), before);
   EXPECT_THAT(cloud("one", "status").output, HasSubstr(url + ", account home\n"));
   EXPECT_EQ(setting("one", "ours"), "1\n");
@@ -179,10 +183,14 @@ TEST_F(CloudTest, CopyOfADiskIsToldToTakeANewIdentity) {
   switchTo("one", "off");
   EXPECT_TRUE(comesToSay("one", "waiting to go out  nothing"));
   start("copy");
-  EXPECT_TRUE(followsOff("copy")) << "it reads on";
   EXPECT_TRUE(comesToSay("copy", "hearthctl cloud new-identity"));
+  EXPECT_TRUE(comesTo("copy", [&] { return on("copy", "pairwellctl", "logging").output == "off\n"; }));
   switchTo("copy", "on");
   EXPECT_TRUE(comesToSay("copy", "waiting to go out  " + flagKey));
+  // By then what was to go out would have.
+  on("one", "hearthctl", "settings set cloud later 1");
+  EXPECT_TRUE(comesTo("copy", [&] { return setting("copy", "later") == "1\n"; })) << "it reads on";
+  EXPECT_EQ(setting("one", endKey), "");
   EXPECT_EQ(cloud("copy", "new-identity").status, 0);
   EXPECT_TRUE(followsOn("one", "copy"));
   EXPECT_EQ(timesLogged("copy", "publishes under this device's name"), 1u);
