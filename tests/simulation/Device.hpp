@@ -37,7 +37,6 @@ struct Machine {
   // Of the replica, durable or not.
   std::string bytes() const { return files.exists(replicaPath) ? files.bytes(replicaPath) : ""; }
   Dictionary entries() const { return entriesIn(bytes()); }
-  Dictionary durableEntries() const { return entriesIn(files.durableBytes(replicaPath)); }
   static Dictionary entriesIn(const std::string& bytes) {
     std::string problem;
     const auto document = platform::linux_::decodeSettings(bytes, problem);

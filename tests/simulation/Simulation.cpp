@@ -18,9 +18,13 @@ struct Node {
   std::string name;
   std::unique_ptr<Pairwelld> daemon;
   std::unique_ptr<Cloudsyncd> sync;
-  bool clientCalled = false;  // since it was last idle
-  bool merged = false;        // likewise
-  bool stoppedInThisLife = false, wasOn = false;
+  // Since it was last idle: a client's last call, unless the state may be another's by then; and a merge.
+  bool clientCalled = false;
+  std::optional<bool> expected;
+  bool merged = false;
+  bool isBeginning = false;  // the flag is on, its end time is yet to be written
+  bool stoppedInThisLife = false;
+  std::string unsure;  // contents that a crash left, and that nobody was told are durable
 };
 
 class Run {
@@ -85,7 +89,7 @@ class Run {
       const double before = endOf(node.machine.entries());
       const bool wasOn = flagOf(node.machine.entries());
       node.daemon = std::make_unique<Pairwelld>(node.machine, network.now, random());
-      node.stoppedInThisLife = node.wasOn = false;
+      node.stoppedInThisLife = node.isBeginning = false;
       node.clientCalled = node.merged = false;
       while (!node.daemon->isIdle()) runOne(node, *node.daemon);
       const double now = (network.now + node.machine.offset).count();
@@ -103,18 +107,13 @@ class Run {
     switch (event.kind) {
       case Event::on:
       case Event::off:
-        boot(node);
-        tick(node);
-        node.clientCalled = true;
-        return node.daemon->say(event.kind == Event::on);
+        return call(node, event.kind == Event::on);
       case Event::override_: {
         boot(node);
         const auto user = platform::linux_::FileUserPreferences::create(files, nullptr, "/var/user.json");
         user->setValue(Value(std::uniform_real_distribution<>(0.5, chance(draw, 0.5) ? 20 : 5000)(draw)),
                        pairwell::overrideKey);
-        tick(node);
-        node.clientCalled = true;
-        return node.daemon->say(true);
+        return call(node, true);
       }
       case Event::foreign: {
         fakes::ManualClock clock;
@@ -149,6 +148,16 @@ class Run {
     }
   }
 
+  void call(Node& node, bool enabled) {
+    boot(node);
+    tick(node);
+    node.clientCalled = true;
+    // An end time that was left is taken up or, if it has passed, cleared first.
+    const bool endIsLeft = !flagOf(node.machine.entries()) && endOf(node.machine.entries()) > 0;
+    node.expected = endIsLeft ? std::nullopt : std::optional(enabled);
+    node.daemon->say(enabled);
+  }
+
   // In the middle of what is under way, or of one operation.
   void crash(Event::Kind kind, Node& node, Random& draw) {
     ++counts.crashes;
@@ -156,10 +165,13 @@ class Run {
     files.failFrom = files.calls + 1 + below(draw, 60);
     for (int steps = below(draw, 30); steps > 0 && step(); --steps) {
     }
+    cutSwitch = cutSwitch || node.clientCalled || node.isBeginning;
     if (kind != Event::killSync) node.daemon.reset();
     if (kind != Event::killDaemon) node.sync.reset();
     const bool stays = chance(draw, 0.5);  // down, until it is needed
     files.failFrom = std::numeric_limits<int>::max();
+    node.expected.reset();
+    if (node.machine.bytes() != files.durableBytes(replicaPath)) node.unsure = node.machine.bytes();
     if (kind == Event::cutPower) {
       ++counts.powerCuts;
       files.powerCut();
@@ -208,13 +220,20 @@ class Run {
     }
     if (network.nextDue() && *network.nextDue() <= network.now) ready.push_back([this] { deliverMessage(); });
     if (ready.empty()) {
-      for (auto& node : nodes) node->clientCalled = node->merged = false;
+      for (auto& node : nodes) becomeIdle(*node);
       return false;
     }
     ready[static_cast<std::size_t>(below(random, static_cast<int>(ready.size())))]();
     network.now += Time(
         std::uniform_real_distribution<>(0, 0.001)(random));  // work takes time: messages arrive in its midst
     return true;
+  }
+
+  void becomeIdle(Node& node) {
+    if (node.daemon && node.expected && !node.merged)
+      check(flagOf(node.machine.entries()) == *node.expected, node.name + " has lost a client's last word");
+    node.clientCalled = node.merged = false;
+    node.expected.reset();
   }
 
   // Between what a write was decided on and the write.
@@ -252,27 +271,49 @@ class Run {
   void noteChange(Node& node, const std::string& bytesBefore, bool isDaemon) {
     if (bytesBefore == node.machine.bytes()) return;
     const Dictionary before = Machine::entriesIn(bytesBefore), after = node.machine.entries();
-    for (const auto& [key, value] : node.machine.durableEntries()) {
-      const auto entry = CloudEntry::fromValue(value);
-      auto& best = acknowledged[key];
-      if (entry && (!best || entry->outranks(*best))) best = entry;
-    }
+    if (node.machine.bytes() != node.unsure && node.machine.files.failFrom == std::numeric_limits<int>::max())
+      acknowledge(after);
     if (!isDaemon) {
       node.merged = true;
       return;
     }
-    const bool was = flagOf(before), is = flagOf(after);
-    const auto entry = CloudEntry::find(after, flagKey);
-    if (before.contains(flagKey) && CloudEntry::find(before, flagKey)->stamp == entry->stamp) return;
-    if (is != was) noteSwitch(node, before, is);
+    const auto flag = CloudEntry::find(after, flagKey), former = CloudEntry::find(before, flagKey);
+    const auto end = CloudEntry::find(after, endKey);
+    if (flag && (!former || former->stamp != flag->stamp)) {
+      if (flagOf(before) == flagOf(after)) {
+        check(node.clientCalled || node.merged, node.name + " stamps an echo anew");
+      } else {
+        noteSwitch(node, before, *flag);
+      }
+    } else if (node.isBeginning && end && end->value) {
+      node.isBeginning = false;
+      check(node.merged || end->stamp == flag->stamp, node.name + " stamps flag and end time apart");
+    }
   }
 
-  void noteSwitch(Node& node, const Dictionary& before, bool is) {
-    if (!is) node.stoppedInThisLife = true;
-    if (node.clientCalled) return;
+  void acknowledge(const Dictionary& entries) {
+    for (const auto& [key, value] : entries) {
+      const auto entry = CloudEntry::fromValue(value);
+      auto& best = acknowledged[key];
+      if (entry && (!best || entry->outranks(*best))) best = entry;
+    }
+  }
+
+  void noteSwitch(Node& node, const Dictionary& before, const CloudEntry& flag) {
+    const bool is = flagOf({{flagKey, flag.toValue()}});
     const double now = (network.now + node.machine.offset).count();
     const double end = endOf(before);
-    if (!is && end > 0 && end <= now + 1) return;
+    node.isBeginning = is && end == 0;
+    if (is && end > 0) tookUpAnEnd = true;
+    if (!is) node.stoppedInThisLife = true;
+    if (!is && end > 0 && end <= now + 1) {
+      node.expected.reset();
+      const auto former = CloudEntry::find(before, flagKey);
+      expiries.push_back({flag, former->stamp});
+      return;
+    }
+    switches.push_back(flag);
+    if (node.clientCalled) return;
     if (!is && node.daemon->hearthd().lastDelivered) {
       ++counts.staleAlarmEnds;
       return;
@@ -356,6 +397,11 @@ class Run {
       check(entry && !best->outranks(*entry), "a write is lost: " + key);
     }
     comparePair(shared);
+    for (const Expiry& expiry : expiries) {
+      if (expiry.entry.stamp != CloudEntry::find(shared, flagKey)->stamp) continue;
+      for (const CloudEntry& later : switches)
+        check(later.stamp <= expiry.ended, "an expiry ends a later switch");
+    }
   }
 
   void compareAlarms(Node& node, bool on, double end) {
@@ -386,7 +432,7 @@ class Run {
     if (mayMix) {
       ++counts.mixes;
     } else {
-      check(counts.crashes > 0, "flag and end time are of two switches");
+      check(tookUpAnEnd || cutSwitch, "flag and end time are of two switches");
       ++counts.leftEnds;
     }
   }
@@ -408,7 +454,13 @@ class Run {
   std::vector<std::unique_ptr<Node>> nodes;
   std::map<std::string, std::optional<CloudEntry>>
       acknowledged;  // of each key, the greatest that was durable
-  bool mayMix = false;
+  struct Expiry {
+    CloudEntry entry;
+    platform::linux_::CloudStamp ended;  // of the flag that it cleared
+  };
+  std::vector<Expiry> expiries;
+  std::vector<CloudEntry> switches;  // by persons, and what else may switch
+  bool mayMix = false, tookUpAnEnd = false, cutSwitch = false;
   bool isRunning = false, isWithin = false;  // a daemon's item of work; a message in its midst
   int writers = 0;
 };
