@@ -7,6 +7,7 @@
 #include <algorithm>
 #include <map>
 #include <mutex>
+#include <optional>
 
 #include "platform/LogSink.hpp"
 #include "platform/Platform.hpp"
@@ -72,7 +73,7 @@ class BusServer::State : public BusSessionHost, public std::enable_shared_from_t
                                        std::shared_ptr<BusHandler> handler) {
     ::fcntl(socket.get(), F_SETFL, ::fcntl(socket.get(), F_GETFL) | O_NONBLOCK);
     const auto session = add(std::move(socket), std::move(peer));
-    begin(*session, std::move(handler));
+    begin(*session, std::move(handler), std::nullopt);  // it may be used late, or never
     return session;
   }
 
@@ -278,15 +279,16 @@ class BusServer::State : public BusSessionHost, public std::enable_shared_from_t
     const auto session = found->second.session;
     if (admission.handler) {
       if (admission.admitted) admission.admitted(session);
-      begin(*session, admission.handler);
+      begin(*session, admission.handler, _service.patience.handshake);
     } else {
       session->refuse();
       watch(*session);
     }
   }
 
-  void begin(BusSession& session, std::shared_ptr<BusHandler> handler) {
-    session.admit(std::move(handler));
+  void begin(BusSession& session, std::shared_ptr<BusHandler> handler,
+             std::optional<std::chrono::milliseconds> patience) {
+    session.admit(std::move(handler), patience);
     watch(session);
   }
 

@@ -92,7 +92,7 @@ class BusServer {
   void listen(UniqueDescriptor socket, Admitter admitter);
   // No more clients are accepted; those admitted stay.
   void stopListening();
-  // Serves a socket whose other end is known already.
+  // Serves a socket whose other end is known already; it may begin late, or never.
   std::shared_ptr<BusConnection> adopt(UniqueDescriptor socket, PeerIdentity peer,
                                        std::shared_ptr<BusHandler> handler);
   // Accepting and reading stop for good; `drained` is called once no answer is left to be made or to leave,

@@ -40,10 +40,11 @@ BusSession::BusSession(BusSessionHost& host_, std::uint64_t number_, UniqueDescr
 
 BusSession::~BusSession() { finish(); }
 
-void BusSession::admit(std::shared_ptr<BusHandler> handler_) {
+void BusSession::admit(std::shared_ptr<BusHandler> handler_,
+                       std::optional<std::chrono::milliseconds> patience) {
   handler = std::move(handler_);
   phase = Phase::handshake;
-  end = std::chrono::steady_clock::now() + host.service().patience.handshake;
+  if (patience) end = std::chrono::steady_clock::now() + *patience;
   shaking.emplace(_peer.uid, host.service().identifier);
 }
 

@@ -49,7 +49,7 @@ class BusSession : public BusConnection {
   const std::uint64_t number;
   int socket() const { return descriptor; }
 
-  void admit(std::shared_ptr<BusHandler> handler);
+  void admit(std::shared_ptr<BusHandler> handler, std::optional<std::chrono::milliseconds> patience);
   void refuse();
   // epoll's events of the socket.
   void ready(std::uint32_t events);

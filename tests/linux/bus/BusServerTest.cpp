@@ -207,6 +207,11 @@ struct HastyBusServerTest : World {
 };
 
 TEST_F(HastyBusServerTest, WhoeverStallsIsDisconnected) {
+  int ends[2];
+  ASSERT_EQ(::socketpair(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC | SOCK_NONBLOCK, 0, ends), 0);
+  PeerIdentity job;
+  job.uid = ::geteuid();
+  const auto adopted = server->adopt(UniqueDescriptor(ends[0]), job, admission().handler);
   Wire idle = client();
   Wire waiting = client();
   ASSERT_TRUE(waiting.send(callMessage("Hold", "answer")));
@@ -227,6 +232,10 @@ TEST_F(HastyBusServerTest, WhoeverStallsIsDisconnected) {
   complete(0);
   EXPECT_TRUE(waiting.reads(text("answer")));
   EXPECT_TRUE(idle.isServed());
+  Wire late = connect();
+  late.socket = UniqueDescriptor(ends[1]);
+  late.shakeHands();
+  EXPECT_TRUE(late.isServed()) << "adopted: it takes its time";
 }
 
 TEST_F(HastyBusServerTest, AFloodThatIsNeverReadIsBoundedAndEnds) {
