@@ -2,6 +2,9 @@
 
 #include <algorithm>
 #include <cstdint>
+#include <functional>
+#include <set>
+#include <string_view>
 #include <utility>
 
 #include "platform/UUID.hpp"
@@ -17,13 +20,6 @@ using platform::Value;
 using platform::linux_::settingsValues;
 
 constexpr std::size_t writersKept = 64;
-constexpr std::string_view companionSuffix = "Expiration";
-
-// The key without its companion's suffix: what belongs together has one.
-std::string_view stemOf(std::string_view key) {
-  if (key.ends_with(companionSuffix)) key.remove_suffix(companionSuffix.size());
-  return key;
-}
 
 const List& writersOf(const Dictionary& replica) {
   static const List none;
@@ -60,10 +56,10 @@ void giveReason(Dictionary& replica, platform::CloudStore::ChangeReason reason) 
 
 void join(Dictionary& replica, const std::string& account, const Dictionary& downloaded) {
   Dictionary entries = downloaded;
+  std::set<std::string, std::less<>> stems;
+  for (const auto& [key, value] : downloaded) stems.emplace(platform::linux_::cloudStemOf(key));
   for (const auto& [key, value] : settingsValues(std::as_const(replica))) {
-    const std::string stem(stemOf(key));
-    if (!downloaded.contains(stem) && !downloaded.contains(stem + std::string(companionSuffix)))
-      entries.emplace(key, value);
+    if (!stems.contains(platform::linux_::cloudStemOf(key))) entries.emplace(key, value);
   }
   settingsValues(replica) = std::move(entries);
   replica.insert_or_assign("account", account);

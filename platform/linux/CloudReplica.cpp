@@ -10,6 +10,7 @@
 namespace platform::linux_ {
 namespace {
 
+constexpr std::string_view companionSuffix = "Expiration";
 // Beyond what any clock says, and far from overflow: such a stamp is its entry's fault.
 constexpr std::int64_t greatestStamp = std::int64_t{1} << 61;
 
@@ -24,20 +25,22 @@ std::int64_t microsecondsOf(Time time) {
 
 // The stamp of a burst that begins with `write`: of now, behind everything that is known. Stamps of more than
 // a day ahead are some clock's fault, and are not followed, or that clock would rule the others for good;
-// only the value that is written over, which has to lose, draws its own along, and with it what is written
-// together.
+// only the value that is written over, which has to lose, draws its own along, and its pair's, or the two
+// would be stamped apart for ever.
 CloudStamp nextStamp(const Dictionary& entries, const CloudWrite& write) {
   constexpr std::int64_t day = 86'400'000'000;
   const std::int64_t now = microsecondsOf(write.now);
-  std::int64_t next = now;
+  const std::string_view stem = cloudStemOf(write.key);
+  CloudStamp next{now, 0};
   for (const auto& [key, value] : entries) {
     const auto entry = CloudEntry::fromValue(value);
-    if (entry && entry->stamp.microseconds <= now + day) next = std::max(next, entry->stamp.microseconds + 1);
+    if (!entry || entry->stamp.microseconds < next.microseconds) continue;
+    if (entry->stamp.microseconds > now + day && cloudStemOf(key) != stem) continue;
+    const bool isGreatest = entry->stamp.microseconds == greatestStamp;
+    next = isGreatest ? CloudStamp{greatestStamp, entry->stamp.tick + 1}
+                      : CloudStamp{entry->stamp.microseconds + 1, 0};
   }
-  const auto there = CloudEntry::find(entries, write.key);
-  if (!there || there->stamp.microseconds < next) return {next, 0};
-  if (there->stamp.microseconds < greatestStamp) return {there->stamp.microseconds + 1, 0};
-  return {greatestStamp, there->stamp.tick + 1};
+  return next;
 }
 
 bool isEcho(const CloudWrite& write) {
@@ -51,7 +54,7 @@ bool isEcho(const CloudWrite& write) {
 // alarm drops the fraction, so it may come up to a second early.
 std::optional<std::string> passedCompanion(const Dictionary& entries, const CloudWrite& write) {
   if (write.value && toBool(*write.value).value_or(true)) return std::nullopt;
-  std::string companion = write.key + "Expiration";
+  std::string companion = write.key + std::string(companionSuffix);
   const auto entry = CloudEntry::find(entries, companion);
   const auto end = entry && entry->value ? toDouble(*entry->value) : std::nullopt;
   return end && *end <= write.now.count() + 1 ? std::optional(companion) : std::nullopt;
@@ -100,6 +103,11 @@ bool CloudEntry::outranks(const CloudEntry& other) const {
     return std::tie(stamp, device) > std::tie(other.stamp, other.device);
   }
   return describe(toValue()) > describe(other.toValue());
+}
+
+std::string_view cloudStemOf(std::string_view key) {
+  if (key.ends_with(companionSuffix)) key.remove_suffix(companionSuffix.size());
+  return key;
 }
 
 std::string cloudDeviceOf(Dictionary& document) {

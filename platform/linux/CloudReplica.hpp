@@ -38,6 +38,9 @@ struct CloudEntry {
   bool outranks(const CloudEntry& other) const;
 };
 
+// What a key and its companion, the key's name with "Expiration", have in common.
+std::string_view cloudStemOf(std::string_view key);
+
 // The name of the device that `document`, the whole replica, belongs to; made with its first write.
 std::string cloudDeviceOf(Dictionary& document);
 
