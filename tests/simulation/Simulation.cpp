@@ -162,6 +162,8 @@ class Run {
   void crash(Event::Kind kind, Node& node, Random& draw) {
     ++counts.crashes;
     auto& files = node.machine.files;
+    node.expected.reset();  // a write that fails is not kept
+    node.isBeginning = false;
     files.failFrom = files.calls + 1 + below(draw, 60);
     for (int steps = below(draw, 30); steps > 0 && step(); --steps) {
     }
@@ -170,7 +172,6 @@ class Run {
     if (kind != Event::killDaemon) node.sync.reset();
     const bool stays = chance(draw, 0.5);  // down, until it is needed
     files.failFrom = std::numeric_limits<int>::max();
-    node.expected.reset();
     if (node.machine.bytes() != files.durableBytes(replicaPath)) node.unsure = node.machine.bytes();
     if (kind == Event::cutPower) {
       ++counts.powerCuts;
@@ -285,9 +286,12 @@ class Run {
       } else {
         noteSwitch(node, before, *flag);
       }
-    } else if (node.isBeginning && end && end->value) {
+    }
+    if (node.isBeginning && end && end->value) {
       node.isBeginning = false;
-      check(node.merged || end->stamp == flag->stamp, node.name + " stamps flag and end time apart");
+      check(node.merged || end->stamp == flag->stamp,
+            node.name + " stamps flag and end time apart: " + platform::describe(before) + " " +
+                platform::describe(after));
     }
   }
 
