@@ -101,7 +101,7 @@ Result<void> DirectoryTransport::beginWatching() {
   if (!inner) return inner.error();
   auto outer = files.watch(place.folder, [this](const std::string& name) {
     // It was renamed or deleted, and what is there in its place by now is another.
-    if (name.empty() && isConnected) disconnect(std::make_error_code(std::errc::no_such_file_or_directory));
+    if (name.empty()) disconnect(std::make_error_code(std::errc::no_such_file_or_directory));
   });
   if (!outer) return outer.error();
   watch = std::move(*inner);
@@ -114,7 +114,6 @@ void DirectoryTransport::disconnect(const std::error_code& error) {
   isConnected = false;
   watch.reset();
   outerWatch.reset();
-  nextLook.reset();
   retry.failed(steady(), "");
   client->disconnected(place.folder + ": " + error.message());
 }

@@ -132,7 +132,7 @@ class MemoryFileSystem : public FileSystem {
   }
   Result<std::unique_ptr<FolderWatch>> watch(const std::string& folder,
                                              std::function<void(const std::string&)> changed) override {
-    if (const int error = check(folder)) return code(error);
+    if (const int error = unreadable.contains(folder) ? EACCES : check(folder)) return code(error);
     auto held = std::make_unique<Held<FolderWatch>>();
     watches.push_back({held->token, folder, std::move(changed)});
     return std::unique_ptr<FolderWatch>(std::move(held));
