@@ -186,6 +186,12 @@ void Synchroniser::timePassed() {
 }
 
 void Synchroniser::publish() {
+  if (accountOf(*around.replica.contents()) != around.account) {
+    // Deleted under us, and not reported yet. What this device alone gave the account would go from there,
+    // too.
+    pacing.sent();
+    return takeIn();
+  }
   const auto text = encode();
   if (!text) {
     if (text.error() == Outcome::tooLarge) return exceedsQuota();

@@ -237,6 +237,11 @@ TEST_F(SynchroniserTest, AFullDiskAndALostReplicaHealByThemselves) {
   EXPECT_EQ(values(), R"(["key": 1])");
   EXPECT_EQ(whole().at("device"), Value("me"));
   EXPECT_THAT(transport.sent, IsEmpty());
+
+  write("mine", 2);
+  EXPECT_TRUE(files.remove(path));
+  EXPECT_FALSE(publishNext()) << "gone, though no event has said so";
+  EXPECT_EQ(values(), R"(["key": 1])");
 }
 
 }  // namespace
