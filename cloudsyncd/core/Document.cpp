@@ -64,7 +64,11 @@ Result<Document> decodeDocument(std::string_view text, const std::string& accoun
     return Outcome::malformedFile;
   }
   const auto fields = platform::linux_::decodeSettings(text, problem);
-  if (!fields) return fields.error();
+  if (!fields) {
+    // Without the place, which moves on with each piece of a document that is being copied.
+    problem = "it does not parse, or does not match its checksum";
+    return fields.error();
+  }
   problem = refusal(*fields, account, device);
   if (!problem.empty()) return Outcome::malformedFile;
   return Document{account, device, textIn(*fields, "writer"),

@@ -139,12 +139,12 @@ TEST_F(SynchroniserTest, RefusesBadDocumentsWithOneLineEach) {
     return *platform::linux_::encodeSettings(*fields);
   };
   const std::pair<std::string, const char*> cases[] = {
-      {good.substr(0, good.size() / 2), "line"},
+      {good.substr(0, good.size() / 2), "does not parse"},
       {with("\"format\": 1", "\"format\": 2"), "its format version is not 1"},
       {with("\"home\"", "\"work\""), "it is of another account"},
       {document("other", {}), "it is of another device"},
       {std::string(documentBytes + 1, ' '), "larger than 1048576 bytes"},
-      {std::string(100'000, '['), "line 1"},
+      {std::string(100'000, '['), "does not parse"},
   };
   for (const auto& [text, cause] : cases) {
     synchroniser.received("peer", text);
@@ -153,6 +153,8 @@ TEST_F(SynchroniserTest, RefusesBadDocumentsWithOneLineEach) {
     ASSERT_EQ(lines.size(), 1u) << cause;
     EXPECT_THAT(lines[0], testing::AllOf(testing::HasSubstr("device peer"), testing::HasSubstr(cause)));
   }
+  synchroniser.received("peer", good.substr(0, good.size() / 2));
+  EXPECT_THAT(logged(), IsEmpty()) << "however far it has been copied";
   EXPECT_EQ(values(), "[:]");
   synchroniser.received("peer", with("\"time\": 5", "\"time\": \"5\""));
   EXPECT_EQ(values(), "[:]");
