@@ -313,10 +313,11 @@ class Run {
     if (!is && end > 0 && end <= now + 1) {
       node.expected.reset();
       const auto former = CloudEntry::find(before, flagKey);
-      expiries.push_back({flag, former->stamp});
+      // After a merge within, what it cleared is not what was there before.
+      if (!node.merged) expiries.push_back({flag, former->stamp});
       return;
     }
-    switches.push_back(flag);
+    if (node.machine.files.failFrom == std::numeric_limits<int>::max()) switches.push_back(flag);
     if (node.clientCalled) return;
     if (!is && node.daemon->hearthd().lastDelivered) {
       ++counts.staleAlarmEnds;
