@@ -231,10 +231,13 @@ class Run {
   }
 
   void becomeIdle(Node& node) {
-    if (node.daemon && node.expected && !node.merged)
+    // Where another device's switch stands, it came in between.
+    const auto flag = CloudEntry::find(node.machine.entries(), flagKey);
+    if (node.daemon && node.expected && !node.merged && flag && flag->device == node.name)
       check(flagOf(node.machine.entries()) == *node.expected, node.name + " has lost a client's last word");
     node.clientCalled = node.merged = false;
     node.expected.reset();
+    if (node.daemon) node.daemon->hearthd().lastDelivered.reset();
   }
 
   // Between what a write was decided on and the write.
@@ -318,11 +321,12 @@ class Run {
       return;
     }
     if (node.machine.files.failFrom == std::numeric_limits<int>::max()) switches.push_back(flag);
-    if (node.clientCalled) return;
     if (!is && node.daemon->hearthd().lastDelivered) {
+      node.expected.reset();
       ++counts.staleAlarmEnds;
       return;
     }
+    if (node.clientCalled) return;
     check(node.merged, node.name + (is ? " is switched on" : " is switched off") + " by nobody, its end in " +
                            std::to_string(end - now) + " s");
     ++counts.mergesBetween;
