@@ -160,6 +160,7 @@ bool CloudBursts::write(Dictionary& entries, const CloudWrite& write) {
     stamp = nextStamp(entries, write);
   }
   lastWrite = write.now;
+  lastKey = write.key;
   return place(entries, write);
 }
 
@@ -181,11 +182,15 @@ bool CloudBursts::expire(Dictionary& entries, const CloudWrite& write, const std
 
 // What is written together carries one stamp, or the flag and end time of two devices could mix. A second
 // value for a key begins the next at once: another process may have published the first. So does an entry
-// that somebody else has overtaken, since the write would be lost on it.
+// that somebody else has overtaken, since the write would be lost on it; but for an end time whose flag has
+// been overtaken with it: another's switch that arrives between the two writes of one must not lose half.
 bool CloudBursts::joins(const Dictionary& entries, const CloudWrite& write) const {
   if (!lastWrite || write.now < *lastWrite || write.now - *lastWrite > quiet) return false;
   const auto there = CloudEntry::find(entries, write.key);
-  return !there || there->stamp < stamp;
+  if (!there || there->stamp < stamp) return true;
+  const auto flag = CloudEntry::find(entries, lastKey);
+  const bool isOurs = flag && flag->stamp == stamp && flag->device == write.device;
+  return write.key == lastKey + std::string(companionSuffix) && !isOurs;
 }
 
 bool CloudBursts::place(Dictionary& entries, const CloudWrite& write) {

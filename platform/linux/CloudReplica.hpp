@@ -91,6 +91,7 @@ class CloudBursts {
 
   CloudStamp stamp;
   std::optional<Time> lastWrite;  // absent: there is no burst that a write could join
+  std::string lastKey;            // that it wrote
   std::string expiring;           // the companion whose removal belongs to the last expiry
 };
 

@@ -42,7 +42,8 @@ void ReplicaFileCloudStore::setValue(const std::optional<Value>& value, std::str
 
 Result<void> ReplicaFileCloudStore::write(const std::optional<Value>& value, std::string_view key) {
   std::lock_guard writeLock(writeMutex);
-  CloudWrite write{std::string(key), value, std::nullopt, Time{}, {}};
+  // Of before the file's lock: waiting for it must not part what is written together, either.
+  CloudWrite write{std::string(key), value, std::nullopt, clock.now(), {}};
   {
     std::lock_guard lock(mutex);
     if (const auto known = lastKnown.find(key); known != lastKnown.end()) write.lastKnown = known->second;
@@ -51,7 +52,6 @@ Result<void> ReplicaFileCloudStore::write(const std::optional<Value>& value, std
   bool changed = false;
   const auto written = file->update([&](Dictionary& document) {
     write.device = cloudDeviceOf(document);
-    write.now = clock.now();
     return changed = next.write(settingsValues(document), write);
   });
   std::lock_guard lock(mutex);

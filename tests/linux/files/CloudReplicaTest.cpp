@@ -148,6 +148,16 @@ TEST(CloudReplicaTest, ExpiryRanksRightAfterTheSwitchThatItEnds) {
   EXPECT_TRUE(home.write("flagExpiration", std::nullopt));
 }
 
+TEST(CloudReplicaTest, ASwitchThatIsOvertakenMidwayLosesBothItsKeys) {
+  Device ours("ours"), theirs("theirs");
+  theirs.now += Time(0.01);
+  theirs.switchOn(7000);
+  ours.write("flag", true);
+  mergeCloudEntries(theirs.entries, ours.entries);
+  EXPECT_FALSE(ours.write("flagExpiration", 5000.0));
+  EXPECT_EQ(ours.entries, theirs.entries);
+}
+
 TEST(CloudReplicaTest, AClockThatIsYearsAheadIsOverruledAndNotFollowed) {
   Device ahead("ahead"), sane("sane");
   ahead.now = Time(1e8);

@@ -61,6 +61,13 @@ TEST_F(ReplicaFileCloudStoreTest, EchoProlongsNoBurst) {
   EXPECT_THAT(entry("other"), HasSubstr(R"("time": 1000010001000)"));
 }
 
+TEST_F(ReplicaFileCloudStoreTest, WaitingForTheFilePartsNoBurst) {
+  store->setValue(true, "flag");
+  files.onLock = [this] { device.manualClock.time += Time(1); };
+  store->setValue(5.5, "end");
+  EXPECT_THAT(entry("end"), HasSubstr(R"("time": 1000000000000)"));
+}
+
 TEST_F(ReplicaFileCloudStoreTest, ReasonsInTheFileAreAnnouncedOnceAndEvenWithoutAKey) {
   const auto announce = [&](int reason, int sequence) {
     ASSERT_TRUE(SettingsFile::create(files, path)->update([&](Dictionary& whole) {
