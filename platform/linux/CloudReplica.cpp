@@ -43,11 +43,12 @@ CloudStamp nextStamp(const Dictionary& entries, const CloudWrite& write) {
   return next;
 }
 
+bool sameContents(const std::optional<Value>& a, const std::optional<Value>& b) {
+  return a && b ? sameValue(*a, *b) : a.has_value() == b.has_value();
+}
+
 bool isEcho(const CloudWrite& write) {
-  if (!write.lastKnown) return false;
-  const std::optional<Value>& known = *write.lastKnown;
-  return known && write.value ? sameValue(*known, *write.value)
-                              : known.has_value() == write.value.has_value();
+  return write.lastKnown && sameContents(*write.lastKnown, write.value);
 }
 
 // The key whose value says when that of `write` ends, if the write clears it and that moment is there. An
@@ -99,9 +100,10 @@ Value CloudEntry::toValue() const {
 }
 
 bool CloudEntry::outranks(const CloudEntry& other) const {
-  if (std::tie(stamp, device) != std::tie(other.stamp, other.device)) {
-    return std::tie(stamp, device) > std::tie(other.stamp, other.device);
-  }
+  const auto rank = [](const CloudEntry& entry) {
+    return std::tie(entry.stamp.microseconds, entry.device, entry.stamp.tick);
+  };
+  if (rank(*this) != rank(other)) return rank(*this) > rank(other);
   return describe(toValue()) > describe(other.toValue());
 }
 
@@ -153,7 +155,7 @@ std::vector<CloudReport> cloudReports(const Dictionary& before, const Dictionary
 
 bool CloudBursts::write(Dictionary& entries, const CloudWrite& write) {
   if (const auto companion = passedCompanion(entries, write)) return expire(entries, write, *companion);
-  if (!write.value && write.key == expiring) return place(entries, write);
+  if (!write.value && write.key == expiring) return place(entries, write, endedDevice);
   expiring.clear();  // any other write, an echo too, ends what belongs to the expiry
   if (!joins(entries, write)) {
     if (isEcho(write)) return false;
@@ -161,7 +163,7 @@ bool CloudBursts::write(Dictionary& entries, const CloudWrite& write) {
   }
   lastWrite = write.now;
   lastKey = write.key;
-  return place(entries, write);
+  return place(entries, write, write.device);
 }
 
 void CloudBursts::finished(Time now) {
@@ -169,15 +171,20 @@ void CloudBursts::finished(Time now) {
 }
 
 // With the stamp of now, a device that was off for days and ends its stale period at boot would end what
-// somebody switched on since; and flag and end time of two devices could mix.
+// somebody switched on since; and flag and end time of two devices could mix. With the name of the device
+// that ends it, it would outrank a switch of the same moment that has won against the one that it ends; so
+// all devices write the same. As it outranks nobody, it is no echo as long as there is something to end: were
+// only the end time removed, because this process last knew the flag as off, the period would begin anew.
 bool CloudBursts::expire(Dictionary& entries, const CloudWrite& write, const std::string& companion) {
   const auto cleared = CloudEntry::find(entries, write.key);
-  const CloudStamp end = CloudEntry::find(entries, companion)->stamp;
-  stamp = cleared ? std::max(cleared->stamp, end) : end;
+  const auto end = CloudEntry::find(entries, companion);
+  const CloudEntry& ended = cleared && cleared->outranks(*end) ? *cleared : *end;
+  stamp = ended.stamp;
   ++stamp.tick;
   lastWrite.reset();
   expiring = companion;
-  return !isEcho(write) && place(entries, write);
+  endedDevice = ended.device;
+  return !(cleared && sameContents(cleared->value, write.value)) && place(entries, write, endedDevice);
 }
 
 // What is written together carries one stamp, or the flag and end time of two devices could mix. A second
@@ -193,8 +200,8 @@ bool CloudBursts::joins(const Dictionary& entries, const CloudWrite& write) cons
   return write.key == lastKey + std::string(companionSuffix) && !isOurs;
 }
 
-bool CloudBursts::place(Dictionary& entries, const CloudWrite& write) {
-  const CloudEntry entry{write.value, stamp, write.device};
+bool CloudBursts::place(Dictionary& entries, const CloudWrite& write, const std::string& device) {
+  const CloudEntry entry{write.value, stamp, device};
   const auto there = CloudEntry::find(entries, write.key);
   if (there && !entry.outranks(*there)) return false;  // an expiry whose period somebody has begun anew
   entries.insert_or_assign(write.key, entry.toValue());

@@ -27,14 +27,15 @@ struct CloudEntry {
   std::optional<Value>
       value;  // absent: a tombstone, kept so that the removal wins over older values elsewhere
   CloudStamp stamp;
-  std::string device;
+  std::string device;  // that wrote it; of an expiry, that wrote what ended
 
   // Absent where `value` is no entry; such a one counts as not there.
   static std::optional<CloudEntry> fromValue(const Value& value);
   static std::optional<CloudEntry> find(const Dictionary& entries, std::string_view key);
   Value toValue() const;
 
-  // A total order, but for equals: replicas must not differ for ever, even if two values carry one stamp.
+  // By microseconds, device, tick. A total order, but for equals: replicas must not differ for ever, even if
+  // two values carry one stamp.
   bool outranks(const CloudEntry& other) const;
 };
 
@@ -87,12 +88,13 @@ class CloudBursts {
  private:
   bool expire(Dictionary& entries, const CloudWrite& write, const std::string& companion);
   bool joins(const Dictionary& entries, const CloudWrite& write) const;
-  bool place(Dictionary& entries, const CloudWrite& write);
+  bool place(Dictionary& entries, const CloudWrite& write, const std::string& device);
 
   CloudStamp stamp;
   std::optional<Time> lastWrite;  // absent: there is no burst that a write could join
   std::string lastKey;            // that it wrote
   std::string expiring;           // the companion whose removal belongs to the last expiry
+  std::string endedDevice;        // of what that ended
 };
 
 }  // namespace platform::linux_

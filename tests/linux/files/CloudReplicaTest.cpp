@@ -123,6 +123,7 @@ TEST(CloudReplicaTest, ExpiryRanksRightAfterTheSwitchThatItEnds) {
   away.now = Time(9000);
   away.write("flag", false);
   home.now = Time(9000);
+  home.switchOff();
   home.switchOn(12000);
   away.exchange(home);
   EXPECT_FALSE(away.write("flagExpiration", std::nullopt));
@@ -156,6 +157,22 @@ TEST(CloudReplicaTest, ASwitchThatIsOvertakenMidwayLosesBothItsKeys) {
   mergeCloudEntries(theirs.entries, ours.entries);
   EXPECT_FALSE(ours.write("flagExpiration", 5000.0));
   EXPECT_EQ(ours.entries, theirs.entries);
+}
+
+TEST(CloudReplicaTest, AnExpiryEndsNoSwitchOfTheSameMomentAndIsNoEcho) {
+  Device loser("a"), winner("b"), third("c");
+  third.now = Time(900);
+  third.write("flag", false);
+  loser.switchOn(2000);
+  winner.switchOn(9000);
+  third.exchange(loser);
+  loser.now = third.now = Time(3000);
+  EXPECT_TRUE(third.write("flag", false)) << "though it last wrote the same";
+  third.write("flagExpiration", std::nullopt);
+  loser.switchOff();
+  EXPECT_EQ(loser.entries, third.entries);
+  third.exchange(winner);
+  EXPECT_EQ(third.values(), R"(["flag": true, "flagExpiration": 9000.0])");
 }
 
 TEST(CloudReplicaTest, AClockThatIsYearsAheadIsOverruledAndNotFollowed) {
