@@ -1,32 +1,32 @@
-// One run of an account's devices, drawn from a seed, and what must hold throughout and at its end.
+// One run of an account's devices, drawn from a seed.
 #pragma once
 
 #include <cstdint>
-#include <memory>
 #include <optional>
 #include <string>
 #include <vector>
 
-#include "tests/simulation/Device.hpp"
-
 namespace simulation {
 
-// Something from outside. `draw` decides how it interleaves with what is under way, so that the rest of a
-// history stays as it was when others are left out.
+// Something from outside. `draw` decides what else is to be decided until the next event, so that the rest of
+// a history stays much as it was when others are left out.
 struct Event {
   enum Kind {
     on,
     off,
     override_,
+    rivals,
     foreign,
-    look,
+    question,
     killDaemon,
     killSync,
     killBoth,
-    cutPower,
-    away,
+    powerCut,
+    shutDown,
+    start,
     partition,
     heal,
+    loss,
     wait,
     leap
   };
@@ -35,6 +35,7 @@ struct Event {
   std::uint64_t draw;
   std::string text() const;
 };
+
 std::vector<Event> drawEvents(std::uint64_t seed, int devices);
 
 // What happened, and how often what is allowed to.
@@ -44,10 +45,11 @@ struct Counts {
   long staleAlarms = 0, staleAlarmEnds = 0;
   // A period that ended elsewhere while the device was down.
   long leftAlarms = 0, leftRootFlags = 0;
-  // A merge that fell between a refresh's reading and its write.
-  long mergesBetween = 0, mixes = 0;
-  // An end time that a crash between two steps left.
-  long leftEnds = 0;
+  // A merge that fell between a reading and its write: a newer period ended; flag and end time of two.
+  long endsByMerge = 0, mixes = 0;
+  // Flag and end time of two, as a process died between writing one and the other.
+  long torn = 0;
+
   void add(const Counts& other);
   std::string text() const;
 };

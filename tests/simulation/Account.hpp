@@ -1,0 +1,85 @@
+// The devices of an account on one clock: who works next, when time passes, and what holds at rest.
+#pragma once
+
+#include <cstdint>
+#include <memory>
+#include <string>
+#include <vector>
+
+#include "tests/simulation/Simulation.hpp"
+#include "tests/simulation/Witness.hpp"
+
+namespace simulation {
+
+// A check that fails throws.
+class Account {
+ public:
+  Account(std::uint64_t seed, int devices, Counts& counts);
+  void perform(const Event& event);
+  // Everything is there and heals; then nothing is left to do.
+  void finish();
+
+ private:
+  struct Node {
+    Machine machine;
+    std::string name;
+    std::unique_ptr<Pairwelld> daemon;
+    std::unique_ptr<Cloudsyncd> sync;
+    // Since it was last idle: what clients switched to, an end that was asked for, and the last call, unless
+    // something else may decide by now.
+    std::set<bool> calls;
+    std::optional<double> question;
+    std::optional<bool> lastCall;
+    bool hasMerged = false;                  // within the daemon's item of work
+    bool wasOn = false, hasStopped = false;  // in this life
+    std::shared_ptr<const Dictionary> kept;  // what has been acknowledged
+  };
+  Node& at(int index) { return *nodes[static_cast<std::size_t>(index)]; }
+  bool draw(double odds) { return chance(random, odds); }
+  int draw(int limit) { return below(random, limit); }
+  double draw(double from, double to) { return std::uniform_real_distribution<>(from, to)(random); }
+
+  void boot(Node& node);
+  void apply(const Event& event, Node& node);
+  void say(Node& node, bool on);
+  void setOverride(Node& node);
+  void writeForeign(Node& node);
+  void ask(Node& node);
+  void crash(Event::Kind kind, Node& node);
+  void cut(Node& node, bool isCut);
+
+  void tick(Node& node);
+  bool step();
+  void runDaemon(Node& node, const std::function<void()>& work);
+  void runSync(Node& node, const std::function<void()>& work);
+  void noteWork(Node& node, const Dictionary& before);
+  void noteKept(Node& node);
+  void noteMerge(Node& node, const Dictionary& before);
+  void becomeIdle(Node& node);
+  void workTakesTime(Node& node);
+  void deliverMessage();
+
+  void settle();
+  void advance(double seconds);
+  std::optional<Time> nextDue();
+  void fireDue();
+  void rest();
+  void checkRest();
+  void compareAll();
+  void compareAlarms(Node& node, bool on, double end);
+  void passEnd();
+
+  fakes::FakePlatform outside;  // current while what runs is no device's own
+  const platform::PlatformScope outsideScope{outside};
+  Counts& counts;
+  Witness witness{counts};
+  Random random;
+  Network network;
+  std::vector<std::unique_ptr<Node>> nodes;
+  Node* running = nullptr;  // whose daemon is at work
+  bool isPaused = false;    // in its midst, while messages come
+  long locks = 0;           // each precedes a write
+  int writers = 0;
+};
+
+}  // namespace simulation

@@ -1,0 +1,96 @@
+#include "tests/simulation/Witness.hpp"
+
+#include <cmath>
+
+namespace simulation {
+
+void Witness::wrote(const Work& work) {
+  const auto isNew = [&](const std::string& key) {
+    const auto entry = CloudEntry::find(work.after, key);
+    return entry && !authors.contains(name(key, *entry)) ? entry : std::nullopt;
+  };
+  const auto flag = isNew(flagKey), end = isNew(endKey);
+  if (flag) wroteFlag(work, *flag);
+  if (end && flag) authors[name(endKey, *end)] = authors[name(flagKey, *flag)];
+  if (end && !flag) wroteEnd(work, *end);
+}
+
+void Witness::wroteFlag(const Work& work, const CloudEntry& flag) {
+  const bool on = flagIn(work.after);
+  Author author;
+  if (work.calls.contains(on) && flag.stamp.tick == 0) {
+    persons.push_back(flag);
+    author.person = static_cast<int>(persons.size());
+  } else {
+    check(!on, work.device + " is switched on by nobody");
+    author = ended(work, flag);
+  }
+  author.isTorn = work.isCut;
+  author.isBetween = author.isBetween || work.hasMerged;
+  authors[name(flagKey, flag)] = author;
+}
+
+// Who ended a period that no person did.
+Witness::Author Witness::ended(const Work& work, const CloudEntry& flag) {
+  const double end = endIn(work.before);
+  const auto former = CloudEntry::find(work.before, flagKey),
+             formerEnd = CloudEntry::find(work.before, endKey);
+  const bool isEndNewer = former && formerEnd && formerEnd->outranks(*former);
+  Author author = authorOf(work.before, isEndNewer ? endKey : flagKey);
+  if (work.hasMerged) {
+    counts.endsByMerge += flag.stamp.tick == 0;  // otherwise what arrived has ended, too
+  } else if (end > 0 && end <= work.now + 1) {
+    author.ended = isEndNewer ? formerEnd : former;
+    checkRank(flag, author);
+  } else if (work.alarm) {
+    counts.staleAlarmEnds += std::floor(*work.alarm) != std::floor(end);
+  } else if (work.question && *work.question != end) {
+    ++counts.endsByMerge;
+    author.isBetween = true;
+  } else {
+    check(work.question.has_value(),
+          work.device + " is switched off by nobody, its end in " + std::to_string(end - work.now) + " s");
+  }
+  return author;
+}
+
+// A flag that is there without an end time is given one; what is left of an ended period is cleared.
+void Witness::wroteEnd(const Work& work, const CloudEntry& end) {
+  const bool isCompletion = !(endIn(work.before) > 0) || !flagIn(work.after);
+  check(isCompletion || work.hasMerged, work.device + " writes an end time unasked");
+  Author author = authorOf(work.after, flagKey);
+  author.isTorn = author.isTorn || work.isCut;
+  author.isBetween = author.isBetween || work.hasMerged;
+  authors[name(endKey, end)] = author;
+}
+
+// A stale period's end must not end what somebody switched on since.
+void Witness::checkRank(const CloudEntry& flag, const Author& author) const {
+  if (!author.ended) return;
+  for (const CloudEntry& person : persons) {
+    check(!person.outranks(*author.ended) || person.outranks(flag),
+          flag.device + " ends a newer period of " + person.device);
+  }
+}
+
+Witness::Author Witness::authorOf(const Dictionary& entries, const std::string& key) const {
+  const auto entry = CloudEntry::find(entries, key);
+  if (!entry) return {};
+  const auto found = authors.find(name(key, *entry));
+  check(found != authors.end(), "nobody wrote " + key);
+  return found->second;
+}
+
+void Witness::checkShared(const Dictionary& entries) {
+  const auto flag = CloudEntry::find(entries, flagKey);
+  if (!flag) return;
+  const Author author = authorOf(entries, flagKey), ofEnd = authorOf(entries, endKey);
+  checkRank(*flag, author);
+  const bool isWhole = flagIn(entries) ? author.person == ofEnd.person : !(endIn(entries) > 0);
+  if (isWhole) return;
+  const bool isTorn = author.isTorn || ofEnd.isTorn, isBetween = author.isBetween || ofEnd.isBetween;
+  check(isTorn || isBetween, "flag and end time are of two switches: " + platform::describe(entries));
+  isBetween ? ++counts.mixes : ++counts.torn;
+}
+
+}  // namespace simulation
