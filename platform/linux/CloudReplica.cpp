@@ -61,6 +61,22 @@ std::optional<std::string> passedCompanion(const Dictionary& entries, const Clou
   return end && *end <= write.now.count() + 1 ? std::optional(companion) : std::nullopt;
 }
 
+// The flag that is on, and that has no end time yet but for `write`.
+std::optional<CloudEntry> flagWithoutEnd(const Dictionary& entries, const CloudWrite& write) {
+  const std::string_view stem = cloudStemOf(write.key);
+  const auto flag = CloudEntry::find(entries, stem), end = CloudEntry::find(entries, write.key);
+  if (stem == write.key || !write.value || !flag || !flag->value) return std::nullopt;
+  if (!toBool(*flag->value).value_or(false)) return std::nullopt;
+  return !end || (!end->value && flag->outranks(*end)) ? flag : std::nullopt;
+}
+
+bool place(Dictionary& entries, const std::string& key, const CloudEntry& entry) {
+  const auto there = CloudEntry::find(entries, key);
+  if (there && !entry.outranks(*there)) return false;  // somebody else's is newer
+  entries.insert_or_assign(key, entry.toValue());
+  return true;
+}
+
 std::optional<std::int64_t> number(const Dictionary& document, std::string_view name) {
   const Value* found = platform::find(document, name);
   return found ? toInteger(*found) : std::nullopt;
@@ -155,15 +171,19 @@ std::vector<CloudReport> cloudReports(const Dictionary& before, const Dictionary
 
 bool CloudBursts::write(Dictionary& entries, const CloudWrite& write) {
   if (const auto companion = passedCompanion(entries, write)) return expire(entries, write, *companion);
-  if (!write.value && write.key == expiring) return place(entries, write, endedDevice);
+  if (!write.value && write.key == expiring) return place(entries, write.key, {{}, stamp, endedDevice});
   expiring.clear();  // any other write, an echo too, ends what belongs to the expiry
-  if (!joins(entries, write)) {
-    if (isEcho(write)) return false;
-    stamp = nextStamp(entries, write);
+  if (const auto flag = flagWithoutEnd(entries, write)) {
+    // It ranks as its flag, whoever wrote that and when: a device that was cut off between the two, or that
+    // finds the flag of one that was, must not part what somebody else has switched on meanwhile.
+    return place(entries, write.key, {write.value, flag->stamp, flag->device});
   }
+  const bool isTogether = joins(entries, write);
+  if (isEcho(write) && !(isTogether && isCompanion(write.key))) return false;
+  if (!isTogether) stamp = nextStamp(entries, write);
   lastWrite = write.now;
   lastKey = write.key;
-  return place(entries, write, write.device);
+  return place(entries, write.key, {write.value, stamp, write.device});
 }
 
 void CloudBursts::finished(Time now) {
@@ -184,7 +204,13 @@ bool CloudBursts::expire(Dictionary& entries, const CloudWrite& write, const std
   lastWrite.reset();
   expiring = companion;
   endedDevice = ended.device;
-  return !(cleared && sameContents(cleared->value, write.value)) && place(entries, write, endedDevice);
+  return !(cleared && sameContents(cleared->value, write.value)) &&
+         place(entries, write.key, {write.value, stamp, endedDevice});
+}
+
+// Of what was written last: the end time of that flag.
+bool CloudBursts::isCompanion(std::string_view key) const {
+  return key != lastKey && cloudStemOf(key) == lastKey;
 }
 
 // What is written together carries one stamp, or the flag and end time of two devices could mix. A second
@@ -197,15 +223,7 @@ bool CloudBursts::joins(const Dictionary& entries, const CloudWrite& write) cons
   if (!there || there->stamp < stamp) return true;
   const auto flag = CloudEntry::find(entries, lastKey);
   const bool isOurs = flag && flag->stamp == stamp && flag->device == write.device;
-  return write.key == lastKey + std::string(companionSuffix) && !isOurs;
-}
-
-bool CloudBursts::place(Dictionary& entries, const CloudWrite& write, const std::string& device) {
-  const CloudEntry entry{write.value, stamp, device};
-  const auto there = CloudEntry::find(entries, write.key);
-  if (there && !entry.outranks(*there)) return false;  // an expiry whose period somebody has begun anew
-  entries.insert_or_assign(write.key, entry.toValue());
-  return true;
+  return isCompanion(write.key) && !isOurs;
 }
 
 }  // namespace platform::linux_

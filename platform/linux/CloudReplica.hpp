@@ -80,7 +80,7 @@ class CloudBursts {
 
   // Makes `write` in `entries`, and says whether that changed them. It does not where the write is an echo: a
   // device that follows another's switch writes the same values back, which must not outrank what a person
-  // did meanwhile.
+  // did meanwhile. Only an end time that is written behind its flag is none: they carry one stamp.
   bool write(Dictionary& entries, const CloudWrite& write);
   // The write is durable. The quiet counts from here: a slow disk must not part what is written together.
   void finished(Time now);
@@ -88,7 +88,7 @@ class CloudBursts {
  private:
   bool expire(Dictionary& entries, const CloudWrite& write, const std::string& companion);
   bool joins(const Dictionary& entries, const CloudWrite& write) const;
-  bool place(Dictionary& entries, const CloudWrite& write, const std::string& device);
+  bool isCompanion(std::string_view key) const;
 
   CloudStamp stamp;
   std::optional<Time> lastWrite;  // absent: there is no burst that a write could join

@@ -14,7 +14,8 @@ struct Device {
   explicit Device(std::string name_) : name(std::move(name_)) {}
 
   bool write(const std::string& key, std::optional<Value> value) {
-    const auto known = lastKnown.contains(key) ? std::optional(lastKnown[key]) : std::nullopt;
+    std::optional<std::optional<Value>> known;
+    if (lastKnown.contains(key)) known.emplace(lastKnown[key]);
     const bool news = bursts.write(entries, {key, value, known, now, name});
     now += disk;
     if (news) bursts.finished(now);
@@ -60,6 +61,8 @@ TEST(CloudReplicaTest, EchoKeepsItsPlaceEvenIfANewerEntryHasArrived) {
   EXPECT_FALSE(ours.write("flag", true)) << "what it read before";
   EXPECT_FALSE(ours.write("flagExpiration", 5000.0));
   EXPECT_EQ(ours.values(), R"(["flag": false])");
+  EXPECT_TRUE(ours.write("other", 1));
+  EXPECT_FALSE(ours.write("flag", true)) << "behind news of another key, too";
 
   ours.read("never");
   EXPECT_FALSE(ours.write("never", std::nullopt));
@@ -72,12 +75,12 @@ TEST(CloudReplicaTest, EchoKeepsItsPlaceEvenIfANewerEntryHasArrived) {
 
 TEST(CloudReplicaTest, WhatIsWrittenTogetherSharesOneTimestamp) {
   Device device("d");
-  device.read("end");
+  device.read("flagExpiration");
   device.write("flag", true);
   const CloudStamp first = device.stamp("flag");
   device.now += Time(0.024);
-  EXPECT_TRUE(device.write("end", std::nullopt)) << "no echo behind news";
-  EXPECT_EQ(device.stamp("end"), first);
+  EXPECT_TRUE(device.write("flagExpiration", std::nullopt)) << "no echo behind its flag";
+  EXPECT_EQ(device.stamp("flagExpiration"), first);
   device.now += Time(0.024);
   device.write("third", 1);
   EXPECT_EQ(device.stamp("third"), first) << "the quiet is that between two writes";
@@ -88,8 +91,8 @@ TEST(CloudReplicaTest, WhatIsWrittenTogetherSharesOneTimestamp) {
   device.now += Time(0.026);
   device.write("third", 2);
   EXPECT_GT(device.stamp("third"), second);
-  device.write("end", 2);
-  EXPECT_EQ(device.stamp("end"), device.stamp("third")) << "a slow disk parts nothing";
+  device.write("flagExpiration", 2);
+  EXPECT_EQ(device.stamp("flagExpiration"), device.stamp("third")) << "a slow disk parts nothing";
 
   Device neighbour("d");
   neighbour.entries = device.entries;
@@ -98,7 +101,7 @@ TEST(CloudReplicaTest, WhatIsWrittenTogetherSharesOneTimestamp) {
   EXPECT_GT(neighbour.stamp("flag"), device.stamp("third")) << "though its clock is behind";
   device.entries = neighbour.entries;
   EXPECT_TRUE(device.write("flag", 7)) << "not lost on what has overtaken the burst";
-  EXPECT_EQ(device.values(), R"(["end": 2, "flag": 7, "third": 2])");
+  EXPECT_EQ(device.values(), R"(["flag": 7, "flagExpiration": 2, "third": 2])");
 }
 
 TEST(CloudReplicaTest, ExpiryRanksRightAfterTheSwitchThatItEnds) {
@@ -157,6 +160,18 @@ TEST(CloudReplicaTest, ASwitchThatIsOvertakenMidwayLosesBothItsKeys) {
   mergeCloudEntries(theirs.entries, ours.entries);
   EXPECT_FALSE(ours.write("flagExpiration", 5000.0));
   EXPECT_EQ(ours.entries, theirs.entries);
+}
+
+TEST(CloudReplicaTest, AnEndTimeThatAFlagLacksRanksAsTheFlag) {
+  Device cut("cut"), third("third"), home("home");
+  cut.write("flag", true);
+  third.exchange(cut);
+  home.now += Time(10);
+  home.switchOn(7000);
+  third.now += Time(20);
+  EXPECT_TRUE(third.write("flagExpiration", 9000.0));
+  third.exchange(home);
+  EXPECT_EQ(third.values(), R"(["flag": true, "flagExpiration": 7000.0])");
 }
 
 TEST(CloudReplicaTest, AnExpiryEndsNoSwitchOfTheSameMomentAndIsNoEcho) {
