@@ -134,6 +134,7 @@ void Account::crash(Event::Kind kind, Node& node) {
   ++counts.crashes;
   for (int steps = draw(30); steps > 0 && step(); --steps) {
   }
+  if (node.daemon && draw(0.5)) say(node, draw(0.5));
   auto& files = node.machine.files;
   files.failFrom = files.calls + 1 + draw(60);
   for (int items = draw(12); items > 0; --items) {
@@ -143,6 +144,7 @@ void Account::crash(Event::Kind kind, Node& node) {
   }
   if (kind != Event::killSync) node.daemon.reset();
   if (kind != Event::killDaemon) node.sync.reset();
+  if (files.calls >= files.failFrom) node.unsure = node.machine.entries();
   files.failFrom = std::numeric_limits<int>::max();
   if (kind == Event::powerCut) {
     ++counts.powerCuts;
@@ -229,7 +231,7 @@ void Account::runSync(Node& node, const std::function<void()>& work) {
 // unless the process died before it could say so.
 void Account::noteKept(Node& node) {
   const auto entries = node.machine.entries();
-  if (entries == node.kept) return;
+  if (entries == node.kept || entries == node.unsure) return;
   for (const auto& [key, value] : *node.kept) {
     const auto was = CloudEntry::fromValue(value), is = CloudEntry::find(*entries, key);
     check(is && !was->outranks(*is), node.name + " has lost a write of " + key);

@@ -32,7 +32,8 @@ class Account {
     std::optional<bool> lastCall;
     bool hasMerged = false;                  // within the daemon's item of work
     bool wasOn = false, hasStopped = false;  // in this life
-    std::shared_ptr<const Dictionary> kept;  // what has been acknowledged
+    // The replica's entries that have been acknowledged; and those that a crash left without a word.
+    std::shared_ptr<const Dictionary> kept, unsure;
   };
   Node& at(int index) { return *nodes[static_cast<std::size_t>(index)]; }
   bool draw(double odds) { return chance(random, odds); }

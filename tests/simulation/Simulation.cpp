@@ -80,7 +80,7 @@ std::vector<Event> shorten(std::uint64_t seed, std::vector<Event> events, int de
 void Counts::add(const Counts& other) {
   for (auto field : {&Counts::seeds, &Counts::events, &Counts::crashes, &Counts::powerCuts,
                      &Counts::partitions, &Counts::staleAlarms, &Counts::staleAlarmEnds, &Counts::leftAlarms,
-                     &Counts::leftRootFlags, &Counts::endsByMerge, &Counts::mixes, &Counts::torn})
+                     &Counts::leftRootFlags, &Counts::endsByMerge, &Counts::mixes, &Counts::leftEnds})
     this->*field += other.*field;
 }
 
@@ -89,9 +89,10 @@ std::string Counts::text() const {
   return part(seeds, "seeds, ") + part(events, "events, ") + part(crashes, "crashes, ") +
          part(powerCuts, "power cuts, ") + part(partitions, "partitions; ") +
          part(staleAlarms, "alarms not re-armed, ") + part(staleAlarmEnds, "periods ended by one; ") +
-         part(leftAlarms, "alarms and ") + part(leftRootFlags, "root flags left by an end elsewhere; ") +
+         part(leftAlarms, "alarms and ") +
+         part(leftRootFlags, "root flags left by a stop elsewhere or cut; ") +
          part(endsByMerge, "periods ended and ") + part(mixes, "mixed by a merge before a write; ") +
-         part(torn, "torn by a crash");
+         part(leftEnds, "end times left by a crash");
 }
 
 }  // namespace simulation

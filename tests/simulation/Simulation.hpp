@@ -43,12 +43,12 @@ struct Counts {
   long seeds = 0, events = 0, crashes = 0, powerCuts = 0, partitions = 0;
   // A device that is on already does not re-arm its alarm when the end time changes.
   long staleAlarms = 0, staleAlarmEnds = 0;
-  // A period that ended elsewhere while the device was down.
+  // A period that ended elsewhere while the device was down, or a stop that was cut.
   long leftAlarms = 0, leftRootFlags = 0;
   // A merge that fell between a reading and its write: a newer period ended; flag and end time of two.
   long endsByMerge = 0, mixes = 0;
-  // Flag and end time of two, as a process died between writing one and the other.
-  long torn = 0;
+  // An end time beside a flag that is off, as a process died between writing one and the other.
+  long leftEnds = 0;
 
   void add(const Counts& other);
   std::string text() const;
