@@ -66,8 +66,14 @@ platform::Result<platform::List> resultsOf(platform::Result<platform::linux_::Bu
   return std::make_error_code(std::errc::protocol_error);
 }
 
-Exit fail(const std::string& what, std::error_code error, const std::string& answer) {
-  say(what + ": " + (answer.empty() ? error.message() : answer));
+Exit fail(const std::string& file, std::error_code error) {
+  say(file + ": " + error.message());
+  return failed;
+}
+
+Exit fail(const std::string& service, std::error_code error, const std::string& answer) {
+  const std::string hint = error == platform::Outcome::notConnected ? "; is hearthd running?" : "";
+  say(service + ": " + (answer.empty() ? error.message() : answer) + hint);
   if (error == platform::Outcome::notPermitted) return refused;
   const bool isAbsent = error == platform::Outcome::notConnected || error == platform::Outcome::timedOut ||
                         error == std::errc::permission_denied;

@@ -35,8 +35,10 @@ class Output {
 
 // One line, the program's name and the text.
 void say(const std::string& text);
-// Says what went wrong with `what`: what the service answered, or the error; the exit code of such an error.
-Exit fail(const std::string& what, std::error_code error, const std::string& answer = "");
+// Says what went wrong with `file`.
+Exit fail(const std::string& file, std::error_code error);
+// Says what went wrong with a question to `service`: what it answered, or the error; the exit code of that.
+Exit fail(const std::string& service, std::error_code error, const std::string& answer);
 
 // The results of a call, or its error; `answer` gets what the service itself said, if the error is of that
 // kind.

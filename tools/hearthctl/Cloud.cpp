@@ -46,6 +46,8 @@ std::vector<std::vector<std::string>> linesOf(const Dictionary& status) {
   const bool isConnected = platform::find(status, "connected") && *platform::find<bool>(status, "connected");
   if (status.contains("url"))
     lines.push_back({"engine", textIn(status, "url") + ", account " + textIn(status, "account")});
+  // Its document may not be there: one that has only followed others has published nothing.
+  if (const std::string own = textIn(status, "device"); !own.empty()) lines.push_back({"this device", own});
   lines.push_back({"connected", isConnected                ? "yes"
                                 : status.contains("since") ? "no, since " + timeIn(status, "since")
                                                            : "no"});
@@ -79,6 +81,15 @@ Result<List> Cloud::call(const std::string& operation, const List& arguments, mi
   return resultsOf((*client)->call(cloudsync::cloudInterface(), operation, arguments, timeout), answer);
 }
 
+Exit Cloud::fail(std::error_code error) const {
+  const bool hasAccount = files.identity(paths.cloud()).has_value();
+  if (hasAccount || error != platform::Outcome::notConnected)
+    return tools::fail("cloudsyncd, " + socket, error, answer);
+  say("this device is in no account: there is no " + paths.cloud() +
+      "; hearthctl init --cloud URL --account NAME, then restart hearthd");
+  return unreachable;
+}
+
 Exit Cloud::status(Output& output) {
   const auto results = call("Status", {}, patience);
   if (!results) return fail(results.error());
@@ -102,7 +113,9 @@ Exit Cloud::use(const std::string& url, const std::string& account) {
 
 Exit Cloud::forget(const std::string& device) {
   const auto results = call("Forget", {device}, patience);
-  return results ? done : fail(results.error());
+  if (results) return done;
+  return answer.empty() ? fail(results.error())
+                        : tools::fail(device + " is not forgotten", results.error(), answer);
 }
 
 Exit Cloud::makeNewIdentity(Output& output) {

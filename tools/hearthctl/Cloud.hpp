@@ -27,7 +27,7 @@ class Cloud {
  private:
   platform::Result<platform::List> call(const std::string& operation, const platform::List& arguments,
                                         std::chrono::milliseconds patience);
-  Exit fail(std::error_code error) const { return tools::fail("cloudsyncd, " + socket, error, answer); }
+  Exit fail(std::error_code error) const;
 
   const platform::linux_::Paths& paths;
   platform::linux_::FileSystem& files;

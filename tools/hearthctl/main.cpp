@@ -45,7 +45,7 @@ void addSettings(CLI::App& app, Options& options) {
   set->add_option("--type", options.type, "what VALUE is; by default what it looks like")
       ->check(CLI::IsMember({"bool", "int", "double", "string"}));
   add("unset", "remove a key", true);
-  add("edit", "edit all values in $VISUAL or $EDITOR", false);
+  add("edit", "edit all values in $VISUAL, $EDITOR or vi", false);
 }
 
 void addNotify(CLI::App& app, Options& options) {
@@ -65,11 +65,12 @@ void addCloud(CLI::App& app, Options& options) {
   cloud->add_subcommand("status", "print how the exchange with the other devices stands");
   auto* use = cloud->add_subcommand("use", "change to another account; the old one's values are kept aside");
   use->add_option("URL", options.device.cloud, "dir:PATH, or dir:PATH?poll=SECONDS")->required();
-  use->add_option("--account", options.device.account)->required();
+  use->add_option("--account", options.device.account, "the account there")->required();
   cloud->add_subcommand("forget", "take a lost device's document out of the account")
-      ->add_option("DEVICE", options.name)
+      ->add_option("DEVICE", options.name, "its name, as cloud status prints it")
       ->required();
-  cloud->add_subcommand("new-identity", "make this copy of another device's disk a device of its own");
+  cloud->add_subcommand("new-identity",
+                        "make this copy of another device's disk a device of its own; prints its name");
 }
 
 Exit runCloud(const std::string& command, const Options& options, tools::Cloud cloud, tools::Output& output) {
@@ -80,7 +81,8 @@ Exit runCloud(const std::string& command, const Options& options, tools::Cloud c
 }
 
 void addCommands(CLI::App& app, Options& options) {
-  auto* init = app.add_subcommand("init", "lay out etc/ of a root; files that are there are kept");
+  auto* init = app.add_subcommand(
+      "init", "lay out etc/ of a root, which hearthd reads at its start; files that are there are kept");
   init->add_option("--device-name", options.device.name, "by default the machine's host name");
   init->add_option("--build", options.device.build, "the operating system's build")->capture_default_str();
   init->add_flag("--internal", options.device.isInternal, "an internal build of the operating system");
@@ -89,19 +91,23 @@ void addCommands(CLI::App& app, Options& options) {
   auto* account = init->add_option("--account", options.device.account, "the account there");
   url->needs(account);
   account->needs(url);
-  auto* jobs = app.add_subcommand("jobs", "print the jobs, or control one")->require_subcommand(0, 1);
+  auto* jobs = app.add_subcommand("jobs", "print the jobs, each with its state and process, or control one")
+                   ->require_subcommand(0, 1);
   for (const char* action : {"start", "stop", "restart"}) {
     jobs->add_subcommand(action, std::string(action) + " a job")
-        ->add_option("NAME", options.name)
+        ->add_option("NAME", options.name, "the job's, as jobs prints it")
         ->required();
   }
   addSettings(app, options);
   addNotify(app, options);
   auto* alarms = app.add_subcommand("alarms", "print the alarms, or cancel some")->require_subcommand(0, 1);
-  alarms->add_subcommand("cancel", "cancel all of a name")->add_option("NAME", options.name)->required();
+  alarms->add_subcommand("cancel", "cancel all of a name")
+      ->add_option("NAME", options.name, "as alarms prints it")
+      ->required();
   auto* event = app.add_subcommand("event", "deliver an event by hand");
-  event->add_option("STREAM", options.stream)->required();
-  event->add_option("NAME", options.name)->required();
+  event->add_option("STREAM", options.stream, "as in the job's file and in alarms: com.kestrel.alarm, …")
+      ->required();
+  event->add_option("NAME", options.name, "the event's")->required();
   addCloud(app, options);
   app.add_subcommand("grants", "print what is granted to which program, and what does not count");
   app.add_subcommand("check", "say whether stores and alarms agree; exit 1 if not");
