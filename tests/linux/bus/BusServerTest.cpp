@@ -6,6 +6,7 @@
 
 #include <random>
 
+#include "platform/linux/BusClient.hpp"
 #include "tests/linux/bus/BusWorld.hpp"
 
 namespace platform::linux_ {
@@ -115,6 +116,48 @@ TEST_F(BusServerTest, TheLastCallOfAClientThatHasGoneIsHandled) {
   EXPECT_EQ(calls.size(), 2u);
 }
 
+TEST_F(BusServerTest, EveryClientThatIsRefusedIsToldSo) {
+  const std::size_t before = openDescriptors();
+  const std::string refused = "REJECTED EXTERNAL\r\nREJECTED EXTERNAL\r\nREJECTED EXTERNAL\r\n";
+  decides = false;
+  // Decided before the client speaks or after it, who speaks in one piece or by the byte, and reads before or
+  // after that.
+  for (unsigned count = 0; count < 800; ++count) {
+    const bool isDecidedFirst = count % 2 == 0, readsFirst = count % 4 == 0;
+    const std::size_t piece = count % 8 < 4 ? handshakeAhead.size() : 1;
+    Wire wire = connect();
+    const auto refuse = [&] {
+      ASSERT_TRUE(waitFor([&] { return !undecided.empty(); }));
+      std::exchange(undecided, {})[0]({});
+    };
+    if (isDecidedFirst) refuse();
+    std::string told = readsFirst ? wire.readToEnd() : "";
+    for (std::size_t at = 0; at < handshakeAhead.size(); at += piece)
+      ASSERT_TRUE(wire.send(handshakeAhead.substr(at, piece))) << "a broken pipe is no refusal";
+    if (!isDecidedFirst) refuse();
+    if (!readsFirst) told = wire.readToEnd();
+    ASSERT_EQ(told, refused) << count;
+  }
+  EXPECT_TRUE(waitFor([&] { return openDescriptors() == before; }));
+}
+
+TEST_F(BusServerTest, DrainingWaitsForTheAnswersThatAreLeft) {
+  Wire wire = client();
+  ASSERT_TRUE(wire.send(callMessage("Hold", "answer")));
+  ASSERT_TRUE(waitFor([&] { return held.size() == 1; }));
+  Wire idle = client();
+  const Wire shaking = connect();
+  turn();
+  bool drained = false;
+  server->drain([&] { drained = true; });
+  turn();
+  EXPECT_FALSE(drained);
+  complete(0);
+  EXPECT_TRUE(wire.reads(text("answer")));
+  EXPECT_TRUE(waitFor([&] { return drained; }));
+  EXPECT_EQ(closed, 1) << "of the one that was still in its handshake";
+}
+
 TEST_F(BusServerTest, UnreadSignalsMergeByKeyAndKeepTheirOrder) {
   Wire wire = client();
   constexpr std::size_t count = 2000, size = 1024;
@@ -199,6 +242,13 @@ TEST_F(BusServerTest, OneUsersConnectionsAreLimitedAndOneThatEndsMakesRoom) {
   first.socket.reset();
   EXPECT_TRUE(waitFor([&] { return closed == 1; }));
   EXPECT_TRUE(client().isServed());
+}
+
+TEST(BusClientTest, AServiceThatHangsCostsAClientItsTimeoutAndNoMore) {
+  const TemporaryFolder folder;
+  const UniqueDescriptor nobodyAccepts = listenAt(folder.path + "/hanging");
+  EXPECT_EQ(BusClient::connect(folder.path + "/hanging", 50ms).error(), Outcome::timedOut);
+  EXPECT_EQ(BusClient::connect(folder.path + "/none", deadline).error(), Outcome::notConnected);
 }
 
 // Without patience.
