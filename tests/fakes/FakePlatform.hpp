@@ -26,23 +26,12 @@ class FakePlatform : public platform::Platform {
   }
   ~FakePlatform() override { teardown(); }
 
-  // Draws the order of the pool's work, and whose turn it is, from `value`, which is printed.
-  void seed(std::uint64_t value) {
-    testing::Test::RecordProperty("seed", std::to_string(value));
-    random.emplace(value);
-    pool->seed(value);
-  }
   // One item of the pool, the main queue or the delivery thread. False if there is none.
   bool runOne() {
-    std::vector<ManualPool*> ready;
     for (ManualPool* queue : {pool.get(), loop.queue.get(), delivery.get()}) {
-      if (!queue->isEmpty()) ready.push_back(queue);
+      if (!queue->isEmpty()) return queue->runOne(), true;
     }
-    if (ready.empty()) return false;
-    const std::size_t turn =
-        random ? std::uniform_int_distribution<std::size_t>(0, ready.size() - 1)(*random) : 0;
-    ready[turn]->runOne();
-    return true;
+    return false;
   }
   // Everything that is queued and what that queues. Fails the test if that does not end.
   void runAll() {
@@ -135,7 +124,6 @@ class FakePlatform : public platform::Platform {
   };
 
   const std::shared_ptr<PostRecorder> postRecorder = std::make_shared<PostRecorder>(PostRecorder{effects});
-  std::optional<std::mt19937_64> random;
 };
 
 }  // namespace fakes

@@ -44,11 +44,6 @@ class MemoryFileSystem : public FileSystem {
     pending.push_back(path);
   }
   std::string bytes(const std::string& path) const { return now.at(path)->bytes; }
-  // What a power cut would leave of it.
-  std::string durableBytes(const std::string& path) const {
-    const auto found = durable.find(path);
-    return found == durable.end() ? "" : found->second->synced;
-  }
   bool hasEvents() const { return !pending.empty(); }
   bool exists(const std::string& path) const { return now.contains(path); }
   // With everything in it, as if it had been moved out of sight.
