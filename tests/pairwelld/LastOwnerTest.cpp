@@ -1,4 +1,4 @@
-// The last owner of an object goes inside a delivery to it, on each thread and queue where that can happen.
+// The last owner of an object goes inside a delivery to it.
 #include "pairwelld/TarnNotificationHelper.hpp"
 #include "pairwelld/notifications/TarnNotificationManager.hpp"
 #include "pairwelld/service/ConduitListener.hpp"
@@ -8,146 +8,102 @@ namespace pairwell {
 namespace {
 
 struct LastOwnerTest : World {
-  using Device = LastOwnerTest;
-  struct Row {
-    const char* name;
-    std::function<void(Device&)> deliver;
-    // The effect at which the owner goes, in the midst of what makes it.
-    std::string at;
-  };
-  // Each row on a device of its own.
-  static void check(const std::function<void(Device&)>& make, const std::vector<Row>& rows) {
-    for (const Row& row : rows) {
-      SCOPED_TRACE(row.name);
-      Device device;
-      make(device);
-      device.run();
-      device.mark();
-      device.platform.effects.onMoment = [&] {
-        const Calls all = device.effects(~0u);
-        const bool isDue = !all.empty() && all.back().find(row.at) != std::string::npos;
-        if (isDue && device.release) std::exchange(device.release, nullptr)();
-      };
-      row.deliver(device);
-      device.run();
-      EXPECT_FALSE(device.release);
-      EXPECT_TRUE(device.watched.expired());
-    }
+  // `release` lets go of every reference but those of a delivery under way: at the first effect of that text,
+  // in the midst of what makes it.
+  void expectGone(const std::weak_ptr<void>& object, std::function<void()> release, const std::string& at,
+                  const std::function<void()>& deliver) {
+    SCOPED_TRACE(at);
+    run();
+    mark();
+    platform.effects.onMoment = [&] {
+      const Calls all = effects(~0u);
+      const bool isDue = release && !all.empty() && all.back().find(at) != std::string::npos;
+      if (isDue) std::exchange(release, nullptr)();
+    };
+    deliver();
+    run();
+    platform.effects.onMoment = nullptr;
+    EXPECT_FALSE(release);
+    EXPECT_TRUE(object.expired());
   }
-  // `release`, which is dropped when it has run, lets go of every reference but those of a delivery under
-  // way.
-  void keep(std::weak_ptr<void> object, std::function<void()> release_) {
-    watched = std::move(object);
-    release = std::move(release_);
-  }
-  std::shared_ptr<Subscriber> makeCaller() {
-    const auto subscriber = makeSubscriber("");
-    subscriber->onCall = [this] { effect(); };
-    return subscriber;
-  }
-  void effect() { platform.effects.record(Effects::client, "called"); }
-
-  void switchOff() { platform.cloud->changeFromElsewhere({{flagKey, false}}); }
-  void fireAlarm() { platform.streams.deliver("com.kestrel.alarm", {{"Name", flagKey}}); }
-
- private:
-  std::weak_ptr<void> watched;
-  std::function<void()> release;
+  void called() { platform.effects.record(Effects::client, "called"); }
 };
 
 TEST_F(LastOwnerTest, OfTheStoreManager) {
-  const auto make = [](Device& device) {
-    const auto kvs = KeyValueStoreManager::create();
+  // On its queue with more deliveries behind, on the poster's thread, on a global queue.
+  const std::pair<const char*, void (World::*)()> rows[] = {
+      {"called", &World::changeCloud},
+      {"post pairwell.prefsChanged", &World::changeUser},
+      {"Root KVS Notification", &World::changeRoot}};
+  for (const auto& [at, change] : rows) {
+    auto kvs = KeyValueStoreManager::create();
     kvs->activate();
-    kvs->subscribe(device.makeCaller());
-    device.keep(kvs, [kvs] {});
-  };
-  check(make, {{"on its queue, with more deliveries behind", &Device::changeCloud, "called"},
-               {"on the poster's thread", &Device::changeCloud, "post pairwell.prefsChanged"},
-               {"on a global queue", &Device::changeRoot, "Root KVS Notification"}});
+    const auto subscriber = makeSubscriber("");
+    subscriber->onCall = [this] { called(); };
+    kvs->subscribe(subscriber);
+    expectGone(
+        kvs, [&] { kvs.reset(); }, at, [this, change = change] { (this->*change)(); });
+  }
 }
 
 TEST_F(LastOwnerTest, OfTheObserver) {
-  const auto make = [](Device& device) {
-    const auto observer = KeyValueStoreCustomObserver::create(
-        {overrideKey}, [&device, own = std::make_shared<int>()](KeyValueSource, const auto&) {
-          device.effect();
+  for (const auto change : {&World::changeUser, &World::changeCloud, &World::changeRoot}) {
+    // What a callback holds is there until it returns.
+    auto observer = KeyValueStoreCustomObserver::create(
+        {overrideKey}, [this, own = std::make_shared<int>()](KeyValueSource, const auto&) {
+          called();
           ++*own;
         });
     observer->start();
-    device.keep(observer, [observer] {});
-  };
-  check(make, {{"on the delivery thread", &Device::changeUser, "called"},
-               {"on the poster's thread", &Device::changeCloud, "called"},
-               {"on a global queue", &Device::changeRoot, "called"}});
+    expectGone(
+        observer, [&] { observer.reset(); }, "called", [this, change] { (this->*change)(); });
+  }
 }
 
-TEST_F(LastOwnerTest, OfTheDebugManager) {
-  const auto make = [](Device& device) {
-    const auto kvs = device.makeManager();
-    kvs->activate();
-    const auto manager = DebugManager::create(kvs);
-    device.platform.cloud->store(flagKey, true);
-    manager->activate();
-    device.keep(manager, [manager] {
-      dropSubscriptions(*manager->kvs);
-      letGo(*manager);
+TEST_F(LastOwnerTest, OfTheDebugManagerInsideAWrite) {
+  const auto kvs = makeManager();
+  kvs->activate();
+  platform.cloud->store(flagKey, true);
+  auto manager = DebugManager::create(kvs);
+  manager->activate();
+  const auto release = [&] {
+    dropSubscriptions(*kvs);
+    letGo(*manager);
+    manager.reset();
+  };
+  expectGone(manager, release, "post cloud.storeChanged", [this] {
+    platform.cloud->changeFromElsewhere({{flagKey, false}});
+  });
+}
+
+TEST_F(LastOwnerTest, OfAHelperOnEitherRoute) {
+  TarnNotificationManager::shared()->setUp();
+  for (const bool isStream : {false, true}) {
+    const std::weak_ptr helper = TarnNotificationHelper::create({{"a", [this, own = std::make_shared<int>()] {
+                                                                    called();
+                                                                    ++*own;
+                                                                  }}});
+    const auto release = [&] { TarnNotificationManager::shared()->unregisterHelper(*helper.lock()); };
+    expectGone(helper, release, "called", [&] {
+      if (!isStream) return platform.named.postFromElsewhere("a");
+      platform.streams.deliver("com.kestrel.tidingsd.matching", {{"Name", "a"}});
     });
-  };
-  check(make, {{"on main", &Device::fireAlarm, "didReceieve notification"},
-               {"on the store manager's queue", &Device::changeUser, "keyValueChanged source"},
-               {"on its queue, inside a write", &Device::switchOff, "post cloud.storeChanged"},
-               {"on its queue, at its last step", &Device::switchOff, "post pairwell.settingsChanged"}});
+  }
 }
 
-TEST_F(LastOwnerTest, OfASubscriber) {
-  const auto make = [](Device& device) {
-    const auto kvs = device.makeManager();
-    kvs->activate();
-    const auto subscriber = device.makeCaller();
-    const auto changes = kvs->subscribe(subscriber);
-    const auto alarms = SystemNotificationManager::shared()->subscribe(subscriber);
-    device.keep(subscriber, [changes, alarms] {
-      changes.unsubscribe([](const auto&) {});
-      alarms.unsubscribe([](const auto&) {});
-    });
+TEST_F(LastOwnerTest, OfAConnectionAndSoOfItsListener) {
+  auto listener = ConduitListener::create();
+  listener->activate();
+  run();
+  auto client = offerClient(7);
+  const auto release = [&] {
+    platform.listeners[0]->clients.clear();
+    client->end();
+    const auto queue = std::exchange(listener, nullptr)->serialQueue;
+    queue->sync([] {});
   };
-  check(make, {{"on main", &Device::fireAlarm, "called"},
-               {"on the store manager's queue", &Device::changeUser, "called"}});
-}
-
-TEST_F(LastOwnerTest, OfAHelper) {
-  const auto make = [](Device& device) {
-    TarnNotificationManager::shared()->setUp();
-    const std::weak_ptr helper = TarnNotificationHelper::create({{"a", [&device] { device.effect(); }}});
-    device.keep(helper, [helper] { TarnNotificationManager::shared()->unregisterHelper(*helper.lock()); });
-  };
-  const auto post = [](Device& device) { device.platform.named.postFromElsewhere("a"); };
-  const auto match = [](Device& device) {
-    device.platform.streams.deliver("com.kestrel.tidingsd.matching", {{"Name", "a"}});
-  };
-  check(make, {{"on main, from the centre", post, "called"}, {"on main, from the stream", match, "called"}});
-}
-
-TEST_F(LastOwnerTest, OfAConnectionAndItsListener) {
-  const auto make = [](Device& device) {
-    const auto listener = ConduitListener::create();
-    listener->activate();
-    device.run();
-    const auto client = device.offerClient(7);
-    // The connection holds its listener, so both go.
-    device.keep(listener, [&device, listener, client] {
-      device.platform.listeners[0]->clients.clear();
-      client->end();
-      if (!listener->serialQueue->isCurrent()) listener->serialQueue->sync([] {});
-    });
-  };
-  const auto write = [](Device& device) {
-    device.platform.listeners[0]->clients[0]->exportedObject->setKestrelAudioAccessoryLimitedLogging(
-        true, [](auto) {});
-  };
-  const auto offer = [](Device& device) { device.offerClient(8, {}); };
-  check(make, {{"on a worker", write, "Enable Kestrel"}, {"on the listener's queue", offer, "denied, 8"}});
+  expectGone(listener, release, "Enable Kestrel",
+             [&] { client->exportedObject->setKestrelAudioAccessoryLimitedLogging(true, [](auto) {}); });
 }
 
 }  // namespace
