@@ -1,6 +1,5 @@
 // The operator's command line, without hearthd and with a real one.
 #include <algorithm>
-#include <sstream>
 
 #include "tests/system/Device.hpp"
 
