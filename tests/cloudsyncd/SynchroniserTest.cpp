@@ -183,41 +183,6 @@ TEST_F(SynchroniserTest, KeepsWhatExceedsTheQuotaHereAndSaysSoOnce) {
   EXPECT_EQ(synchroniser.status().problem, "");
 }
 
-TEST_F(SynchroniserTest, ACopyOfTheDiskStopsPublishingUntilItHasANameOfItsOwn) {
-  make({{"account", "home"}, {"device", "me"}, {"writers", platform::List{"former"}}});
-  synchroniser.received("me", document("me", {{"key", entry(1, 5)}}, "former"));
-  connect();
-  write("key", 2);
-  EXPECT_TRUE(publishNext());
-  synchroniser.received("me", document("me", {{"key", entry(3, 1'000'000'000'000)}}, "stranger"));
-  deliver();
-  EXPECT_EQ(values(), R"(["key": 3])");
-  write("key", 4);
-  EXPECT_FALSE(publishNext());
-  EXPECT_THAT(synchroniser.status().problem, testing::HasSubstr("new-identity"));
-  EXPECT_TRUE(platform::linux_::SettingsFile::create(files, path)->update([](Dictionary& document) {
-    makeNewIdentity(document);
-    return true;
-  }));
-  deliver();
-  const auto sent = publishNext();
-  ASSERT_TRUE(sent);
-  EXPECT_NE(sent->device, "me");
-}
-
-TEST_F(SynchroniserTest, AnotherAccountIsSwappedInWholeAndTheOldOneKept) {
-  make({{"account", "work"}, {"device", "me"}, {"values", Dictionary{{"old", entry(1, 9)}}}});
-  synchroniser.received("peer", document("peer", {{"new", entry(1, 1)}}));
-  connect();
-  EXPECT_EQ(values(), R"(["new": 1])");
-  EXPECT_EQ(whole().at("reason"), Value(3));
-  std::string problem;
-  const auto kept = platform::linux_::decodeSettings(files.bytes(path + ".account-work"), problem);
-  ASSERT_TRUE(kept) << problem;
-  EXPECT_TRUE(settingsValues(*kept).contains("old"));
-  EXPECT_FALSE(publishNext()) << "nothing of the old account is mixed in";
-}
-
 TEST_F(SynchroniserTest, AFullDiskAndALostReplicaHealByThemselves) {
   make({{"account", "home"}, {"device", "me"}});
   connect();
