@@ -7,7 +7,6 @@
 
 #include <cerrno>
 #include <cstdint>
-#include <system_error>
 #include <utility>
 
 #include "hearthd/LifeLock.hpp"

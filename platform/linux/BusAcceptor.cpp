@@ -6,7 +6,6 @@
 #include <sys/socket.h>
 
 #include <cerrno>
-#include <string>
 #include <utility>
 
 #include "platform/LogSink.hpp"

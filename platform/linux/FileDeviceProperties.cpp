@@ -8,7 +8,6 @@
 #include <cstring>
 #include <limits>
 #include <sstream>
-#include <vector>
 
 namespace platform::linux_ {
 namespace {

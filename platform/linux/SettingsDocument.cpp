@@ -1,7 +1,6 @@
 #include "platform/linux/SettingsDocument.hpp"
 
 #include <algorithm>
-#include <cstddef>
 #include <cstdint>
 #include <cstdio>
 #include <optional>

@@ -1,6 +1,5 @@
 #include "platform/linux/SettingsFile.hpp"
 
-#include <filesystem>
 #include <utility>
 
 #include "platform/LogSink.hpp"

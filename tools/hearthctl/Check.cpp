@@ -11,7 +11,6 @@
 #include "pairwelld/settings/Defaults.hpp"
 #include "platform/EventStreams.hpp"
 #include "platform/linux/Entitlements.hpp"
-#include "platform/linux/Json.hpp"
 #include "platform/linux/LinuxEnvironment.hpp"
 #include "tools/StoredSettings.hpp"
 #include "tools/hearthctl/Settings.hpp"
