@@ -14,9 +14,9 @@ constexpr std::string_view companionSuffix = "Expiration";
 // Beyond what any clock says, and far from overflow: such a stamp is its entry's fault.
 constexpr std::int64_t greatestStamp = std::int64_t{1} << 61;
 
-std::optional<std::int64_t> stampPart(const Dictionary& entry, std::string_view name) {
+std::optional<std::int64_t> stampPart(const Dictionary& entry, std::string_view name, std::int64_t least) {
   const auto* number = platform::find<std::int64_t>(entry, name);
-  return number && *number >= 0 && *number <= greatestStamp ? std::optional(*number) : std::nullopt;
+  return number && *number >= least && *number <= greatestStamp ? std::optional(*number) : std::nullopt;
 }
 
 std::int64_t microsecondsOf(Time time) {
@@ -61,20 +61,30 @@ std::optional<std::string> passedCompanion(const Dictionary& entries, const Clou
   return end && *end <= write.now.count() + 1 ? std::optional(companion) : std::nullopt;
 }
 
-// The flag that is on, and that has no end time yet but for `write`.
-std::optional<CloudEntry> flagWithoutEnd(const Dictionary& entries, const CloudWrite& write) {
-  const std::string_view stem = cloudStemOf(write.key);
-  const auto flag = CloudEntry::find(entries, stem), end = CloudEntry::find(entries, write.key);
-  if (stem == write.key || !write.value || !flag || !flag->value) return std::nullopt;
-  if (!toBool(*flag->value).value_or(false)) return std::nullopt;
-  return !end || (!end->value && flag->outranks(*end)) ? flag : std::nullopt;
-}
-
 bool place(Dictionary& entries, const std::string& key, const CloudEntry& entry) {
   const auto there = CloudEntry::find(entries, key);
   if (there && !entry.outranks(*there)) return false;  // somebody else's is newer
   entries.insert_or_assign(key, entry.toValue());
   return true;
+}
+
+// An end time that is not written behind its flag: by one who follows a switch and finds half of it, as its
+// writer is slow or was cut off. It ranks as the flag does, whenever it is written, or it would part what
+// somebody else has switched on meanwhile; and before the end time that the writer may still give it. Where
+// the flag says otherwise by now, what it belonged to has been overtaken, and it is lost with that. Absent:
+// it is a write like others.
+std::optional<bool> writeEndAlone(Dictionary& entries, const CloudWrite& write) {
+  const std::string_view stem = cloudStemOf(write.key);
+  const auto flag = CloudEntry::find(entries, stem), there = CloudEntry::find(entries, write.key);
+  if (stem == write.key || !flag || !flag->value) return std::nullopt;
+  const bool isOn = toBool(*flag->value).value_or(false);
+  const bool hasEnd = there && there->value;
+  if (isOn != write.value.has_value() || (isOn && hasEnd)) {
+    return write.lastKnown ? std::optional(false) : std::nullopt;  // who never looked follows nobody
+  }
+  if (there && !flag->outranks(*there)) return std::nullopt;
+  return place(entries, write.key,
+               {write.value, {flag->stamp.microseconds, flag->stamp.tick - isOn}, flag->device});
 }
 
 std::optional<std::int64_t> number(const Dictionary& document, std::string_view name) {
@@ -95,8 +105,8 @@ CloudStore::ChangeReason reasonGiven(const Dictionary& before, const Dictionary&
 std::optional<CloudEntry> CloudEntry::fromValue(const Value& value) {
   const auto* fields = value.as<Dictionary>();
   if (!fields) return std::nullopt;
-  const auto microseconds = stampPart(*fields, "time");
-  const auto tick = stampPart(*fields, "tick");
+  const auto microseconds = stampPart(*fields, "time", 0);
+  const auto tick = stampPart(*fields, "tick", -1);
   const auto* device = platform::find<std::string>(*fields, "device");
   const auto stored = valueOf(*fields, "value");
   const bool isRemoved = valueOf(*fields, "removed") == Value(true);
@@ -173,13 +183,11 @@ bool CloudBursts::write(Dictionary& entries, const CloudWrite& write) {
   if (const auto companion = passedCompanion(entries, write)) return expire(entries, write, *companion);
   if (!write.value && write.key == expiring) return place(entries, write.key, {{}, stamp, endedDevice});
   expiring.clear();  // any other write, an echo too, ends what belongs to the expiry
-  if (const auto flag = flagWithoutEnd(entries, write)) {
-    // It ranks as its flag, whoever wrote that and when: a device that was cut off between the two, or that
-    // finds the flag of one that was, must not part what somebody else has switched on meanwhile.
-    return place(entries, write.key, {write.value, flag->stamp, flag->device});
-  }
   const bool isTogether = joins(entries, write);
-  if (isEcho(write) && !(isTogether && isCompanion(write.key))) return false;
+  if (!isTogether || !isCompanion(write.key)) {
+    if (isEcho(write)) return false;
+    if (const auto changed = writeEndAlone(entries, write)) return *changed;
+  }
   if (!isTogether) stamp = nextStamp(entries, write);
   lastWrite = write.now;
   lastKey = write.key;
@@ -216,14 +224,15 @@ bool CloudBursts::isCompanion(std::string_view key) const {
 // What is written together carries one stamp, or the flag and end time of two devices could mix. A second
 // value for a key begins the next at once: another process may have published the first. So does an entry
 // that somebody else has overtaken, since the write would be lost on it; but for an end time whose flag has
-// been overtaken with it: another's switch that arrives between the two writes of one must not lose half.
+// been overtaken with it: another's switch that arrives between the two writes of one must not lose half. Nor
+// do those part the two who have followed or ended the flag meanwhile.
 bool CloudBursts::joins(const Dictionary& entries, const CloudWrite& write) const {
   if (!lastWrite || write.now < *lastWrite || write.now - *lastWrite > quiet) return false;
   const auto there = CloudEntry::find(entries, write.key);
   if (!there || there->stamp < stamp) return true;
   const auto flag = CloudEntry::find(entries, lastKey);
   const bool isOurs = flag && flag->stamp == stamp && flag->device == write.device;
-  return isCompanion(write.key) && !isOurs;
+  return isCompanion(write.key) && (!isOurs || there->stamp.microseconds == stamp.microseconds);
 }
 
 }  // namespace platform::linux_

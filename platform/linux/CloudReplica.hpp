@@ -14,7 +14,8 @@ namespace platform::linux_ {
 
 // A hybrid logical timestamp. Ordinary writes count in `microseconds` alone: the clock's, or one more than
 // the greatest that the replica knows, those left out that are more than a day ahead of the clock. `tick` is
-// left to expiries, which rank right after what they end and before anything else.
+// left to expiries, which rank right after what they end and before anything else, and, as -1, to the end
+// time that a follower gives a flag, which ranks right before that of the flag's own writer.
 struct CloudStamp {
   std::int64_t microseconds = 0;  // since 1970
   std::int64_t tick = 0;
@@ -80,7 +81,8 @@ class CloudBursts {
 
   // Makes `write` in `entries`, and says whether that changed them. It does not where the write is an echo: a
   // device that follows another's switch writes the same values back, which must not outrank what a person
-  // did meanwhile. Only an end time that is written behind its flag is none: they carry one stamp.
+  // did meanwhile. Only an end time that is written behind its flag is none: they carry one stamp. Nor does
+  // it where the flag that an end time belonged to was an echo, and has been overtaken.
   bool write(Dictionary& entries, const CloudWrite& write);
   // The write is durable. The quiet counts from here: a slow disk must not part what is written together.
   void finished(Time now);

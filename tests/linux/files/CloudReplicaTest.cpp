@@ -91,8 +91,8 @@ TEST(CloudReplicaTest, WhatIsWrittenTogetherSharesOneTimestamp) {
   device.now += Time(0.026);
   device.write("third", 2);
   EXPECT_GT(device.stamp("third"), second);
-  device.write("flagExpiration", 2);
-  EXPECT_EQ(device.stamp("flagExpiration"), device.stamp("third")) << "a slow disk parts nothing";
+  device.write("fourth", 2);
+  EXPECT_EQ(device.stamp("fourth"), device.stamp("third")) << "a slow disk parts nothing";
 
   Device neighbour("d");
   neighbour.entries = device.entries;
@@ -101,7 +101,7 @@ TEST(CloudReplicaTest, WhatIsWrittenTogetherSharesOneTimestamp) {
   EXPECT_GT(neighbour.stamp("flag"), device.stamp("third")) << "though its clock is behind";
   device.entries = neighbour.entries;
   EXPECT_TRUE(device.write("flag", 7)) << "not lost on what has overtaken the burst";
-  EXPECT_EQ(device.values(), R"(["flag": 7, "flagExpiration": 2, "third": 2])");
+  EXPECT_EQ(device.values(), R"(["flag": 7, "fourth": 2, "third": 2])");
 }
 
 TEST(CloudReplicaTest, ExpiryRanksRightAfterTheSwitchThatItEnds) {
@@ -149,6 +149,10 @@ TEST(CloudReplicaTest, ExpiryRanksRightAfterTheSwitchThatItEnds) {
   for (const char* key : {"flag", "flagExpiration"}) home.read(key);
   home.now = away.now + Time(1);
   home.switchOn(20000);  // echoes
+  away.now += Time(2);
+  away.write("flag", false);
+  mergeCloudEntries(away.entries, home.entries);
+  home.read("flag");
   EXPECT_TRUE(home.write("flagExpiration", std::nullopt));
 }
 
@@ -162,16 +166,45 @@ TEST(CloudReplicaTest, ASwitchThatIsOvertakenMidwayLosesBothItsKeys) {
   EXPECT_EQ(ours.entries, theirs.entries);
 }
 
-TEST(CloudReplicaTest, AnEndTimeThatAFlagLacksRanksAsTheFlag) {
-  Device cut("cut"), third("third"), home("home");
-  cut.write("flag", true);
-  third.exchange(cut);
-  home.now += Time(10);
-  home.switchOn(7000);
-  third.now += Time(20);
-  EXPECT_TRUE(third.write("flagExpiration", 9000.0));
-  third.exchange(home);
-  EXPECT_EQ(third.values(), R"(["flag": true, "flagExpiration": 7000.0])");
+TEST(CloudReplicaTest, AFollowerOfHalfASwitchOutranksNothingNewer) {
+  for (const bool isOn : {true, false}) {
+    Device cut("cut"), third("third"), home("home");
+    if (!isOn) cut.switchOn(5000);
+    third.exchange(cut);
+    for (const char* key : {"flag", "flagExpiration"}) third.read(key);
+    cut.now += Time(1);
+    cut.write("flag", isOn);
+    third.exchange(cut);
+    home.now += Time(10);
+    home.switchOn(7000);
+    third.now += Time(20);
+    third.read("flag");
+    EXPECT_TRUE(third.write("flagExpiration", isOn ? std::optional<Value>(9000.0) : std::nullopt));
+    third.exchange(home);
+    EXPECT_EQ(third.values(), R"(["flag": true, "flagExpiration": 7000.0])");
+    EXPECT_FALSE(third.write("flagExpiration", std::nullopt)) << "its flag has been overtaken";
+  }
+}
+
+TEST(CloudReplicaTest, ASlowSwitchKeepsItsPairTogetherWhateverItsFollowersWrite) {
+  Device slow("slow"), follower("follower");
+  slow.write("flag", true);
+  follower.exchange(slow);
+  follower.write("flagExpiration", 9000.0);
+  slow.exchange(follower);
+  slow.write("flagExpiration", 5000.0);
+  follower.exchange(slow);
+  EXPECT_EQ(follower.values(), R"(["flag": true, "flagExpiration": 5000.0])");
+  EXPECT_EQ(follower.stamp("flagExpiration"), follower.stamp("flag"));
+
+  slow.now += Time(1);
+  slow.write("flag", false);
+  follower.exchange(slow);
+  follower.now = Time(5000);
+  follower.switchOff();  // its end, there
+  slow.exchange(follower);
+  slow.write("flagExpiration", std::nullopt);
+  EXPECT_EQ(slow.entries, follower.entries);
 }
 
 TEST(CloudReplicaTest, AnExpiryEndsNoSwitchOfTheSameMomentAndIsNoEcho) {
