@@ -1,6 +1,7 @@
 #include "tests/simulation/Account.hpp"
 
 #include <algorithm>
+#include <utility>
 
 namespace simulation {
 
@@ -171,9 +172,10 @@ bool Account::step() {
   std::vector<std::function<void()>> ready;
   for (auto& each : nodes) {
     Node& node = *each;
-    if (node.daemon && !node.daemon->isIdle()) {
+    const bool isFree = node.daemon && running != &node;
+    if (isFree && !node.daemon->isIdle()) {
       ready.push_back([&] { runDaemon(node, [&] { node.daemon->runOne(); }); });
-    } else if (node.daemon) {
+    } else if (isFree) {
       becomeIdle(node);
     }
     if (node.sync && !node.sync->platform->isIdle())
@@ -199,22 +201,24 @@ void Account::becomeIdle(Node& node) {
 
 void Account::runDaemon(Node& node, const std::function<void()>& work) {
   tick(node);
-  const auto before = node.machine.entries();
-  running = &node;
-  node.hasMerged = false;
+  node.before = node.machine.entries();
+  node.hasBegun = node.hasMerged = false;
+  Node* const former = std::exchange(running, &node);
   work();
-  running = nullptr;
-  if (node.machine.entries() != before) noteWork(node, *before);
+  running = former;
+  noteWork(node);
   const bool isOn = node.daemon->state();
   node.hasStopped = !isOn && (node.hasStopped || node.wasOn);
   node.wasOn = isOn;
 }
 
-void Account::noteWork(Node& node, const Dictionary& before) {
+void Account::noteWork(Node& node) {
+  const auto before = std::exchange(node.before, node.machine.entries());
+  if (node.before == before) return;
   const auto& files = node.machine.files;
   const auto alarm = node.daemon->eventStreams().delivered;
-  witness.wrote({node.name, before, *node.machine.entries(), node.daemon->manualClock.time.count(),
-                 files.calls >= files.failFrom, node.hasMerged, node.calls,
+  witness.wrote({node.name, *before, *node.before, node.daemon->manualClock.time.count(),
+                 files.calls >= files.failFrom, node.hasBegun, node.hasMerged, node.calls,
                  alarm ? std::optional(static_cast<double>(alarm->nanoseconds) / 1e9) : std::nullopt,
                  node.question});
   noteKept(node);
@@ -222,9 +226,11 @@ void Account::noteWork(Node& node, const Dictionary& before) {
 
 void Account::runSync(Node& node, const std::function<void()>& work) {
   tick(node);
+  const auto before = node.machine.entries();
   const platform::PlatformScope scope(*node.sync->platform);
   work();
   noteKept(node);
+  noteMerge(node, *before);
 }
 
 // What has been acknowledged is there, or what outranks it; and what is there now has been acknowledged,
@@ -236,6 +242,7 @@ void Account::noteKept(Node& node) {
     const auto was = CloudEntry::fromValue(value), is = CloudEntry::find(*entries, key);
     check(is && !was->outranks(*is), node.name + " has lost a write of " + key);
   }
+  witness.checkPair(node.name, *node.kept, *entries);
   const auto& files = node.machine.files;
   if (files.calls < files.failFrom) node.kept = entries;
 }
@@ -247,15 +254,27 @@ void Account::workTakesTime(Node& node) {
   isPaused = true;
   network.now += Time(draw(0, 0.004));
   if (draw(0.05)) {
-    const Time end = network.now + Time(draw(0, 0.3));
-    while (network.nextDue() && *network.nextDue() <= end) {
-      network.now = std::max(network.now, *network.nextDue());
-      deliverMessage();
-    }
-    network.now = end;
+    const auto before = node.before;
+    noteWork(node);
+    node.hasBegun |= platform::valueOf(*before, flagKey) != platform::valueOf(*node.before, flagKey);
+    othersWork();
   }
   tick(node);
   isPaused = false;
+}
+
+// They see what has been written of a switch so far.
+void Account::othersWork() {
+  const platform::PlatformScope scope(outside);
+  const Time end = network.now + Time(draw(0, 0.3));
+  while (network.now < end) {
+    if (step()) continue;
+    const auto due = nextDue();
+    if (!due || *due > end) break;
+    network.now = std::max(network.now, *due);
+    fireDue();
+  }
+  network.now = std::max(network.now, end);
 }
 
 void Account::deliverMessage() {

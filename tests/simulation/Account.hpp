@@ -30,7 +30,10 @@ class Account {
     std::set<bool> calls;
     std::optional<double> question;
     std::optional<bool> lastCall;
-    bool hasMerged = false;                  // within the daemon's item of work
+    // Of the daemon's item of work: the entries that it began with, or that have been told of; whether a flag
+    // of its own is among them, and whether others' have arrived.
+    std::shared_ptr<const Dictionary> before;
+    bool hasBegun = false, hasMerged = false;
     bool wasOn = false, hasStopped = false;  // in this life
     // The replica's entries that have been acknowledged; and those that a crash left without a word.
     std::shared_ptr<const Dictionary> kept, unsure;
@@ -53,11 +56,12 @@ class Account {
   bool step();
   void runDaemon(Node& node, const std::function<void()>& work);
   void runSync(Node& node, const std::function<void()>& work);
-  void noteWork(Node& node, const Dictionary& before);
+  void noteWork(Node& node);
   void noteKept(Node& node);
   void noteMerge(Node& node, const Dictionary& before);
   void becomeIdle(Node& node);
   void workTakesTime(Node& node);
+  void othersWork();
   void deliverMessage();
 
   void settle();

@@ -61,11 +61,14 @@ Witness::Author Witness::ended(const Work& work, const CloudEntry& flag) {
 // A flag that is there without an end time is given one; what is left of an ended period is cleared.
 void Witness::wroteEnd(const Work& work, const CloudEntry& end) {
   const bool isCompletion = !(endIn(work.before) > 0) || !flagIn(work.after);
-  check(isCompletion || work.hasMerged, work.device + " writes an end time unasked");
+  check(isCompletion || work.hasMerged || work.hasBegun, work.device + " writes an end time unasked");
   Author author = authorOf(work.after, flagKey);
   author.isTorn = author.isTorn || work.isCut;
   author.isBetween = author.isBetween || work.hasMerged;
   authors[name(endKey, end)] = author;
+  const auto flag = CloudEntry::find(work.after, flagKey);
+  check(!work.hasBegun || flag->device != work.device || end.stamp == flag->stamp,
+        work.device + " stamps a pair apart");
 }
 
 // A stale period's end must not end what somebody switched on since.
@@ -83,6 +86,17 @@ Witness::Author Witness::authorOf(const Dictionary& entries, const std::string& 
   const auto found = authors.find(name(key, *entry));
   check(found != authors.end(), "nobody wrote " + key);
   return found->second;
+}
+
+void Witness::checkPair(const std::string& device, const Dictionary& before, const Dictionary& after) const {
+  const auto flag = CloudEntry::find(before, flagKey), end = CloudEntry::find(before, endKey);
+  const auto isKept = [&](const std::string& key) {
+    return platform::valueOf(before, key) == platform::valueOf(after, key);
+  };
+  if (!flagIn(before) || !end || !isKept(flagKey) || isKept(endKey)) return;
+  const bool isPair = end->stamp == flag->stamp && end->device == flag->device;
+  check(!isPair || authorOf(before, flagKey).isBetween || authorOf(after, endKey).isBetween,
+        device + " parts a switch and its end time: " + platform::describe(after));
 }
 
 void Witness::checkShared(const Dictionary& entries) {

@@ -25,6 +25,7 @@ struct Work {
   Dictionary before, after;  // the replica's entries
   double now = 0;            // by the device's clock, at the item's end
   bool isCut = false;        // the process died within it
+  bool hasBegun = false;     // it has written its flag, and been told of before
   bool hasMerged = false;    // another device's switch arrived within it
   std::set<bool> calls;      // what clients switched to
   // The end times that an alarm or a client's question found passed; kept until the switch that follows.
@@ -36,6 +37,8 @@ class Witness {
   explicit Witness(Counts& counts_) : counts(counts_) {}
 
   void wrote(const Work& work);
+  // As long as its flag stands, a switch keeps the end time that was written with it.
+  void checkPair(const std::string& device, const Dictionary& before, const Dictionary& after) const;
   // Flag and end time of the shared replica, at rest: of one switch, and no stale end of a newer one.
   void checkShared(const Dictionary& entries);
 
