@@ -90,6 +90,7 @@ void Member::use(const Membership& membership, std::function<void(const std::str
     if (failure.empty()) failure = nameInFile(membership);
     // The former one ends at once, or it could still take the replica back to its account.
     if (failure.empty()) current = std::move(next);
+    if (!failure.empty()) nameFormerInFile(membership);
     // Not here: this is the new synchroniser's own call.
     loop.async([this, done, failure] {
       if (!failure.empty()) next.reset();
@@ -111,6 +112,15 @@ std::string Member::nameInFile(const Membership& membership) {
   if (there && *there == membership) return "";
   const auto written = writeCloudFile(files, paths.cloud(), membership);
   return written ? "" : paths.cloud() + ": " + written.error().message();
+}
+
+// `refused` may be named already, where the replica could not follow: the next start would go there.
+void Member::nameFormerInFile(const Membership& refused) {
+  std::string ignored;
+  const auto there = readCloudFile(files, paths.cloud(), ignored);
+  if (!current || !there || *there != refused) return;
+  if (const auto restored = nameInFile(current->membership); !restored.empty())
+    platform::hearthLog("cloud").error("%s; the next start goes to account %s", restored, refused.account);
 }
 
 Result<void> Member::forget(const std::string& device) {

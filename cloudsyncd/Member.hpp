@@ -43,6 +43,7 @@ class Member {
                                       std::function<void(const std::string&)> settled,
                                       std::function<platform::Result<void>()> changing, std::string& problem);
   std::string nameInFile(const Membership& membership);
+  void nameFormerInFile(const Membership& refused);
   void rearm();
   void timePassed();
 

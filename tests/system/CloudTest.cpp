@@ -140,11 +140,14 @@ TEST_F(CloudTest, AnotherAccountIsTakenWholeOrNotAtAll) {
   EXPECT_THAT(away.errors, HasSubstr("/nowhere: No such file or directory"));
   for (const char* wrong : {"ftp:x --account work", "dir:relative --account work", "dir:/tmp --account .."})
     EXPECT_NE(cloud("one", std::string("use ") + wrong).status, 0) << wrong;
-  const fs::path inTheWay = root / "one/etc/cloud.json.new";
-  fs::create_directory(inTheWay);
-  EXPECT_EQ(cloud("one", "use " + url + " --account work").status, 1) << "the file cannot be written";
-  fs::remove(inTheWay);
-  EXPECT_EQ(contents(root / "one/etc/cloud.json"), before);
+  const fs::path replica = root / "one/var/settings/cloud/com.kestrel.bluetooth.cloud.settings.json";
+  for (const fs::path& file : {root / "one/etc/cloud.json", fs::path(replica.string() + ".account-home")}) {
+    const fs::path inTheWay = file.string() + ".new";
+    fs::create_directory(inTheWay);
+    EXPECT_EQ(cloud("one", "use " + url + " --account work").status, 1) << file << " cannot be written";
+    fs::remove(inTheWay);
+    EXPECT_EQ(contents(root / "one/etc/cloud.json"), before) << file;
+  }
   EXPECT_THAT(cloud("one", "status").output, HasSubstr(url + ", account home\n"));
   EXPECT_EQ(setting("one", "ours"), "1\n");
 
@@ -155,9 +158,7 @@ TEST_F(CloudTest, AnotherAccountIsTakenWholeOrNotAtAll) {
                "one",
                "Cloud KVS Notification: [\"ChangeReason\": 3, \"ChangedKeys\": [\"ours\", \"theirs\"]]") == 1;
   })) << log("one");
-  EXPECT_THAT(
-      contents(root / "one/var/settings/cloud/com.kestrel.bluetooth.cloud.settings.json.account-home"),
-      HasSubstr("\"ours\""));
+  EXPECT_THAT(contents(replica.string() + ".account-home"), HasSubstr("\"ours\""));
   // The same account elsewhere.
   const std::string moved = "dir:" + (root / "moved").string();
   fs::create_directory(root / "moved");
