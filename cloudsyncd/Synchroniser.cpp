@@ -19,6 +19,8 @@ using platform::Result;
 using platform::linux_::mergeCloudEntries;
 using platform::linux_::settingsValues;
 
+constexpr std::size_t refusalsKept = 1024;
+
 const platform::Logger& log() {
   static const platform::Logger logger = platform::hearthLog("cloud");
   return logger;
@@ -77,9 +79,11 @@ void Synchroniser::unreadable(const std::string& device, const std::string& why)
 }
 
 void Synchroniser::refuse(const std::string& device, const std::string& why) {
-  if (std::exchange(devices[device].problem, why) != why) {
+  devices[device].problem = why;
+  // A document that comes and goes, or is good in between, would fill the log.
+  if (refusals.size() >= refusalsKept) refusals.clear();
+  if (refusals.emplace(device, why).second)
     log().error("the document of device %s is refused: %s", device, why);
-  }
 }
 
 void Synchroniser::removed(const std::string& device) {

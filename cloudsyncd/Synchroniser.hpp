@@ -6,6 +6,7 @@
 #include <optional>
 #include <set>
 #include <string>
+#include <utility>
 #include <vector>
 
 #include "cloudsyncd/Transport.hpp"
@@ -92,7 +93,8 @@ class Synchroniser : public TransportClient {
 
   const Surroundings around;
   std::map<std::string, Device> devices;
-  std::set<std::string> seen;  // since the connection began
+  std::set<std::string> seen;                              // since the connection began
+  std::set<std::pair<std::string, std::string>> refusals;  // told: device and cause
   bool isConnected = false;
   std::string problem;
   std::optional<platform::Time> disconnectedSince, lastOut, lastIn;

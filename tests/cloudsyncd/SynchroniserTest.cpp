@@ -144,7 +144,6 @@ TEST_F(SynchroniserTest, RefusesBadDocumentsWithOneLineEach) {
       {with("\"home\"", "\"work\""), "it is of another account"},
       {document("other", {}), "it is of another device"},
       {std::string(documentBytes + 1, ' '), "larger than 1048576 bytes"},
-      {std::string(100'000, '['), "does not parse"},
   };
   for (const auto& [text, cause] : cases) {
     synchroniser.received("peer", text);
@@ -153,8 +152,13 @@ TEST_F(SynchroniserTest, RefusesBadDocumentsWithOneLineEach) {
     ASSERT_EQ(lines.size(), 1u) << cause;
     EXPECT_THAT(lines[0], testing::AllOf(testing::HasSubstr("device peer"), testing::HasSubstr(cause)));
   }
-  synchroniser.received("peer", good.substr(0, good.size() / 2));
-  EXPECT_THAT(logged(), IsEmpty()) << "however far it has been copied";
+  for (const std::string& text : {std::string(100'000, '['), good.substr(0, good.size() / 3)}) {
+    synchroniser.received("peer", document("peer", {}));
+    synchroniser.removed("peer");
+    synchroniser.received("peer", text);
+    EXPECT_THAT(logged(), IsEmpty()) << "however far it has been copied, and however often it comes back";
+    EXPECT_THAT(synchroniser.status().devices.at("peer").problem, testing::HasSubstr("does not parse"));
+  }
   EXPECT_EQ(values(), "[:]");
   synchroniser.received("peer", with("\"time\": 5", "\"time\": \"5\""));
   EXPECT_EQ(values(), "[:]");
