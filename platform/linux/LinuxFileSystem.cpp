@@ -155,8 +155,9 @@ class Watched {
       report("");
     } else if (event.wd == current) {
       if (event.mask & IN_MOVE_SELF) {
+        // It may have moved to its name, in place of a link to it: it was watched before its parent told.
         ::inotify_rm_watch(inotify.get(), current);
-        current = -1;
+        watchFolder();
       }
       const bool all = (event.mask & (IN_MOVE_SELF | IN_DELETE_SELF | IN_UNMOUNT)) != 0;
       if (all || !name.empty()) report(all ? "" : name);

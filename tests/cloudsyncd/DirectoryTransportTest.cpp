@@ -267,8 +267,10 @@ TEST(TransportsTest, WrongAddressesAreToldApart) {
 TEST(SharedFolderTest, TwoTransportsSeeEachOtherAndWhatBecomesOfTheFolder) {
   namespace fs = std::filesystem;
   const fakes::TemporaryFolder root;
-  const fs::path share = root.path + "/share", home = share / "home";
-  fs::create_directories(home / "folder.json");
+  const fs::path share = root.path + "/share", home = share / "home", linked = root.path + "/linked";
+  fs::create_directories(linked / "folder.json");
+  fs::create_directory(share);
+  fs::create_symlink(linked, home);
   std::ofstream(root.path + "/secret") << "secret";
   fs::create_symlink(root.path + "/secret", home / "link.json");
   ASSERT_EQ(::mkfifo((home / "pipe.json").c_str(), 0600), 0);
@@ -308,7 +310,8 @@ TEST(SharedFolderTest, TwoTransportsSeeEachOtherAndWhatBecomesOfTheFolder) {
       {[&] { return testing::Value(a.told, planted) && testing::Value(b.told, planted); },
        [&] { transports[0]->publish("a", "1"); }},
       {[&] { return heard(b, "a = 1"); }, [&] { transports[1]->publish("b", "2"); }},
-      {[&] { return heard(a, "b = 2"); }, [&] { fs::rename(home / "b.json", share / "b.json"); }},
+      {[&] { return heard(a, "b = 2"); }, [&] { fs::remove(home), fs::rename(linked, home); }},
+      {[&] { return bothHeard("b = 2"); }, [&] { fs::rename(home / "b.json", share / "b.json"); }},
       {[&] { return bothHeard("b removed"); }, [&] { fs::remove_all(home); }},
       {[&] { return bothHeard(gone); }, reconnect},
       {[&] { return bothHeard("connected"); }, [&] { transports[1]->publish("b", "3"); }},
