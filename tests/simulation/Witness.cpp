@@ -41,6 +41,7 @@ Witness::Author Witness::ended(const Work& work, const CloudEntry& flag) {
              formerEnd = CloudEntry::find(work.before, endKey);
   const bool isEndNewer = former && formerEnd && formerEnd->outranks(*former);
   Author author = authorOf(work.before, isEndNewer ? endKey : flagKey);
+  author.ended.reset();
   if (work.hasMerged) {
     counts.endsByMerge += flag.stamp.tick == 0;  // otherwise what arrived has ended, too
   } else if (end > 0 && end <= work.now + 1) {
