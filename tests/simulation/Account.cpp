@@ -202,6 +202,7 @@ void Account::becomeIdle(Node& node) {
 void Account::runDaemon(Node& node, const std::function<void()>& work) {
   tick(node);
   node.before = node.machine.entries();
+  node.from = node.daemon->manualClock.time.count();
   node.hasBegun = node.hasMerged = false;
   Node* const former = std::exchange(running, &node);
   work();
@@ -217,7 +218,7 @@ void Account::noteWork(Node& node) {
   if (node.before == before) return;
   const auto& files = node.machine.files;
   const auto alarm = node.daemon->eventStreams().delivered;
-  witness.wrote({node.name, *before, *node.before, node.daemon->manualClock.time.count(),
+  witness.wrote({node.name, *before, *node.before, node.from, node.daemon->manualClock.time.count(),
                  files.calls >= files.failFrom, node.hasBegun, node.hasMerged, node.calls,
                  alarm ? std::optional(static_cast<double>(alarm->nanoseconds) / 1e9) : std::nullopt,
                  node.question});

@@ -33,6 +33,7 @@ class Account {
     // Of the daemon's item of work: the entries that it began with, or that have been told of; whether a flag
     // of its own is among them, and whether others' have arrived.
     std::shared_ptr<const Dictionary> before;
+    double from = 0;  // by its clock
     bool hasBegun = false, hasMerged = false;
     bool wasOn = false, hasStopped = false;  // in this life
     // The replica's entries that have been acknowledged; and those that a crash left without a word.

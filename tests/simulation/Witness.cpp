@@ -44,7 +44,7 @@ Witness::Author Witness::ended(const Work& work, const CloudEntry& flag) {
   author.ended.reset();
   if (work.hasMerged) {
     counts.endsByMerge += flag.stamp.tick == 0;  // otherwise what arrived has ended, too
-  } else if (end > 0 && end <= work.now + 1) {
+  } else if (flag.stamp.tick > 0 || (end > 0 && end <= work.from + 1)) {
     author.ended = isEndNewer ? formerEnd : former;
     checkRank(flag, author);
   } else if (work.alarm) {
@@ -53,7 +53,7 @@ Witness::Author Witness::ended(const Work& work, const CloudEntry& flag) {
     ++counts.endsByMerge;
     author.isBetween = true;
   } else {
-    check(work.question.has_value(),
+    check(work.question.has_value() || (end > 0 && end <= work.now + 1),
           work.device + " is switched off by nobody, its end in " + std::to_string(end - work.now) + " s");
   }
   return author;

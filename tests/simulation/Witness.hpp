@@ -23,7 +23,7 @@ inline void check(bool holds, const std::string& text) {
 struct Work {
   std::string device;
   Dictionary before, after;  // the replica's entries
-  double now = 0;            // by the device's clock, at the item's end
+  double from = 0, now = 0;  // by the device's clock, at the item's begin and end
   bool isCut = false;        // the process died within it
   bool hasBegun = false;     // it has written its flag, and been told of before
   bool hasMerged = false;    // another device's switch arrived within it
