@@ -168,14 +168,14 @@ void DirectoryTransport::publish(const std::string& device, std::string document
   later([error = written ? std::error_code() : written.error()](DirectoryTransport& self) {
     if (!self.isConnected) return;
     if (isAway(error)) return self.disconnect(error);
-    self.client->published(error);
+    self.client->published(error, error.message());
   });
 }
 
-Result<void> DirectoryTransport::forget(const std::string& device) {
-  const auto removed = files.remove(pathOf(device));
-  if (!removed && !isMissing(removed.error())) return removed;
-  return files.syncFolder(folder);
+void DirectoryTransport::forget(const std::string& device, std::function<void(const std::string&)> done) {
+  auto removed = files.remove(pathOf(device));
+  if (removed || isMissing(removed.error())) removed = files.syncFolder(folder);
+  done(removed ? "" : removed.error().message());
 }
 
 std::optional<Steady> DirectoryTransport::deadline() const {

@@ -33,7 +33,7 @@ class DirectoryTransport : public Transport, public std::enable_shared_from_this
 
   void start(TransportClient& client) override;
   void publish(const std::string& device, std::string document) override;
-  platform::Result<void> forget(const std::string& device) override;
+  void forget(const std::string& device, std::function<void(const std::string& problem)> done) override;
   std::optional<Steady> deadline() const override;
   void timePassed(Steady now) override;
 

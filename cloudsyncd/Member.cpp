@@ -123,11 +123,11 @@ void Member::nameFormerInFile(const Membership& refused) {
     platform::hearthLog("cloud").error("%s; the next start goes to account %s", restored, refused.account);
 }
 
-Result<void> Member::forget(const std::string& device) {
+void Member::forget(const std::string& device, std::function<void(const std::string&)> done) {
   // It becomes part of a path.
-  if (!isName(device)) return std::make_error_code(std::errc::invalid_argument);
-  if (!current) return platform::Outcome::notConnected;
-  return current->transport->forget(device);
+  if (!isName(device)) return done("\"" + device + "\" is no device's name");
+  if (!current) return done(problem);
+  current->transport->forget(device, std::move(done));
 }
 
 void Member::rearm() {

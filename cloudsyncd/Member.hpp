@@ -30,7 +30,7 @@ class Member {
   platform::Dictionary status() const;
   // `done` gets why it can't be; empty: the device is in that account now.
   void use(const Membership& membership, std::function<void(const std::string& problem)> done);
-  platform::Result<void> forget(const std::string& device);
+  void forget(const std::string& device, std::function<void(const std::string& problem)> done);
 
  private:
   // One account at one engine, and what keeps the replica in step with it.

@@ -33,18 +33,24 @@ class Client : public platform::linux_::BusHandler {
       case CloudOperation::status:
         return completion(describe());
       case CloudOperation::use:
-        return member.use({text(0), text(1)}, [completion](const std::string& problem) {
-          completion(problem.empty() ? BusReply(List()) : BusReply(failed(problem)));
-        });
-      case CloudOperation::forget: {
-        const auto forgotten = member.forget(text(0));
-        return completion(forgotten ? BusReply(List()) : BusReply(failed(forgotten.error().message())));
-      }
+        return use(text(0), answering(completion));
+      case CloudOperation::forget:
+        return member.forget(text(0), answering(completion));
     }
   }
   void closed() override {}
 
  private:
+  static std::function<void(const std::string&)> answering(BusCompletion completion) {
+    return [completion = std::move(completion)](const std::string& problem) {
+      completion(problem.empty() ? BusReply(List()) : BusReply(failed(problem)));
+    };
+  }
+  void use(const std::string& text, const std::function<void(const std::string&)>& done) {
+    std::string problem;
+    const auto membership = parseMembership(text, problem);
+    membership ? member.use(*membership, done) : done(problem);
+  }
   BusReply describe() const {
     const auto text = platform::linux_::printJson(member.status(), platform::linux_::JsonStyle::line);
     return text ? BusReply(List{*text}) : BusReply(failed(text.error().message()));

@@ -20,6 +20,7 @@ using platform::linux_::mergeCloudEntries;
 using platform::linux_::settingsValues;
 
 constexpr std::size_t refusalsKept = 1024;
+const std::string cannotPublish = "nothing can be published: ";
 
 const platform::Logger& log() {
   static const platform::Logger logger = platform::hearthLog("cloud");
@@ -116,7 +117,7 @@ void Synchroniser::takeIn(const Dictionary& entries) {
     return changed = answer && *answer;
   });
   if (refused) written = refused;
-  if (!written) return fail(taking, "the replica cannot be written", written.error());
+  if (!written) return fail(taking, "the replica cannot be written: " + written.error().message());
   taking.succeeded();
   if (changed) lastIn = around.wall.now();
   settle("");
@@ -199,7 +200,7 @@ void Synchroniser::publish() {
   const auto text = encode();
   if (!text) {
     if (text.error() == Outcome::tooLarge) return exceedsQuota();
-    return fail(sending, "nothing can be published", text.error());
+    return fail(sending, cannotPublish + text.error().message());
   }
   pacing.sent();
   isPublishing = true;
@@ -219,13 +220,13 @@ Result<std::string> Synchroniser::encode() {
   return written ? text : Result<std::string>(written.error());
 }
 
-void Synchroniser::published(const std::error_code& error) {
+void Synchroniser::published(const std::error_code& error, const std::string& problem_) {
   isPublishing = false;
   deadlineMoved();
   if (error == std::errc::message_size) return exceedsQuota();
   if (error) {
     pacing.written(around.steady());
-    return fail(sending, "nothing can be published", error);
+    return fail(sending, cannotPublish + problem_);
   }
   lastOut = around.wall.now();
   isOverQuota = false;
@@ -245,14 +246,13 @@ void Synchroniser::exceedsQuota() {
   if (!told) log().error("%s: %s", around.path, told.error().message());
 }
 
-void Synchroniser::fail(Retry& retry, const std::string& what, const std::error_code& error) {
-  const std::string text = what + ": " + error.message();
+void Synchroniser::fail(Retry& retry, const std::string& text) {
   if (retry.failed(around.steady(), text)) log().error("%s", text);
   settle(text);
   deadlineMoved();
 }
 
-void Synchroniser::deadlineMoved() const {
+void Synchroniser::deadlineMoved() {
   if (around.deadlineMoved) around.deadlineMoved();
 }
 

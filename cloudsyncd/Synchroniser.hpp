@@ -71,7 +71,8 @@ class Synchroniser : public TransportClient {
   void received(const std::string& device, std::string_view document) override;
   void unreadable(const std::string& device, const std::string& problem) override;
   void removed(const std::string& device) override;
-  void published(const std::error_code& error) override;
+  void published(const std::error_code& error, const std::string& problem) override;
+  void deadlineMoved() override;
 
  private:
   platform::Dictionary allDocuments() const;
@@ -86,9 +87,8 @@ class Synchroniser : public TransportClient {
   platform::Result<std::string> encode();
   void exceedsQuota();
   std::optional<Steady> sendingDue() const;
-  void fail(Retry& retry, const std::string& what, const std::error_code& error);
+  void fail(Retry& retry, const std::string& text);
   void refuse(const std::string& device, const std::string& problem);
-  void deadlineMoved() const;
   void settle(const std::string& problem);
 
   const Surroundings around;

@@ -2,12 +2,11 @@
 #pragma once
 
 #include <chrono>
+#include <functional>
 #include <optional>
 #include <string>
 #include <string_view>
 #include <system_error>
-
-#include "platform/Result.hpp"
 
 namespace cloudsync {
 
@@ -27,8 +26,11 @@ class TransportClient {
   virtual void unreadable(const std::string& device, const std::string& problem) = 0;
   // The document of `device` is there no more.
   virtual void removed(const std::string& device) = 0;
-  // How publishing ended; std::errc::message_size where the engine refuses the document as too big.
-  virtual void published(const std::error_code& error) = 0;
+  // How publishing ended; std::errc::message_size where the engine refuses the document as too big. `problem`
+  // is the error for people, who know more of it where the engine said more.
+  virtual void published(const std::error_code& error, const std::string& problem) = 0;
+  // deadline() may be another than before.
+  virtual void deadlineMoved() = 0;
 };
 
 // One account at one engine. One thread, the loop's. Everything is tried again by itself: what is not there
@@ -40,8 +42,9 @@ class Transport {
   virtual void start(TransportClient& client) = 0;
   // Replaces this device's document, durably; answered by one published(). One at a time, while connected.
   virtual void publish(const std::string& device, std::string document) = 0;
-  // Takes away the document of a device that is lost. Gone already is done.
-  virtual platform::Result<void> forget(const std::string& device) = 0;
+  // Takes away the document of a device that is lost; gone already is done. `done` gets why it can't be,
+  // empty: it is done; from within the call, or later on the loop's thread.
+  virtual void forget(const std::string& device, std::function<void(const std::string& problem)> done) = 0;
   // When timePassed() is due.
   virtual std::optional<Steady> deadline() const = 0;
   virtual void timePassed(Steady now) = 0;

@@ -1,10 +1,15 @@
 #include "cloudsyncd/Transports.hpp"
 
+#include <algorithm>
+#include <cctype>
 #include <charconv>
 #include <cmath>
+#include <optional>
 #include <utility>
+#include <variant>
 
 #include "cloudsyncd/DirectoryTransport.hpp"
+#include "cloudsyncd/NatsTransport.hpp"
 #include "cloudsyncd/core/Document.hpp"
 
 namespace cloudsync {
@@ -13,8 +18,11 @@ namespace {
 using platform::Outcome;
 using platform::Result;
 
-constexpr std::string_view scheme = "dir:";
+constexpr std::string_view directoryScheme = "dir:";
+constexpr std::string_view natsScheme = "nats://";
 constexpr std::string_view pollQuery = "poll=";
+
+using Place = std::variant<DirectoryTransport::Place, NatsTransport::Place>;
 
 std::optional<std::chrono::milliseconds> pollOf(std::string_view query) {
   if (!query.starts_with(pollQuery)) return std::nullopt;
@@ -26,16 +34,9 @@ std::optional<std::chrono::milliseconds> pollOf(std::string_view query) {
   return std::chrono::milliseconds(std::llround(seconds * 1000));
 }
 
-Result<DirectoryTransport::Place> placeOf(const Membership& membership, std::string& problem) {
-  std::string_view rest = membership.url;
-  problem.clear();
-  if (!isName(membership.account))
-    problem = "an account's name has 1 to 64 letters, digits, '-', '_' and '.', the last not first";
-  if (!rest.starts_with(scheme)) {
-    problem = "unknown engine; there is dir:PATH";
-    return Outcome::malformedFile;
-  }
-  rest.remove_prefix(scheme.size());
+// The functions below leave `problem` empty where there is none.
+DirectoryTransport::Place directoryOf(const Membership& membership, std::string_view rest,
+                                      std::string& problem) {
   DirectoryTransport::Place place{"", membership.account, std::nullopt};
   if (const auto query = rest.find('?'); query != std::string_view::npos) {
     place.poll = pollOf(rest.substr(query + 1));
@@ -45,17 +46,78 @@ Result<DirectoryTransport::Place> placeOf(const Membership& membership, std::str
   while (rest.size() > 1 && rest.ends_with('/')) rest.remove_suffix(1);
   if (!rest.starts_with('/')) problem = "dir: needs an absolute path";
   place.folder = rest;
-  return problem.empty() ? Result<DirectoryTransport::Place>(place) : Outcome::malformedFile;
+  return place;
+}
+
+bool isHost(std::string_view host) {
+  return !host.empty() && std::all_of(host.begin(), host.end(), [](unsigned char letter) {
+    return std::isalnum(letter) || letter == '.' || letter == '-' || letter == ':' || letter == '[' ||
+           letter == ']';
+  });
+}
+
+bool isThisMachine(const std::string& server) {
+  const std::string host = server.substr(0, server.rfind(':'));
+  return host == "localhost" || host.starts_with("127.") || host.starts_with("[::1]");
+}
+
+NatsTransport::Place natsOf(const Membership& membership, std::string_view rest, std::string& problem) {
+  NatsTransport::Place place{{}, {}, membership.account};
+  NatsAccess& access = place.access;
+  access.password = membership.password;
+  access.credentials = membership.credentials;
+  access.authorities = membership.authorities;
+  access.certificate = membership.certificate;
+  access.key = membership.key;
+  if (const auto at = rest.find('@'); at != std::string_view::npos) {
+    access.user = rest.substr(0, at);
+    rest.remove_prefix(at + 1);
+    if (access.user.find(':') != std::string::npos)
+      problem = "a password does not belong into the URL, but into \"password\"";
+  }
+  while (!rest.empty() || place.servers.empty()) {
+    const std::string_view server = rest.substr(0, rest.find(','));
+    rest.remove_prefix(std::min(rest.size(), server.size() + 1));
+    if (!isHost(server)) problem = "not nats://[USER@]HOST[:PORT][,HOST[:PORT]...]";
+    place.servers.emplace_back(server);
+  }
+  access.isEncrypted =
+      membership.tls.value_or(!std::all_of(place.servers.begin(), place.servers.end(), isThisMachine) ||
+                              !access.authorities.empty() || !access.certificate.empty());
+  if (access.certificate.empty() != access.key.empty())
+    problem = "\"certificate\" and \"key\" belong together";
+  for (const std::string* file :
+       {&access.credentials, &access.authorities, &access.certificate, &access.key}) {
+    if (!file->empty() && !file->starts_with('/')) problem = *file + " is no absolute path";
+  }
+  return place;
+}
+
+Result<Place> placeOf(const Membership& membership, std::string& problem) {
+  const std::string_view url = membership.url;
+  problem.clear();
+  std::optional<Place> place;
+  if (url.starts_with(directoryScheme))
+    place = directoryOf(membership, url.substr(directoryScheme.size()), problem);
+  else if (url.starts_with(natsScheme))
+    place = natsOf(membership, url.substr(natsScheme.size()), problem);
+  else
+    problem = "unknown engine; there are dir:PATH and nats://HOST";
+  if (!isName(membership.account))
+    problem = "an account's name has 1 to 64 letters, digits, '-', '_' and '.', the last not first";
+  return problem.empty() ? Result<Place>(std::move(*place)) : Outcome::malformedFile;
 }
 
 }  // namespace
 
-Result<std::shared_ptr<Transport>> makeTransport(const Membership& membership,
-                                                 const Surroundings& surroundings, std::string& problem) {
+Result<std::shared_ptr<Transport>> makeTransport(const Membership& membership, const Surroundings& around,
+                                                 std::string& problem) {
   const auto place = placeOf(membership, problem);
   if (!place) return place.error();
-  return std::shared_ptr<Transport>(
-      DirectoryTransport::create(surroundings.files, surroundings.queue, surroundings.steady, *place));
+  if (const auto* nats = std::get_if<NatsTransport::Place>(&*place))
+    return std::shared_ptr<Transport>(NatsTransport::create(around.queue, around.steady, *nats));
+  return std::shared_ptr<Transport>(DirectoryTransport::create(around.files, around.queue, around.steady,
+                                                               std::get<DirectoryTransport::Place>(*place)));
 }
 
 std::string problemOf(const Membership& membership) {

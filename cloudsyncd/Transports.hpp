@@ -20,6 +20,8 @@ struct Surroundings {
 };
 
 // `dir:PATH`, or `dir:PATH?poll=SECONDS` for a folder whose file system gives no events.
+// `nats://[USER@]HOST[:PORT][,HOST[:PORT]…]`, the servers of one cluster; encrypted, unless all are this very
+// machine or the membership says otherwise.
 // Outcome::malformedFile for any other URL, and for an account that is no name; `problem` says what is wrong,
 // for people. Nothing is opened before the transport is started.
 platform::Result<std::shared_ptr<Transport>> makeTransport(const Membership& membership,

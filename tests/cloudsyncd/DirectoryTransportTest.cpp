@@ -32,9 +32,10 @@ struct Client : TransportClient {
     tell(device + ": " + problem);
   }
   void removed(const std::string& device) override { tell(device + " removed"); }
-  void published(const std::error_code& error) override {
-    tell(error ? "published: " + error.message() : "published");
+  void published(const std::error_code& error, const std::string& problem) override {
+    tell(error ? "published: " + problem : "published");
   }
+  void deadlineMoved() override {}
   void tell(const std::string& text) {
     EXPECT_FALSE(isInCall) << text;
     told.push_back(text);
@@ -62,6 +63,11 @@ struct DirectoryTransportTest : platform::linux_::World {
     deliver();
   }
   // What is told in reply to it.
+  std::string forget() {
+    std::string told = "?";
+    transport->forget("me", [&](const std::string& problem) { told = problem; });
+    return told;
+  }
   std::vector<std::string> publish(const std::string& document) {
     call([&] { transport->publish("me", document); });
     return client.takeTold();
@@ -120,11 +126,11 @@ TEST_F(DirectoryTransportTest, PublishedIsDurableAndForgottenIsGone) {
   EXPECT_EQ(files.bytes("/share/home/me.json"), "1") << "with its folder";
   start();
   client.takeTold();
-  EXPECT_TRUE(transport->forget("me"));
+  EXPECT_EQ(forget(), "");
   EXPECT_THAT(delivered(), ElementsAre("me removed"));
   files.powerCut();
   EXPECT_FALSE(files.exists("/share/home/me.json"));
-  EXPECT_TRUE(transport->forget("me")) << "gone already";
+  EXPECT_EQ(forget(), "") << "gone already";
 }
 
 TEST_F(DirectoryTransportTest, FolderThatIsNotThereIsNeverMadeAndTriedLessAndLessOften) {
@@ -133,7 +139,7 @@ TEST_F(DirectoryTransportTest, FolderThatIsNotThereIsNeverMadeAndTriedLessAndLes
   EXPECT_THAT(client.takeTold(), ElementsAre(away));
   for (const int delay : {1, 2, 4, 8, 16, 32}) EXPECT_THAT(after(seconds(delay)), ElementsAre(away));
   EXPECT_FALSE(files.exists("/share"));
-  EXPECT_FALSE(transport->forget("me")) << "it would be back with the folder";
+  EXPECT_NE(forget(), "") << "it would be back with the folder";
   files.put("/share/home/b.json", "1");
   EXPECT_THAT(after(Retry::longest), ElementsAre("b = 1", "connected"));
   files.removeFolder("/share");
@@ -248,9 +254,11 @@ TEST_F(DirectoryTransportTest, FoldersFullOfStrangersFilesAreReadInPart) {
 
 TEST(TransportsTest, WrongAddressesAreToldApart) {
   const std::pair<std::string, std::vector<std::string>> rows[] = {
-      {"", {"dir:/a", "dir:/a//?poll=0.5", "dir:/"}},
+      {"", {"dir:/a", "dir:/a//?poll=0.5", "dir:/", "nats://a", "nats://user@a:4222,b.example,[::1]:4222"}},
       {"dir: needs an absolute path", {"dir:a", "dir:", "dir:?poll=5"}},
-      {"unknown engine; there is dir:PATH", {"nats://a", ""}},
+      {"unknown engine; there are dir:PATH and nats://HOST", {"http://a", ""}},
+      {"not nats://[", {"nats://", "nats://user@", "nats://a,,b", "nats://a/b"}},
+      {"a password does not belong into the URL", {"nats://user:word@a"}},
       {"after '?' only poll=SECONDS may stand",
        {"dir:/a?", "dir:/a?pol=1", "dir:/a?poll=0", "dir:/a?poll=-1", "dir:/a?poll=nan", "dir:/a?poll=1s"}}};
   for (const auto& [problem, urls] : rows) {

@@ -21,7 +21,7 @@ struct FakeTransport : Transport {
   void publish(const std::string& device, std::string document) override {
     sent.emplace_back(device, std::move(document));
   }
-  platform::Result<void> forget(const std::string&) override { return {}; }
+  void forget(const std::string&, std::function<void(const std::string&)>) override {}
   std::optional<Steady> deadline() const override { return std::nullopt; }
   void timePassed(Steady) override {}
 
@@ -62,7 +62,7 @@ struct SynchroniserTest : platform::linux_::World {
     std::string problem;
     const auto sent = decodeDocument(text, "home", name, problem);
     EXPECT_TRUE(sent) << problem;
-    synchroniser.published({});
+    synchroniser.published({}, {});
     return *sent;
   }
   Dictionary whole() { return *replica->contents(); }

@@ -89,14 +89,14 @@ class Network::Link : public cloudsync::Transport {
   void publish(const std::string& device, std::string document) override {
     ++network.sent;
     network.later([&network = network, &isCut = isCut, device, document,
-                   answer = answering([this] { client->published({}); })] {
+                   answer = answering([this] { client->published({}, {}); })] {
       if (isCut) return;
       network.documents[device] = document;
       for (Link* link : network.links) link->tell(device);
       answer();
     });
   }
-  platform::Result<void> forget(const std::string&) override { return {}; }
+  void forget(const std::string&, std::function<void(const std::string&)>) override {}
   std::optional<cloudsync::Steady> deadline() const override { return std::nullopt; }
   void timePassed(cloudsync::Steady) override {}
 

@@ -1,87 +1,17 @@
-// Devices of one account, real processes that meet in a shared folder.
-#include <map>
-
-#include "tests/system/Device.hpp"
+// Devices that meet in a shared folder.
+#include "tests/system/Account.hpp"
 
 namespace processes {
 namespace {
 
-// Each device is a folder below the root, the programs lie in the root itself.
-struct CloudTest : Device {
+struct CloudTest : Account {
   CloudTest() {
     fs::create_directory(share);
     for (const char* name : {"one", "two"}) EXPECT_EQ(join(name, url).status, 0);
   }
-  ~CloudTest() override {
-    for (const auto& entry : std::map(running)) {
-      EXPECT_EQ(stop(entry.first), 0) << log(entry.first);
-    }
-  }
-
-  Outcome join(const std::string& name, const std::string& at) {
-    return on(name, "hearthctl", "init --cloud '" + at + "' --account home");
-  }
-  Outcome on(const std::string& name, const std::string& program, const std::string& arguments) {
-    return run(program + " --root " + (root / name).string() + " " + arguments);
-  }
-  Outcome cloud(const std::string& name, const std::string& arguments) {
-    return on(name, "hearthctl", "cloud " + arguments);
-  }
-
-  void start(const std::string& name) {
-    const std::string command = "env HEARTH_LOG_LEVEL=info HEARTH_LOG_PRIVATE=show hearthd --root ";
-    running[name] = spawn(command + (root / name).string(), name);
-    ASSERT_TRUE(eventually([&] { return on(name, "pairwellctl", "status").status == 0; })) << log(name);
-    ASSERT_TRUE(comesToSay(name, "connected          "));
-  }
-  int stop(const std::string& name, int signal = SIGTERM) {
-    const pid_t pid = running[name];
-    running.erase(name);
-    ::kill(pid, signal);
-    return finish(pid, name).status;
-  }
-  std::string log(const std::string& name) const { return contents(root / (name + ".err")); }
-  std::size_t timesLogged(const std::string& name, const std::string& text) const {
-    const std::string all = log(name);
-    std::size_t count = 0;
-    for (auto at = all.find(text); at != std::string::npos; at = all.find(text, at + 1)) ++count;
-    return count;
-  }
-  testing::AssertionResult comesToSay(const std::string& name, const std::string& text) {
-    if (eventually([&] { return cloud(name, "status").output.find(text) != std::string::npos; }))
-      return testing::AssertionSuccess();
-    return testing::AssertionFailure() << cloud(name, "status").output << log(name);
-  }
-
-  void switchTo(const std::string& name, const std::string& state) {
-    EXPECT_EQ(on(name, "pairwellctl", "logging " + state).status, 0);
-  }
-  std::string setting(const std::string& name, const std::string& key) {
-    return on(name, "hearthctl", "settings get cloud " + key).output;
-  }
-  // Whether the device comes to be on, its stores as well as what it answers, until the end that the other
-  // has.
-  testing::AssertionResult followsOn(const std::string& name, const std::string& other) {
-    return comesTo(name, [&] {
-      return on(name, "pairwellctl", "logging").output.starts_with("on until ") &&
-             on(name, "hearthctl", "alarms").output.find(flagKey) != std::string::npos &&
-             setting(other, endKey) != "" && setting(name, endKey) == setting(other, endKey);
-    });
-  }
-  testing::AssertionResult followsOff(const std::string& name) {
-    return comesTo(name, [&] {
-      return on(name, "pairwellctl", "logging").output == "off\n" && setting(name, endKey) == "" &&
-             on(name, "hearthctl", "alarms").output == "";
-    });
-  }
-  testing::AssertionResult comesTo(const std::string& name, const std::function<bool()>& condition) {
-    if (eventually(condition)) return testing::AssertionSuccess();
-    return testing::AssertionFailure() << log(name);
-  }
 
   const fs::path share = root / "share";
   const std::string url = "dir:" + share.string();
-  std::map<std::string, pid_t> running;
 };
 
 TEST_F(CloudTest, SwitchIsSharedAndWhoeverWasDownCatchesUp) {

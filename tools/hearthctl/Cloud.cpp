@@ -3,6 +3,7 @@
 #include <utility>
 
 #include "cloudsyncd/CloudInterface.hpp"
+#include "cloudsyncd/Transports.hpp"
 #include "cloudsyncd/core/Replica.hpp"
 #include "pairwelld/Names.hpp"
 #include "platform/linux/BusClient.hpp"
@@ -71,6 +72,25 @@ std::vector<std::vector<std::string>> linesOf(const Dictionary& status) {
 
 }  // namespace
 
+std::optional<cloudsync::Membership> membershipOf(const AccountOptions& options,
+                                                  platform::linux_::FileSystem& files) {
+  constexpr std::size_t sizeLimit = 64 << 10;
+  cloudsync::Membership membership;
+  std::string problem;
+  if (!options.access.empty()) {
+    const auto text = platform::linux_::readFile(files, options.access, sizeLimit);
+    const auto read =
+        text ? cloudsync::parseMembership(*text, problem) : Result<cloudsync::Membership>(text.error());
+    if (!text) problem = text.error().message();
+    if (!read) return say(options.access + ": " + problem), std::nullopt;
+    membership = *read;
+  }
+  membership.url = options.url;
+  membership.account = options.name;
+  problem = cloudsync::problemOf(membership);
+  return problem.empty() ? std::optional(membership) : (say(problem), std::nullopt);
+}
+
 Cloud::Cloud(const platform::linux_::Paths& paths_, platform::linux_::FileSystem& files_)
     : paths(paths_), files(files_), socket(paths_.serviceSocket(cloudsync::cloudService)) {}
 
@@ -104,8 +124,13 @@ Exit Cloud::status(Output& output) {
   return done;
 }
 
-Exit Cloud::use(const std::string& url, const std::string& account) {
-  const auto results = call("Use", {url, account}, downloadPatience);
+Exit Cloud::use(const AccountOptions& account) {
+  const auto membership = membershipOf(account, files);
+  if (!membership) return wrongUsage;
+  const auto text =
+      platform::linux_::printJson(cloudsync::fieldsOf(*membership), platform::linux_::JsonStyle::line);
+  if (!text) return tools::fail(account.access, text.error());
+  const auto results = call("Use", {*text}, downloadPatience);
   if (results) return done;
   return answer.empty() ? fail(results.error())
                         : tools::fail("the account is not changed", results.error(), answer);

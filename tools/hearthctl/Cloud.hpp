@@ -2,8 +2,10 @@
 #pragma once
 
 #include <chrono>
+#include <optional>
 #include <string>
 
+#include "cloudsyncd/CloudFile.hpp"
 #include "platform/Result.hpp"
 #include "platform/Value.hpp"
 #include "platform/linux/FileSystem.hpp"
@@ -12,6 +14,16 @@
 
 namespace tools {
 
+// Which account, as the command line has it.
+struct AccountOptions {
+  std::string url;  // empty: none
+  std::string name;
+  std::string access;  // a file with further fields of etc/cloud.json: what is secret is on no command line
+};
+// Says what is wrong, if something is.
+std::optional<cloudsync::Membership> membershipOf(const AccountOptions& options,
+                                                  platform::linux_::FileSystem& files);
+
 class Cloud {
  public:
   // The references outlive the object.
@@ -19,7 +31,7 @@ class Cloud {
 
   // The commands; each prints, and answers how to exit.
   Exit status(Output& output);
-  Exit use(const std::string& url, const std::string& account);
+  Exit use(const AccountOptions& account);
   Exit forget(const std::string& device);
   // Also without cloudsyncd.
   Exit makeNewIdentity(Output& output);

@@ -88,10 +88,10 @@ Exit init(Output& output, const platform::linux_::Paths& paths, FileSystem& file
       {paths.device(), deviceFile(device)},
       {paths.jobs() + "/com.kestrel.pairwelld.json", jobFile(programs)},
       {paths.entitlements() + "/pairwellctl.json", entitlementFile(programs)}};
-  if (!device.cloud.empty()) {
-    if (const auto problem = cloudsync::problemOf({device.cloud, device.account}); !problem.empty())
-      return say(problem), wrongUsage;
-    wanted.emplace_back(paths.cloud(), cloudsync::fieldsOf({device.cloud, device.account}));
+  if (!device.account.url.empty()) {
+    const auto membership = membershipOf(device.account, files);
+    if (!membership) return wrongUsage;
+    wanted.emplace_back(paths.cloud(), cloudsync::fieldsOf(*membership));
     wanted.emplace_back(paths.jobs() + "/com.kestrel.cloudsyncd.json", cloudJobFile(programs));
   }
   for (const auto& [path, fields] : wanted) {

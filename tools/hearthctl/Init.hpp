@@ -6,6 +6,7 @@
 #include "platform/linux/FileSystem.hpp"
 #include "platform/linux/Paths.hpp"
 #include "tools/Output.hpp"
+#include "tools/hearthctl/Cloud.hpp"
 
 namespace tools {
 
@@ -13,7 +14,7 @@ struct Device {
   std::string name;  // empty: the machine's
   std::string build;
   bool isInternal = false;
-  std::string cloud = {}, account = {};  // the URL, empty for a device on its own
+  AccountOptions account = {};
 };
 
 // Device, jobs and entitlements, for the programs that lie beside this one. A file

@@ -60,12 +60,17 @@ void addNotify(CLI::App& app, Options& options) {
       ->check(CLI::Range(0.0, 1e6));
 }
 
+const std::string urlText = "dir:PATH, dir:PATH?poll=SECONDS or nats://[USER@]HOST[:PORT][,HOST[:PORT]...]";
+constexpr const char* accessText =
+    "a file with the further fields of etc/cloud.json, such as {\"password\": ...}; may be /dev/stdin";
+
 void addCloud(CLI::App& app, Options& options) {
   auto* cloud = app.add_subcommand("cloud", "the account that shares the cloud store")->require_subcommand(1);
   cloud->add_subcommand("status", "print how the exchange with the other devices stands");
   auto* use = cloud->add_subcommand("use", "change to another account; the old one's values are kept aside");
-  use->add_option("URL", options.device.cloud, "dir:PATH, or dir:PATH?poll=SECONDS")->required();
-  use->add_option("--account", options.device.account, "the account there")->required();
+  use->add_option("URL", options.device.account.url, urlText)->required();
+  use->add_option("--account", options.device.account.name, "the account there")->required();
+  use->add_option("--access", options.device.account.access, accessText);
   cloud->add_subcommand("forget", "take a lost device's document out of the account")
       ->add_option("DEVICE", options.name, "its name, as cloud status prints it")
       ->required();
@@ -75,7 +80,7 @@ void addCloud(CLI::App& app, Options& options) {
 
 Exit runCloud(const std::string& command, const Options& options, tools::Cloud cloud, tools::Output& output) {
   if (command == "status") return cloud.status(output);
-  if (command == "use") return cloud.use(options.device.cloud, options.device.account);
+  if (command == "use") return cloud.use(options.device.account);
   if (command == "forget") return cloud.forget(options.name);
   return cloud.makeNewIdentity(output);
 }
@@ -86,11 +91,12 @@ void addCommands(CLI::App& app, Options& options) {
   init->add_option("--device-name", options.device.name, "by default the machine's host name");
   init->add_option("--build", options.device.build, "the operating system's build")->capture_default_str();
   init->add_flag("--internal", options.device.isInternal, "an internal build of the operating system");
-  auto* url = init->add_option("--cloud", options.device.cloud,
-                               "where the account's devices meet: dir:PATH, or dir:PATH?poll=SECONDS");
-  auto* account = init->add_option("--account", options.device.account, "the account there");
+  auto* url =
+      init->add_option("--cloud", options.device.account.url, "where the account's devices meet: " + urlText);
+  auto* account = init->add_option("--account", options.device.account.name, "the account there");
   url->needs(account);
   account->needs(url);
+  init->add_option("--access", options.device.account.access, accessText)->needs(url);
   auto* jobs = app.add_subcommand("jobs", "print the jobs, each with its state and process, or control one")
                    ->require_subcommand(0, 1);
   for (const char* action : {"start", "stop", "restart"}) {

@@ -1,0 +1,256 @@
+// Devices that meet at a cluster of real servers, configured as in packaging/nats.
+#include <arpa/inet.h>
+#include <sys/socket.h>
+
+#include <array>
+#include <atomic>
+#include <optional>
+#include <thread>
+
+#include "platform/linux/UniqueDescriptor.hpp"
+#include "tests/system/Account.hpp"
+
+namespace processes {
+namespace {
+
+using platform::linux_::UniqueDescriptor;
+
+sockaddr_in local(int port) {
+  sockaddr_in address{};
+  address.sin_family = AF_INET;
+  address.sin_port = htons(static_cast<std::uint16_t>(port));
+  address.sin_addr.s_addr = htonl(INADDR_LOOPBACK);
+  return address;
+}
+
+// The kernel gives it to nobody else soon.
+int freePort() {
+  const UniqueDescriptor socket(::socket(AF_INET, SOCK_STREAM, 0));
+  sockaddr_in address = local(0);
+  socklen_t size = sizeof address;
+  auto* plain = reinterpret_cast<sockaddr*>(&address);
+  if (::bind(socket.get(), plain, size) != 0 || ::getsockname(socket.get(), plain, &size) != 0) std::abort();
+  return ntohs(address.sin_port);
+}
+
+struct NatsTest : Account {
+  NatsTest() {
+    for (Server& server : servers) server = {freePort(), freePort(), freePort()};
+    write("nats/routes.conf", "routes: [ nats://127.0.0.1:" + std::to_string(servers[0].cluster) +
+                                  ", nats://127.0.0.1:" + std::to_string(servers[1].cluster) +
+                                  ", nats://127.0.0.1:" + std::to_string(servers[2].cluster) + " ]");
+    fs::copy_file(fs::path(SOURCE_ROOT) / "packaging/nats/nats-server.conf", conf);
+    makeCertificate("server", "DNS:localhost");
+    write("access.json", "{\"password\": \"hp\", \"authorities\": \"" + tls("ca.pem") + "\"}");
+  }
+  ~NatsTest() override {
+    stopAll();
+    stopServers();
+  }
+
+  std::string tls(const std::string& file) const { return (root / "nats" / file).string(); }
+  void makeCertificate(const std::string& name, const std::string& host) {
+    const std::string key = "-newkey ec -pkeyopt ec_paramgen_curve:prime256v1 -nodes -keyout ";
+    const std::string authority = "-CA " + tls("ca.pem") + " -CAkey " + tls("ca.key") + " ";
+    write("nats/" + name + ".ext", "subjectAltName=" + host);
+    if (!fs::exists(tls("ca.pem")))
+      run("openssl req -x509 -subj /CN=tests -out " + tls("ca.pem") + " " + key + tls("ca.key"));
+    run("openssl req -subj /CN=" + name + " -out " + tls(name + ".csr") + " " + key + tls(name + ".key"));
+    ASSERT_EQ(run("openssl x509 -req -CAcreateserial " + authority + "-in " + tls(name + ".csr") +
+                  " -extfile " + tls(name + ".ext") + " -out " + tls(name + ".pem"))
+                  .status,
+              0);
+  }
+  void change(const std::string& from, const std::string& to) {
+    std::string text = contents(conf);
+    const auto at = text.find(from);
+    ASSERT_NE(at, std::string::npos) << from;
+    std::ofstream(conf) << text.replace(at, from.size(), to);
+  }
+
+  void startServer(std::size_t number, const std::string& certificate = "server") {
+    const Server& server = servers[number];
+    const std::string name = "n" + std::to_string(number);
+    servers[number].pid = spawn(
+        "env NATS_NAME=" + name + " NATS_LISTEN=127.0.0.1:" + std::to_string(server.port) +
+            " NATS_CLUSTER=127.0.0.1:" + std::to_string(server.cluster) + " NATS_STORE=" + tls(name) +
+            " NATS_CERTIFICATE=" + tls(certificate + ".pem") + " NATS_KEY=" + tls(certificate + ".key") +
+            " NATS_HOME_PASSWORD=hp NATS_WORK_PASSWORD=wp /usr/sbin/nats-server -c " + conf.string() +
+            " -m " + std::to_string(server.monitor),
+        name);
+  }
+  void startServers() {
+    for (std::size_t number = 0; number < servers.size(); ++number) startServer(number);
+  }
+  void stopServer(std::size_t number) {
+    if (servers[number].pid <= 0) return;
+    ::kill(servers[number].pid, SIGKILL);
+    finish(std::exchange(servers[number].pid, -1), "n" + std::to_string(number));
+  }
+  void stopServers() {
+    for (std::size_t number = 0; number < servers.size(); ++number) stopServer(number);
+  }
+  // Of the account's stream, as its servers see it.
+  std::optional<std::size_t> leader() {
+    const std::string mark = "\"leader\": \"n", ask = "GET /jsz?streams=1 HTTP/1.0\\r\\n\\r\\n";
+    for (const Server& server : servers) {
+      if (server.pid <= 0) continue;
+      const std::string all = run("bash -c 'exec 3<>/dev/tcp/127.0.0.1/" + std::to_string(server.monitor) +
+                                  "; printf \"" + ask + "\" >&3; cat <&3'")
+                                  .output;
+      const auto stream = all.find("pairwell-home");
+      const auto at = stream == all.npos ? stream : all.find(mark, stream);
+      if (at != all.npos) return static_cast<std::size_t>(all[at + mark.size()] - '0');
+    }
+    return std::nullopt;
+  }
+
+  std::string url(const std::string& user = "home") const {
+    std::string text = "nats://" + user + "@";
+    for (const Server& server : servers)
+      text += (text.ends_with('@') ? "localhost:" : ",localhost:") + std::to_string(server.port);
+    return text;
+  }
+  void joinAndStart(const std::string& name) {
+    EXPECT_EQ(join(name, url(), "--access " + access).status, 0);
+    start(name);
+  }
+  testing::AssertionResult isInStep(const std::string& name) {
+    const auto connected = comesToSay(name, "connected          yes");
+    return connected ? comesToSay(name, "waiting to go out  nothing") : connected;
+  }
+
+  struct Server {
+    int port, cluster, monitor;
+    pid_t pid = -1;
+  };
+  std::array<Server, 3> servers;
+  const fs::path conf = root / "nats/nats-server.conf";
+  const std::string access = (root / "access.json").string();
+};
+
+TEST_F(NatsTest, SwitchesOutliveTheirLeaderAndAllServers) {
+  for (const char* name : {"one", "two"}) joinAndStart(name);
+  EXPECT_TRUE(comesToSay("one", "No server available"));
+  switchTo("one", "on");
+  startServers();
+  EXPECT_TRUE(followsOn("two", "one"));
+  ASSERT_TRUE(isInStep("one"));
+
+  const auto former = leader();
+  ASSERT_TRUE(former);
+  stopServer(*former);
+  switchTo("two", "off");
+  EXPECT_TRUE(followsOff("one"));
+  EXPECT_TRUE(isInStep("two")) << "once there is another leader";
+  startServer(*former);
+
+  stopServers();
+  for (const char* store : {"n0", "n1", "n2"}) fs::remove_all(tls(store));
+  ASSERT_TRUE(comesToSay("two", "connected          no"));
+  switchTo("two", "on");
+  startServers();
+  ASSERT_TRUE(isInStep("two"));
+  joinAndStart("three");
+  EXPECT_TRUE(followsOn("three", "two"));
+}
+
+TEST_F(NatsTest, StoppedServerIsLeftAndWhatItStillHoldsDoesNoHarm) {
+  startServers();
+  for (const char* name : {"one", "two"}) joinAndStart(name);
+  for (const char* name : {"one", "two"}) ASSERT_TRUE(isInStep(name));
+  switchTo("one", "on");
+  EXPECT_TRUE(followsOn("two", "one"));
+  const auto silent = leader();
+  ASSERT_TRUE(silent);
+  ::kill(servers[*silent].pid, SIGSTOP);
+  switchTo("one", "off");
+  EXPECT_TRUE(isInStep("one"));
+  switchTo("one", "on");
+  EXPECT_TRUE(isInStep("one"));
+  ::kill(servers[*silent].pid, SIGCONT);
+  EXPECT_TRUE(followsOn("two", "one"));
+}
+
+TEST_F(NatsTest, OnlyItsUsersComeIntoAnAccountAndOnlyToServersThatAreTrusted) {
+  startServers();
+  joinAndStart("one");
+  ASSERT_TRUE(isInStep("one"));
+  const auto refusal = [&](const std::string& at, const std::string& further) {
+    write("other.json", "{" + further + "}");
+    const Outcome tried =
+        cloud("one", "use " + at + " --account home --access " + (root / "other.json").string());
+    EXPECT_NE(tried.status, 0);
+    return tried.errors;
+  };
+  const std::string trusted = "\"authorities\": \"" + tls("ca.pem") + "\"";
+  EXPECT_THAT(refusal(url(), trusted + ", \"password\": \"wrong\""), HasSubstr("Authorization Violation"));
+  EXPECT_THAT(refusal(url(), "\"tls\": true, \"password\": \"hp\""), HasSubstr("issuer certificate"));
+  EXPECT_THAT(refusal(url("work"), trusted + ", \"password\": \"wp\""), HasSubstr("Permissions Violation"))
+      << "each is alone with its account";
+  EXPECT_THAT(refusal(url("home:hp"), trusted), HasSubstr("a password does not belong into the URL"));
+  EXPECT_THAT(refusal(url(), "\"passwort\": \"hp\""), HasSubstr("\"passwort\" is no field"));
+
+  makeCertificate("other", "DNS:elsewhere.example");
+  stopServers();
+  for (std::size_t number = 0; number < servers.size(); ++number) startServer(number, "other");
+  EXPECT_TRUE(comesToSay("one", "hostname mismatch"));
+  EXPECT_THAT(cloud("one", "status").output, Not(HasSubstr("hp")));
+}
+
+TEST_F(NatsTest, WhatTheEngineHasNoRoomForStaysHere) {
+  change("max_payload: 2MB", "max_payload: 8KB");
+  change("max_file: 64MB", "max_file: 12KB");
+  startServers();
+  joinAndStart("one");
+  const auto set = [&](const char* size) {
+    EXPECT_EQ(run("sh -c 'hearthctl --root " + (root / "one").string() +
+                  " settings set cloud big $(head -c " + size + " /dev/zero | tr \"\\0\" x)'")
+                  .status,
+              0);
+  };
+  set("9000");
+  EXPECT_TRUE(comesToSay("one", "the settings exceed what an account may hold"));
+  set("100");
+  EXPECT_TRUE(isInStep("one"));
+  set("7000");
+  EXPECT_TRUE(comesToSay("one", "nothing can be published: stream pairwell-home: "));
+  switchTo("one", "on");
+  set("100");
+  EXPECT_TRUE(isInStep("one"));
+}
+
+// Of whatever has the account's password.
+TEST_F(NatsTest, FloodOfOneDeviceKeepsNoOtherWaiting) {
+  change("max_payload: 2MB", "allow_non_tls: true");
+  write("access.json", "{\"password\": \"hp\"}");
+  startServers();
+  for (const char* name : {"one", "two"}) joinAndStart(name);
+  for (const char* name : {"one", "two"}) ASSERT_TRUE(isInStep(name));
+  const UniqueDescriptor flood(::socket(AF_INET, SOCK_STREAM, 0));
+  const sockaddr_in address = local(servers[0].port);
+  ASSERT_EQ(::connect(flood.get(), reinterpret_cast<const sockaddr*>(&address), sizeof address), 0);
+  const std::string noise(100'000, '{');
+  const std::string message =
+      "PUB pairwell.home.flood " + std::to_string(noise.size()) + "\r\n" + noise + "\r\n";
+  std::string all = "CONNECT {\"user\":\"home\",\"pass\":\"hp\",\"verbose\":false,\"pedantic\":false}\r\n";
+  std::atomic<bool> isEnough = false;
+  std::thread flooder([&] {
+    ::send(flood.get(), all.data(), all.size(), MSG_NOSIGNAL);
+    while (!isEnough && ::send(flood.get(), message.data(), message.size(), MSG_NOSIGNAL) > 0) {
+    }
+  });
+  EXPECT_TRUE(comesToSay("two", "flood, newest change never, refused: "));
+  switchTo("one", "on");
+  EXPECT_TRUE(followsOn("two", "one"));
+  switchTo("two", "off");
+  EXPECT_TRUE(followsOff("one"));
+  isEnough = true;
+  flooder.join();
+  EXPECT_EQ(timesLogged("two", "the document of device flood is refused"), 1u);
+  EXPECT_EQ(cloud("one", "forget flood").status, 0);
+  EXPECT_TRUE(eventually([&] { return cloud("two", "status").output.find("flood") == std::string::npos; }));
+}
+
+}  // namespace
+}  // namespace processes
