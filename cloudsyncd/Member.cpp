@@ -58,16 +58,19 @@ Member::Member(platform::linux_::EventLoop& loop_, platform::linux_::FileSystem&
       writer(platform::UUID::random().text()),
       replica(platform::linux_::SettingsFile::create(files, replicaPath)) {}
 
-void Member::start() {
-  replica->startWatching(loop, [this](const Dictionary& before, const Dictionary& after) {
+bool Member::start() {
+  const bool isWatching = replica->startWatching(loop, [this](const auto& before, const auto& after) {
     if (current) current->synchroniser->replicaChanged(before, after);
   });
   std::string wrong;
   const auto membership = readCloudFile(files, paths.cloud(), wrong);
   if (membership) current = connect(*membership, nullptr, nullptr, wrong);
-  if (current) return current->synchroniser->start();
+  if (current) return current->synchroniser->start(), isWatching;
   problem = paths.cloud() + ": " + wrong;
   platform::hearthLog("cloud").error("%s; this device is in no account", problem);
+  const bool isItsFault = membership || membership.error() == platform::Outcome::malformedFile ||
+                          membership.error() == std::errc::no_such_file_or_directory;
+  return isWatching && isItsFault;
 }
 
 std::unique_ptr<Member::Connection> Member::connect(const Membership& membership,

@@ -25,7 +25,8 @@ class Member {
   Member(platform::linux_::EventLoop& loop, platform::linux_::FileSystem& files,
          platform::linux_::Paths paths);
 
-  void start();
+  // Once. False: something is short for now that has to be there from the beginning, and the log says what.
+  bool start();
   // As CloudOperation::status answers it.
   platform::Dictionary status() const;
   // `done` gets why it can't be; empty: the device is in that account now.

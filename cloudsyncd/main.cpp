@@ -61,7 +61,7 @@ int main(int count, char**) {
     service.emplace(loop, member, std::move(socket));
   const auto terminated = loop.watchSignal(SIGTERM, [&] { loop.stop(); });
   const auto interrupted = loop.watchSignal(SIGINT, [&] { loop.stop(); });
-  member.start();
+  if (!member.start()) return failed;  // hearthd starts it again, later and later
   loop.run();
   return 0;
 }

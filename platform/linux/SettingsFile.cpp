@@ -183,7 +183,7 @@ Result<void> SettingsFile::setValue(std::string_view key, const std::optional<Va
   });
 }
 
-void SettingsFile::startWatching(WorkQueue& delivery_, Changed changed_) {
+bool SettingsFile::startWatching(WorkQueue& delivery_, Changed changed_) {
   delivery = &delivery_;
   changed = std::move(changed_);
   const std::string folder = folderOf(path);
@@ -195,7 +195,7 @@ void SettingsFile::startWatching(WorkQueue& delivery_, Changed changed_) {
                     : Result<std::unique_ptr<FolderWatch>>(made.error());
   if (!begun) {
     log().error("%s: changes by others will not be noticed: %s", folder, begun.error().message());
-    return;
+    return false;
   }
   watch = std::move(*begun);
   // After the watch has begun, and what is in force by then: a change of the meantime, which look() could not
@@ -203,6 +203,7 @@ void SettingsFile::startWatching(WorkQueue& delivery_, Changed changed_) {
   static_cast<void>(contents());
   std::lock_guard lock(mutex);
   reported = document;
+  return true;
 }
 
 // Compares instead of trusting events: they merge, overflow, and come for own writes, too.

@@ -45,9 +45,9 @@ class SettingsFile : public std::enable_shared_from_this<SettingsFile> {
   Result<void> setValue(std::string_view key, const std::optional<Value>& value);
 
   // Once. From now on `changed` hears of what others wrote, once, and of nothing that this object wrote.
-  // `delivery`, on whose thread the file system reports, outlives the object. A failure is logged; reports
-  // then stay away.
-  void startWatching(WorkQueue& delivery, Changed changed);
+  // `delivery`, on whose thread the file system reports, outlives the object. False after a failure, which is
+  // logged: reports stay away.
+  bool startWatching(WorkQueue& delivery, Changed changed);
 
  private:
   SettingsFile(FileSystem& files, std::string path);
