@@ -54,7 +54,7 @@ void Synchroniser::disconnected(const std::string& problem_) {
 void Synchroniser::received(const std::string& name, std::string_view text) {
   seen.insert(name);
   std::string why;
-  auto document = decodeDocument(text, around.account, name, why);
+  auto document = decodeDocument(text, around.account, name, around.wall.now(), why);
   if (!document) return refuse(name, why);
   Device& device = devices[name];
   device.problem.clear();

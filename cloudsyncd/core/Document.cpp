@@ -1,5 +1,6 @@
 #include "cloudsyncd/core/Document.hpp"
 
+#include <algorithm>
 #include <cstdint>
 
 #include "platform/linux/CloudReplica.hpp"
@@ -44,6 +45,14 @@ Dictionary validEntries(const Dictionary& values) {
   return entries;
 }
 
+// In microseconds since 1970.
+double newestStamp(const Dictionary& entries) {
+  std::int64_t newest = 0;
+  for (const auto& [key, value] : entries)
+    newest = std::max(newest, CloudEntry::fromValue(value)->stamp.microseconds);
+  return static_cast<double>(newest);
+}
+
 }  // namespace
 
 Result<std::string> encodeDocument(const Document& document) {
@@ -58,7 +67,7 @@ Result<std::string> encodeDocument(const Document& document) {
 }
 
 Result<Document> decodeDocument(std::string_view text, const std::string& account, const std::string& device,
-                                std::string& problem) {
+                                platform::Time now, std::string& problem) {
   if (text.size() > documentBytes) {
     problem = "it is larger than " + std::to_string(documentBytes) + " bytes";
     return Outcome::malformedFile;
@@ -71,8 +80,12 @@ Result<Document> decodeDocument(std::string_view text, const std::string& accoun
   }
   problem = refusal(*fields, account, device);
   if (!problem.empty()) return Outcome::malformedFile;
-  return Document{account, device, textIn(*fields, "writer"),
-                  validEntries(platform::linux_::settingsValues(*fields))};
+  Document document{account, device, textIn(*fields, "writer"),
+                    validEntries(platform::linux_::settingsValues(*fields))};
+  constexpr double hundredYears = 3.2e9;
+  if (newestStamp(document.entries) <= (now.count() + hundredYears) * 1e6) return document;
+  problem = "it has an entry that is stamped more than a hundred years ahead";
+  return Outcome::malformedFile;
 }
 
 bool isName(std::string_view text) {

@@ -26,13 +26,15 @@ platform::Result<std::string> encodeDocument(const Document& document);
 
 // `device` is the name under which it was found. Outcome::malformedFile for everything else than a whole
 // document of that device, of this account and of the one format that is known; `problem` says why, in words
-// that do not vary from one repetition to the next. Entries that are none are left out.
+// that do not vary from one repetition to the next. Entries that are none are left out. No clock is a hundred
+// years ahead of `now`, this device's; an entry that claims it could have the last of all stamps, and nobody
+// could write over it.
 platform::Result<Document> decodeDocument(std::string_view text, const std::string& account,
-                                          const std::string& device, std::string& problem);
+                                          const std::string& device, platform::Time now,
+                                          std::string& problem);
 
 // What accounts and devices may be called: they name folders, files and subjects elsewhere. Letters, digits,
-// '-' and
-// '_', '.' but not first; 1 to 64 of them.
+// '-' and '_', '.' but not first; 1 to 64 of them.
 bool isName(std::string_view text);
 
 }  // namespace cloudsync

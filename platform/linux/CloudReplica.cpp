@@ -11,12 +11,15 @@ namespace platform::linux_ {
 namespace {
 
 constexpr std::string_view companionSuffix = "Expiration";
-// Beyond what any clock says, and far from overflow: such a stamp is its entry's fault.
+// Beyond what any clock says, or the expiry of an expiry needs, and far from overflow: such a stamp is its
+// entry's fault.
 constexpr std::int64_t greatestStamp = std::int64_t{1} << 61;
+constexpr std::int64_t greatestTick = 1 << 20;
 
-std::optional<std::int64_t> stampPart(const Dictionary& entry, std::string_view name, std::int64_t least) {
+std::optional<std::int64_t> stampPart(const Dictionary& entry, std::string_view name, std::int64_t least,
+                                      std::int64_t greatest) {
   const auto* number = platform::find<std::int64_t>(entry, name);
-  return number && *number >= least && *number <= greatestStamp ? std::optional(*number) : std::nullopt;
+  return number && *number >= least && *number <= greatest ? std::optional(*number) : std::nullopt;
 }
 
 std::int64_t microsecondsOf(Time time) {
@@ -36,9 +39,7 @@ CloudStamp nextStamp(const Dictionary& entries, const CloudWrite& write) {
     const auto entry = CloudEntry::fromValue(value);
     if (!entry || entry->stamp.microseconds < next.microseconds) continue;
     if (entry->stamp.microseconds > now + day && cloudStemOf(key) != stem) continue;
-    const bool isGreatest = entry->stamp.microseconds == greatestStamp;
-    next = isGreatest ? CloudStamp{greatestStamp, entry->stamp.tick + 1}
-                      : CloudStamp{entry->stamp.microseconds + 1, 0};
+    next = {std::min(entry->stamp.microseconds + 1, greatestStamp), 0};
   }
   return next;
 }
@@ -105,8 +106,8 @@ CloudStore::ChangeReason reasonGiven(const Dictionary& before, const Dictionary&
 std::optional<CloudEntry> CloudEntry::fromValue(const Value& value) {
   const auto* fields = value.as<Dictionary>();
   if (!fields) return std::nullopt;
-  const auto microseconds = stampPart(*fields, "time", 0);
-  const auto tick = stampPart(*fields, "tick", -1);
+  const auto microseconds = stampPart(*fields, "time", 0, greatestStamp);
+  const auto tick = stampPart(*fields, "tick", -1, greatestTick);
   const auto* device = platform::find<std::string>(*fields, "device");
   const auto stored = valueOf(*fields, "value");
   const bool isRemoved = valueOf(*fields, "removed") == Value(true);
@@ -208,7 +209,7 @@ bool CloudBursts::expire(Dictionary& entries, const CloudWrite& write, const std
   const auto end = CloudEntry::find(entries, companion);
   const CloudEntry& ended = cleared && cleared->outranks(*end) ? *cleared : *end;
   stamp = ended.stamp;
-  ++stamp.tick;
+  if (++stamp.tick > greatestTick) stamp = {stamp.microseconds + 1, 0};
   lastWrite.reset();
   expiring = companion;
   endedDevice = ended.device;

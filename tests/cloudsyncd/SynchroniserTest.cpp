@@ -60,7 +60,7 @@ struct SynchroniserTest : platform::linux_::World {
     const auto [name, text] = transport.sent.back();
     transport.sent.clear();
     std::string problem;
-    const auto sent = decodeDocument(text, "home", name, problem);
+    const auto sent = decodeDocument(text, "home", name, device.manualClock.now(), problem);
     EXPECT_TRUE(sent) << problem;
     synchroniser.published({}, {});
     return *sent;
@@ -144,6 +144,7 @@ TEST_F(SynchroniserTest, RefusesBadDocumentsWithOneLineEach) {
       {with("\"home\"", "\"work\""), "it is of another account"},
       {document("other", {}), "it is of another device"},
       {std::string(documentBytes + 1, ' '), "larger than 1048576 bytes"},
+      {document("peer", {{"key", entry(1, std::int64_t{1} << 60)}}), "more than a hundred years ahead"},
   };
   for (const auto& [text, cause] : cases) {
     synchroniser.received("peer", text);
