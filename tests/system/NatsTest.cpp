@@ -179,7 +179,8 @@ TEST_F(NatsTest, OnlyItsUsersComeIntoAnAccountAndOnlyToServersThatAreTrusted) {
   const auto refusal = [&](const std::string& at, const std::string& further) {
     write("other.json", "{" + further + "}");
     const Outcome tried =
-        cloud("one", "use " + at + " --account home --access " + (root / "other.json").string());
+        run("cat " + (root / "other.json").string() + " | hearthctl --root " + (root / "one").string() +
+            " cloud use " + at + " --account home --access /dev/stdin");
     EXPECT_NE(tried.status, 0);
     return tried.errors;
   };

@@ -1,5 +1,7 @@
 #include "tools/hearthctl/Cloud.hpp"
 
+#include <cerrno>
+#include <fstream>
 #include <utility>
 
 #include "cloudsyncd/CloudInterface.hpp"
@@ -23,7 +25,7 @@ using std::chrono::milliseconds;
 
 constexpr milliseconds patience{5000};
 // An engine may be far, or not there at all, which takes its own time to find out.
-constexpr milliseconds downloadPatience{30'000};
+constexpr milliseconds enginePatience{30'000};
 
 std::string textIn(const Dictionary& fields, std::string_view name) {
   const auto* text = platform::find<std::string>(fields, name);
@@ -70,18 +72,27 @@ std::vector<std::vector<std::string>> linesOf(const Dictionary& status) {
   return lines;
 }
 
+// A pipe's, too: the file layer would not wait for its writer.
+Result<cloudsync::Membership> readAccess(const std::string& path, std::string& problem) {
+  std::string text(64 << 10, '\0');
+  std::ifstream file(path);
+  file.read(text.data(), static_cast<std::streamsize>(text.size()));
+  if (!file.is_open() || file.bad()) {
+    const std::error_code error(errno, std::generic_category());
+    problem = error.message();
+    return error;
+  }
+  text.resize(static_cast<std::size_t>(file.gcount()));
+  return cloudsync::parseMembership(text, problem);
+}
+
 }  // namespace
 
-std::optional<cloudsync::Membership> membershipOf(const AccountOptions& options,
-                                                  platform::linux_::FileSystem& files) {
-  constexpr std::size_t sizeLimit = 64 << 10;
+std::optional<cloudsync::Membership> membershipOf(const AccountOptions& options) {
   cloudsync::Membership membership;
   std::string problem;
   if (!options.access.empty()) {
-    const auto text = platform::linux_::readFile(files, options.access, sizeLimit);
-    const auto read =
-        text ? cloudsync::parseMembership(*text, problem) : Result<cloudsync::Membership>(text.error());
-    if (!text) problem = text.error().message();
+    const auto read = readAccess(options.access, problem);
     if (!read) return say(options.access + ": " + problem), std::nullopt;
     membership = *read;
   }
@@ -125,19 +136,19 @@ Exit Cloud::status(Output& output) {
 }
 
 Exit Cloud::use(const AccountOptions& account) {
-  const auto membership = membershipOf(account, files);
+  const auto membership = membershipOf(account);
   if (!membership) return wrongUsage;
   const auto text =
       platform::linux_::printJson(cloudsync::fieldsOf(*membership), platform::linux_::JsonStyle::line);
   if (!text) return tools::fail(account.access, text.error());
-  const auto results = call("Use", {*text}, downloadPatience);
+  const auto results = call("Use", {*text}, enginePatience);
   if (results) return done;
   return answer.empty() ? fail(results.error())
                         : tools::fail("the account is not changed", results.error(), answer);
 }
 
 Exit Cloud::forget(const std::string& device) {
-  const auto results = call("Forget", {device}, patience);
+  const auto results = call("Forget", {device}, enginePatience);
   if (results) return done;
   return answer.empty() ? fail(results.error())
                         : tools::fail(device + " is not forgotten", results.error(), answer);

@@ -21,8 +21,7 @@ struct AccountOptions {
   std::string access;  // a file with further fields of etc/cloud.json: what is secret is on no command line
 };
 // Says what is wrong, if something is.
-std::optional<cloudsync::Membership> membershipOf(const AccountOptions& options,
-                                                  platform::linux_::FileSystem& files);
+std::optional<cloudsync::Membership> membershipOf(const AccountOptions& options);
 
 class Cloud {
  public:

@@ -89,7 +89,7 @@ Exit init(Output& output, const platform::linux_::Paths& paths, FileSystem& file
       {paths.jobs() + "/com.kestrel.pairwelld.json", jobFile(programs)},
       {paths.entitlements() + "/pairwellctl.json", entitlementFile(programs)}};
   if (!device.account.url.empty()) {
-    const auto membership = membershipOf(device.account, files);
+    const auto membership = membershipOf(device.account);
     if (!membership) return wrongUsage;
     wanted.emplace_back(paths.cloud(), cloudsync::fieldsOf(*membership));
     wanted.emplace_back(paths.jobs() + "/com.kestrel.cloudsyncd.json", cloudJobFile(programs));
