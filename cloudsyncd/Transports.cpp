@@ -56,9 +56,12 @@ bool isHost(std::string_view host) {
   });
 }
 
+// Not 127.example.
 bool isThisMachine(const std::string& server) {
-  const std::string host = server.substr(0, server.rfind(':'));
-  return host == "localhost" || host.starts_with("127.") || host.starts_with("[::1]");
+  if (server == "[::1]" || server.starts_with("[::1]:")) return true;
+  const std::string host = server.substr(0, server.find(':'));
+  const bool isNumber = host.find_first_not_of("0123456789.") == host.npos;
+  return host == "localhost" || (isNumber && host.starts_with("127."));
 }
 
 NatsTransport::Place natsOf(const Membership& membership, std::string_view rest, std::string& problem) {
