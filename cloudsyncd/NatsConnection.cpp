@@ -1,6 +1,9 @@
 #include "cloudsyncd/NatsConnection.hpp"
 
 #include <nats/nats.h>
+#include <signal.h>
+#include <time.h>
+#include <unistd.h>
 
 #include <chrono>
 #include <optional>
@@ -16,6 +19,8 @@ using platform::Result;
 
 // A server that does not answer at once may not be there; others may.
 constexpr std::chrono::milliseconds connectPatience{2000};
+// All of it, with what encrypts it: for that the library knows no limit.
+constexpr std::chrono::milliseconds openPatience{2500};
 // A connection whose other end is gone without a word is noticed within twice this; oftener would wake the
 // device.
 constexpr std::chrono::milliseconds pingInterval{30'000};
@@ -51,6 +56,39 @@ std::optional<std::string> nameOf(std::string_view token) {
   }
   return isName(name) ? std::optional(name) : std::nullopt;
 }
+
+// Interrupts what blocks the thread for longer than `openPatience`, and again, as the first signal may fall
+// between two calls.
+class Interruption {
+ public:
+  Interruption() {
+    struct sigaction nothing {};
+    nothing.sa_handler = [](int) {};  // and no SA_RESTART
+    ::sigaction(SIGALRM, &nothing, nullptr);
+    sigevent event{};
+    event.sigev_notify = SIGEV_THREAD_ID;
+    event.sigev_signo = SIGALRM;
+    event._sigev_un._tid = ::gettid();
+    isSet = ::timer_create(CLOCK_MONOTONIC, &event, &timer) == 0;
+    if (!isSet) return;
+    const auto span = [](std::chrono::nanoseconds time) {
+      return timespec{time.count() / 1'000'000'000, time.count() % 1'000'000'000};
+    };
+    const itimerspec times{span(std::chrono::milliseconds(100)), span(openPatience)};
+    ::timer_settime(timer, 0, &times, nullptr);
+  }
+  ~Interruption() {
+    if (isSet) ::timer_delete(timer);
+  }
+  Interruption(const Interruption&) = delete;
+  Interruption& operator=(const Interruption&) = delete;
+  bool isDue() const { return std::chrono::steady_clock::now() - begin >= openPatience; }
+
+ private:
+  const std::chrono::steady_clock::time_point begin = std::chrono::steady_clock::now();
+  bool isSet = false;
+  timer_t timer{};
+};
 
 std::string textOf(natsMsg* message) {
   return {::natsMsg_GetData(message), static_cast<std::size_t>(::natsMsg_GetDataLength(message))};
@@ -103,10 +141,11 @@ struct NatsConnection::Library {
   std::int64_t dropped = 0;
 
   natsStatus connect(natsOptions* options) {
+    const Interruption interruption;
     natsConnection* made = nullptr;
     const natsStatus status = ::natsConnection_Connect(&made, options);
     connection.reset(made);
-    return status;
+    return status == NATS_SSL_ERROR && interruption.isDue() ? NATS_TIMEOUT : status;
   }
   natsStatus openStreams() {
     jsOptions options;
@@ -199,10 +238,14 @@ Result<NatsConnection::Stream> NatsConnection::lookUp(std::string& problem) {
   const auto* subjects = info->State.Subjects;
   for (int index = 0; subjects && index < subjects->Count; ++index) {
     if (stream.devices.size() == devicesRead) break;
-    if (auto device = nameOf(std::string_view(subjects->List[index].Subject).substr(prefix.size())))
-      stream.devices.push_back(std::move(*device));
+    if (auto device = deviceOf(subjects->List[index].Subject)) stream.devices.push_back(std::move(*device));
   }
   return stream;
+}
+
+// A server may send anything.
+std::optional<std::string> NatsConnection::deviceOf(std::string_view subject) const {
+  return subject.starts_with(prefix) ? nameOf(subject.substr(prefix.size())) : std::nullopt;
 }
 
 // Several devices may do so at once: the second finds it.
@@ -278,7 +321,7 @@ Result<NatsConnection::Message> NatsConnection::receive(std::string& problem) {
       return Outcome::notConnected;
     }
     const Handle received(found);
-    auto device = nameOf(std::string_view(::natsMsg_GetSubject(found)).substr(prefix.size()));
+    auto device = deviceOf(::natsMsg_GetSubject(found));
     if (!device) continue;
     Message message{std::move(*device), textOf(found), false};
     std::int64_t dropped = 0;

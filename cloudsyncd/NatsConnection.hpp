@@ -5,6 +5,7 @@
 #include <cstddef>
 #include <cstdint>
 #include <memory>
+#include <optional>
 #include <string>
 #include <string_view>
 #include <vector>
@@ -71,6 +72,7 @@ class NatsConnection {
   NatsConnection(std::unique_ptr<Library> library, const std::string& account);
   platform::Result<Stream> lookUp(std::string& problem);
   platform::Result<void> makeStream(std::string& problem);
+  std::optional<std::string> deviceOf(std::string_view subject) const;
 
   const std::unique_ptr<Library> library;
   const std::string name;    // of the stream

@@ -1,11 +1,14 @@
 // Devices that meet at a cluster of real servers, configured as in packaging/nats.
 #include <arpa/inet.h>
+#include <poll.h>
 #include <sys/socket.h>
 
 #include <array>
 #include <atomic>
 #include <optional>
+#include <string_view>
 #include <thread>
+#include <utility>
 
 #include "platform/linux/UniqueDescriptor.hpp"
 #include "tests/system/Account.hpp"
@@ -23,15 +26,20 @@ sockaddr_in local(int port) {
   return address;
 }
 
-// The kernel gives it to nobody else soon.
-int freePort() {
-  const UniqueDescriptor socket(::socket(AF_INET, SOCK_STREAM, 0));
+// And its port.
+std::pair<UniqueDescriptor, int> listening() {
+  UniqueDescriptor socket(::socket(AF_INET, SOCK_STREAM, 0));
   sockaddr_in address = local(0);
   socklen_t size = sizeof address;
   auto* plain = reinterpret_cast<sockaddr*>(&address);
-  if (::bind(socket.get(), plain, size) != 0 || ::getsockname(socket.get(), plain, &size) != 0) std::abort();
-  return ntohs(address.sin_port);
+  if (::bind(socket.get(), plain, size) != 0 || ::listen(socket.get(), 1) != 0 ||
+      ::getsockname(socket.get(), plain, &size) != 0)
+    std::abort();
+  return {std::move(socket), ntohs(address.sin_port)};
 }
+
+// The kernel gives it to nobody else soon.
+int freePort() { return listening().second; }
 
 struct NatsTest : Account {
   NatsTest() {
@@ -191,6 +199,17 @@ TEST_F(NatsTest, OnlyItsUsersComeIntoAnAccountAndOnlyToServersThatAreTrusted) {
       << "each is alone with its account";
   EXPECT_THAT(refusal(url("home:hp"), trusted), HasSubstr("a password does not belong into the URL"));
   EXPECT_THAT(refusal(url(), "\"passwort\": \"hp\""), HasSubstr("\"passwort\" is no field"));
+  const auto [silent, port] = listening();
+  std::thread halts([&silent = silent] {
+    const UniqueDescriptor client(::accept(silent.get(), nullptr, nullptr));
+    constexpr std::string_view greeting = "INFO {\"server_id\":\"s\",\"tls_required\":true}\r\n";
+    ::send(client.get(), greeting.data(), greeting.size(), MSG_NOSIGNAL);
+    pollfd closed{client.get(), POLLRDHUP, 0};
+    ::poll(&closed, 1, 20'000);
+  });
+  EXPECT_THAT(refusal("nats://home@localhost:" + std::to_string(port), trusted), HasSubstr("no answer"))
+      << "of a server that goes no further than to say it encrypts";
+  halts.join();
 
   makeCertificate("other", "DNS:elsewhere.example");
   stopServers();
