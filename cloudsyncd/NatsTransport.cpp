@@ -1,6 +1,5 @@
 #include "cloudsyncd/NatsTransport.hpp"
 
-#include <algorithm>
 #include <chrono>
 #include <utility>
 
@@ -76,8 +75,11 @@ void NatsTransport::opened(const Connection& made, const std::string& problem) {
   if (!made && attempts < place.servers.size()) return open();
   if (!made) return lose(problem);
   connection = made;
-  receiving.async([this, made] { receive(made); });
-  read();
+  receiving.async([this, made] {
+    // Only now: what the former connection still handed over would count as heard on this one.
+    later([](NatsTransport& self) { self.read(); });
+    receive(made);
+  });
 }
 
 void NatsTransport::receive(const Connection& from) {
@@ -90,7 +92,9 @@ void NatsTransport::receive(const Connection& from) {
       });
     }
     if (message->othersAreLost) {
-      later([](NatsTransport& self) {
+      later([from](NatsTransport& self) {
+        if (self.connection != from) return;
+        self.isUncertain = true;
         self.due = self.steady();
         self.client->deadlineMoved();
       });
@@ -136,8 +140,9 @@ void NatsTransport::read() {
     heard.clear();
   }
   const auto found = std::make_shared<NatsConnection::Stream>();
-  const auto work = [this, found, former = stream](NatsConnection& from,
-                                                   std::string& problem) -> Result<void> {
+  const auto work = [this, found,
+                     former = std::exchange(isUncertain, false) ? NatsConnection::Stream() : stream](
+                        NatsConnection& from, std::string& problem) -> Result<void> {
     auto there = from.stream(problem);
     if (!there) return there.error();
     *found = std::move(*there);
@@ -153,6 +158,7 @@ void NatsTransport::read() {
     if (!answer.isCurrent) return;
     self.isBusy = false;
     if (!answer.error) return self.finishReading(*found);
+    self.isUncertain = true;
     if (self.isConnected && answer.isAlive && answer.problem != self.retry.problem())
       platform::hearthLog("cloud").error("the account cannot be read: %s", answer.problem);
     self.fail(answer);
@@ -168,8 +174,12 @@ void NatsTransport::finishReading(const NatsConnection::Stream& found) {
   if (isChanged) forgetOthers();
   retry.succeeded();
   attempts = 0;
-  const auto next = steady() + (isConnected ? Steady::duration(betweenReadings) : untilHeard);
-  due = std::min(due.value_or(next), next);
+  {
+    // Which is the newer one, what was read or what came meanwhile, only another look can tell.
+    std::lock_guard lock(mutex);
+    isUncertain = isUncertain || !heard.empty();
+  }
+  due = steady() + (isConnected && !isUncertain ? Steady::duration(betweenReadings) : untilHeard);
   if (!std::exchange(isConnected, true)) client->connected();
   client->deadlineMoved();
 }
@@ -199,7 +209,7 @@ void NatsTransport::publish(const std::string& device, std::string document) {
 }
 
 void NatsTransport::forget(const std::string& device, std::function<void(const std::string&)> done) {
-  if (!connection) return done(retry.problem());
+  if (!connection) return done(retry.problem().empty() ? "not connected yet" : retry.problem());
   call([device](NatsConnection& to, std::string& problem) { return to.remove(device, problem); },
        [done = std::move(done)](NatsTransport&, const Answer& answer) {
          done(answer.error ? answer.problem : "");

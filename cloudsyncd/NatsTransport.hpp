@@ -36,7 +36,7 @@ class NatsTransport : public Transport, public std::enable_shared_from_this<Nats
   // `queue` is the loop's; it outlives the object.
   static std::shared_ptr<NatsTransport> create(platform::WorkQueue& queue, std::function<Steady()> steady,
                                                Place place);
-  // Waits for what is under way, 2 s at most.
+  // Waits for what is under way, which takes seconds where a server is silent.
   ~NatsTransport() override;
 
   void start(TransportClient& client) override;
@@ -85,6 +85,7 @@ class NatsTransport : public Transport, public std::enable_shared_from_this<Nats
   Retry retry;
   std::optional<Steady> due;      // the next reading or attempt to connect
   NatsConnection::Stream stream;  // as it was read on this connection
+  bool isUncertain = false;       // whether the client has all that was there then: read all again
   std::set<std::string> known;    // the devices whose documents the client has
   std::minstd_rand random;
 
