@@ -38,7 +38,7 @@ class TransportClient {
 class Transport {
  public:
   virtual ~Transport() = default;
-  // Once. The client outlives the transport.
+  // Once. The client lives until the transport's owner lets go of it, and is told nothing from then on.
   virtual void start(TransportClient& client) = 0;
   // Replaces this device's document, durably; answered by one published(). One at a time, while connected.
   virtual void publish(const std::string& device, std::string document) = 0;
