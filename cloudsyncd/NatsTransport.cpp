@@ -158,6 +158,7 @@ void NatsTransport::read() {
     if (!answer.isCurrent) return;
     self.isBusy = false;
     if (!answer.error) return self.finishReading(*found);
+    self.isUnanswered = false;  // the stream is silent to everybody
     self.isUncertain = true;
     if (self.isConnected && answer.isAlive && answer.problem != self.retry.problem())
       platform::hearthLog("cloud").error("the account cannot be read: %s", answer.problem);
@@ -168,10 +169,9 @@ void NatsTransport::read() {
 void NatsTransport::finishReading(const NatsConnection::Stream& found) {
   if (stream.made != 0 && found.made != stream.made)
     platform::hearthLog("cloud").default_("the engine's stream of account %s was made anew", place.account);
-  const bool isChanged = found.made != stream.made || found.last != stream.last;
   stream = found;
   takeInbox();
-  if (isChanged) forgetOthers();
+  forgetOthers();  // a purge leaves no other number
   retry.succeeded();
   attempts = 0;
   {
@@ -204,8 +204,17 @@ void NatsTransport::publish(const std::string& device, std::string document) {
        [](NatsTransport& self, const Answer& answer) {
          if (!answer.isCurrent) return;
          self.client->published(answer.error, answer.problem);
+         if (self.isCutOff(answer)) return self.lose(answer.problem);
          if (answer.error && answer.error != std::errc::message_size) self.fail(answer);
        });
+}
+
+// Documents get no answer from here, though the stream can be read: a server that has come back may not learn
+// what the others want to hear. Each of the others has one try.
+bool NatsTransport::isCutOff(const Answer& publishing) {
+  if (!publishing.error) moves = 0;
+  const bool wasUnanswered = std::exchange(isUnanswered, publishing.error == Outcome::timedOut);
+  return isUnanswered && wasUnanswered && ++moves < place.servers.size();
 }
 
 void NatsTransport::forget(const std::string& device, std::function<void(const std::string&)> done) {
@@ -232,7 +241,7 @@ void NatsTransport::fail(const Answer& answer) {
 void NatsTransport::lose(const std::string& problem) {
   if (connection) connection->close();
   connection.reset();
-  isConnected = isBusy = false;
+  isConnected = isBusy = isUnanswered = false;
   stream = {};
   tryAgain(problem);
   client->disconnected(problem);

@@ -68,6 +68,7 @@ class NatsTransport : public Transport, public std::enable_shared_from_this<Nats
   void read();
   void finishReading(const NatsConnection::Stream& found);
   void forgetOthers();
+  bool isCutOff(const Answer& publishing);
   void fail(const Answer& answer);
   void lose(const std::string& problem);
   void tryAgain(const std::string& problem);
@@ -77,11 +78,13 @@ class NatsTransport : public Transport, public std::enable_shared_from_this<Nats
   const Place place;
   TransportClient* client = nullptr;
 
-  Connection connection;     // none while there is no server
-  bool isConnected = false;  // and everything was read
-  bool isBusy = false;       // connecting or reading
-  std::size_t server = 0;    // whose turn it is, of the servers
-  std::size_t attempts = 0;  // since there was a connection, or since the last pause
+  Connection connection;      // none while there is no server
+  bool isConnected = false;   // and everything was read
+  bool isBusy = false;        // connecting or reading
+  std::size_t server = 0;     // whose turn it is, of the servers
+  std::size_t attempts = 0;   // since there was a connection, or since the last pause
+  bool isUnanswered = false;  // the last publish
+  std::size_t moves = 0;      // to another server, since something was published
   Retry retry;
   std::optional<Steady> due;      // the next reading or attempt to connect
   NatsConnection::Stream stream;  // as it was read on this connection
