@@ -28,7 +28,7 @@ const std::map<std::string, std::string> layers = {
     {"hearthd/", "\"platform/|\"hearthd/|<systemd/|<CLI/|<sys/|<linux/|POSIX"},
     {"hearthd/core/", "\"platform/(?!linux/)|\"hearthd/core/"},
     {"cloudsyncd/", "\"platform/|\"cloudsyncd/|\"pairwelld/Names.hpp|<sys/|POSIX"},
-    {"cloudsyncd/NatsConnection.cpp", "\"platform/Result.hpp\"|\"cloudsyncd/|<nats/"},
+    {"cloudsyncd/NatsConnection.cpp", "\"platform/Result.hpp\"|\"cloudsyncd/|<nats/|<time.h>|POSIX"},
     // Of the replica's file it knows the form, which is pairwelld's, too; it opens none.
     {"cloudsyncd/core/",
      "\"platform/(?!linux/)|\"platform/linux/(CloudReplica|SettingsDocument).hpp|\"cloudsyncd/core/"},
