@@ -23,9 +23,9 @@ namespace cloudsync {
 
 // Changes come as they are published, by a plain subscription: it goes on while the stream has no leader.
 // What it may have missed is read from the stream: when a connection begins, and soon after, as servers learn
-// of a new subscription one after the other; after a publish that failed or messages that were lost; and
-// every quarter of an hour, as a broken route between servers loses messages without a word. A connection
-// whose server answers no more is given up for another's.
+// of a new subscription one after the other; after a publish that failed, messages that were lost, or others
+// that came while it was read; and every quarter of an hour, as a broken route between servers loses messages
+// without a word. A connection whose server answers no more is given up for another's.
 class NatsTransport : public Transport, public std::enable_shared_from_this<NatsTransport> {
  public:
   struct Place {
@@ -96,7 +96,7 @@ class NatsTransport : public Transport, public std::enable_shared_from_this<Nats
   // no more room than the devices do.
   std::mutex mutex;
   std::map<std::string, std::string> inbox;  // empty: removed
-  std::set<std::string> heard;               // while a reading is under way, whose is then older
+  std::set<std::string> heard;               // since a reading began, which then drops what it reads of them
 
   // One call at a time, and the receiving. They end before what they use.
   platform::linux_::ThreadPool calls{1}, receiving{1};
