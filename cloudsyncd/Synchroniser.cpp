@@ -56,6 +56,8 @@ void Synchroniser::received(const std::string& name, std::string_view text) {
   std::string why;
   auto document = decodeDocument(text, around.account, name, around.wall.now(), why);
   if (!document) return refuse(name, why);
+  // An engine may pass on what it does not keep: that is told by its answer.
+  if (isPublishing && document->writer == around.writer && document->entries == underWay.entries) return;
   Device& device = devices[name];
   device.problem.clear();
   device.entries = std::move(document->entries);

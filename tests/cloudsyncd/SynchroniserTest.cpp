@@ -116,6 +116,8 @@ TEST_F(SynchroniserTest, PublishesOwnWritesTogetherAndNothingThatItMerged) {
     if (!transport.sent.empty()) break;
     now += std::chrono::milliseconds(20);
   }
+  synchroniser.received(transport.sent.at(0).first, transport.sent.at(0).second);
+  EXPECT_THAT(synchroniser.status().waiting, ElementsAre("key")) << "heard of, but not answered for";
   synchroniser.disconnected("away");  // takes what is under way with it
   write("later", 1);
   EXPECT_FALSE(synchroniser.deadline());
