@@ -32,11 +32,15 @@ std::string refusal(const Dictionary& fields, const std::string& account, const 
   if (textIn(fields, "writer").empty()) return "it has no writer";
   const auto* values = platform::find<Dictionary>(fields, "values");
   if (!values) return "it has no values";
+  for (const auto& [key, value] : *values) {
+    if (!CloudEntry::fromValue(value)) return "it has an entry of another form";
+  }
   if (platform::linux_::cloudValues(*values).size() > documentKeys)
     return "it has more than " + std::to_string(documentKeys) + " keys";
   return "";
 }
 
+// A person's edit may have left others in the replica, where they count as not there.
 Dictionary validEntries(const Dictionary& values) {
   Dictionary entries;
   for (const auto& [key, value] : values) {
@@ -61,7 +65,7 @@ Result<std::string> encodeDocument(const Document& document) {
                                                 {"account", document.account},
                                                 {"device", document.device},
                                                 {"writer", document.writer},
-                                                {"values", document.entries}});
+                                                {"values", validEntries(document.entries)}});
   if (text && text->size() > documentBytes) return Outcome::tooLarge;
   return text;
 }
@@ -80,8 +84,7 @@ Result<Document> decodeDocument(std::string_view text, const std::string& accoun
   }
   problem = refusal(*fields, account, device);
   if (!problem.empty()) return Outcome::malformedFile;
-  Document document{account, device, textIn(*fields, "writer"),
-                    validEntries(platform::linux_::settingsValues(*fields))};
+  Document document{account, device, textIn(*fields, "writer"), platform::linux_::settingsValues(*fields)};
   constexpr double hundredYears = 3.2e9;
   if (newestStamp(document.entries) <= (now.count() + hundredYears) * 1e6) return document;
   problem = "it has an entry that is stamped more than a hundred years ahead";

@@ -26,9 +26,8 @@ platform::Result<std::string> encodeDocument(const Document& document);
 
 // `device` is the name under which it was found. Outcome::malformedFile for everything else than a whole
 // document of that device, of this account and of the one format that is known; `problem` says why, in words
-// that do not vary from one repetition to the next. Entries that are none are left out. No clock is a hundred
-// years ahead of `now`, this device's; an entry that claims it could have the last of all stamps, and nobody
-// could write over it.
+// that do not vary from one repetition to the next. No clock is a hundred years ahead of `now`, this
+// device's; an entry that claims it could have the last of all stamps, and nobody could write over it.
 platform::Result<Document> decodeDocument(std::string_view text, const std::string& account,
                                           const std::string& device, platform::Time now,
                                           std::string& problem);

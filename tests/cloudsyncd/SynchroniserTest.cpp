@@ -144,6 +144,8 @@ TEST_F(SynchroniserTest, RefusesBadDocumentsWithOneLineEach) {
       {good.substr(0, good.size() / 2), "does not parse"},
       {with("\"format\": 1", "\"format\": 2"), "its format version is not 1"},
       {with("\"home\"", "\"work\""), "it is of another account"},
+      {with("\"tick\": 0", "\"tick\": \"0\""), "it has an entry of another form"},
+      {with("\"writer\": \"w\"", "\"writer\": 1"), "it has no writer"},
       {document("other", {}), "it is of another device"},
       {std::string(documentBytes + 1, ' '), "larger than 1048576 bytes"},
       {document("peer", {{"key", entry(1, std::int64_t{1} << 60)}}), "more than a hundred years ahead"},
