@@ -26,19 +26,19 @@ sockaddr_in local(int port) {
   return address;
 }
 
-// And its port.
+// On a port that is free, and below those that connections get: a server that is started again must find it
+// free once more.
 std::pair<UniqueDescriptor, int> listening() {
-  UniqueDescriptor socket(::socket(AF_INET, SOCK_STREAM, 0));
-  sockaddr_in address = local(0);
-  socklen_t size = sizeof address;
-  auto* plain = reinterpret_cast<sockaddr*>(&address);
-  if (::bind(socket.get(), plain, size) != 0 || ::listen(socket.get(), 1) != 0 ||
-      ::getsockname(socket.get(), plain, &size) != 0)
-    std::abort();
-  return {std::move(socket), ntohs(address.sin_port)};
+  static int port = 10'000 + ::getpid() % 1'000 * 20;
+  for (int attempt = 0; attempt < 1'000; ++attempt) {
+    UniqueDescriptor socket(::socket(AF_INET, SOCK_STREAM, 0));
+    const sockaddr_in address = local(++port);
+    if (::bind(socket.get(), reinterpret_cast<const sockaddr*>(&address), sizeof address) == 0 &&
+        ::listen(socket.get(), 1) == 0)
+      return {std::move(socket), port};
+  }
+  std::abort();
 }
-
-// The kernel gives it to nobody else soon.
 int freePort() { return listening().second; }
 
 struct NatsTest : Account {
