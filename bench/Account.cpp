@@ -1,15 +1,17 @@
 #include "bench/Account.hpp"
 
-#include <stdlib.h>
-
+#include <algorithm>
 #include <chrono>
-#include <filesystem>
+#include <cstddef>
+#include <cstdint>
 #include <memory>
+#include <optional>
 #include <stdexcept>
 #include <thread>
 #include <vector>
 
 #include "bench/Peers.hpp"
+#include "bench/Process.hpp"
 #include "bench/Report.hpp"
 #include "pairwelld/Names.hpp"
 #include "platform/NotificationCentre.hpp"
@@ -27,14 +29,6 @@ using platform::linux_::BusClient;
 constexpr std::size_t switches = 200;
 constexpr int changes = 1000;
 
-std::string makeFolder() {
-  char name[] = "/tmp/pairwell-bench-XXXXXX";
-  if (!::mkdtemp(name)) throw std::runtime_error("no temporary folder");
-  return name;
-}
-
-std::string options(const std::string& share) { return "--cloud dir:" + share + " --account bench"; }
-
 // The cloud store of a device, as another process of it sees it.
 struct Store {
   explicit Store(const Device& device)
@@ -45,15 +39,6 @@ struct Store {
   platform::linux_::LinuxClock clock;
   const std::shared_ptr<platform::linux_::ReplicaFileCloudStore> store;
 };
-
-template <class Condition>
-void await(const char* what, Condition condition) {
-  const auto deadline = std::chrono::steady_clock::now() + 60s;
-  while (!condition()) {
-    if (std::chrono::steady_clock::now() > deadline) throw std::runtime_error(what);
-    std::this_thread::sleep_for(1ms);
-  }
-}
 
 void control(Device& device, const char* action) {
   call(*device.hearthdClient(), platform::linux_::hearthInterface(), "ControlJob",
@@ -70,43 +55,75 @@ void switchTo(bool state, BusClient& from, BusClient& to, BusClient& announcemen
 
 }  // namespace
 
-Account::Account(const std::string& programs, const std::string& benchmark)
-    : folder(makeFolder()),
-      share(folder + "/share"),
-      one(programs, benchmark, options(share)),
-      two(programs, benchmark, options(share)) {
-  std::filesystem::create_directory(share);
+Account::Account(const std::string& programs, const std::string& options)
+    : one(programs, options), two(programs, options) {
   one.start();
   two.start();
 }
 
-Account::~Account() {
-  one.stop();
-  two.stop();
-  std::filesystem::remove_all(folder);
-}
-
-void Account::measureSwitches() {
+void Account::measureSwitches(const std::string& what) {
   const auto from = one.client(), to = two.client(), announcements = two.hearthdClient();
   watch(*announcements, pairwell::names::settingsChanged);
   std::vector<double> times;
-  for (std::size_t count = 0; count < switches; ++count) {
+  for (std::size_t count = 0; count <= switches; ++count) {
     const double start = now();
     switchTo(true, *from, *to, *announcements);
-    times.push_back((now() - start) / 1000);
+    if (count > 0) times.push_back((now() - start) / 1000);  // at first the two may not be connected yet
     switchTo(false, *from, *to, *announcements);
   }
-  report("on at one device to on at another", percentiles(times), "ms");
+  report(what, percentiles(times), "ms");
 }
 
-void Account::measureCatchingUp() {
+// Each switch is followed by a number of its own, so that it shows which of them the other device has.
+void Account::measureLossOfLeaders(Cluster& cluster) {
+  constexpr std::int64_t count = 60;
+  constexpr double between = 500'000;
+  const std::string key = "bench";
+  const auto client = one.client(), announcements = one.hearthdClient(), other = two.client();
+  watch(*announcements, pairwell::names::settingsChanged);
+  Store here(one), there(two);
+  std::vector<double> starts;
+  double longest = 0;
+  std::int64_t seen = 0, overtaken = 0;
+  std::optional<std::size_t> killed;
+  const auto look = [&] {
+    const auto all = there.store->dictionaryRepresentation();
+    const auto* number = platform::find<std::int64_t>(all, key);
+    const auto found = number ? *number : 0;
+    if (found > seen) overtaken += found - seen - 1;
+    for (; seen < found; ++seen)
+      longest = std::max(longest, now() - starts.at(static_cast<std::size_t>(seen)));
+  };
+  for (std::int64_t number = 1; number <= count; ++number) {
+    if (number == 10 || number == 40) {
+      await("the stream has no leader", [&] { return (killed = cluster.leaderOf(Cluster::stream(0))); });
+      cluster.kill(*killed);
+    } else if (number == 20) {
+      cluster.start(*killed);
+    }
+    starts.push_back(now());
+    switchTo(number % 2 != 0, *client, *client, *announcements);
+    if (!here.store->write(number, key)) throw std::runtime_error("a change failed");
+    for (const double next = starts.back() + between; now() < next; std::this_thread::sleep_for(1ms)) look();
+  }
+  await("a switch is lost", [&] {
+    look();
+    return seen == count && here.store->dictionaryRepresentation() == there.store->dictionaryRepresentation();
+  });
+  await("a switch is not followed", [&] {
+    return call(*other, clientInterface(), "KestrelAudioAccessoryLimitedLogging") == platform::List{false};
+  });
+  report("60 switches, 2 leaders killed, longest wait", longest / 1000, "ms");
+  report("60 switches, 2 leaders killed, overtaken", static_cast<double>(overtaken), "");
+}
+
+void Account::measureCatchingUp(const std::string& documents) {
   control(two, "stop");
   Store here(one), there(two);
   const auto key = [](int number) { return "bench" + std::to_string(number); };
   for (int number = 0; number < changes; ++number) {
     if (!here.store->write(std::int64_t{number}, key(number))) throw std::runtime_error("a change failed");
   }
-  const std::string documents = share + "/bench/";
   await("the changes are not published", [&] {
     const auto names = here.files.list(documents);
     for (const std::string& name : names ? *names : std::vector<std::string>()) {

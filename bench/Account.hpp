@@ -1,26 +1,28 @@
-// Two devices that share an account in a folder.
+// Two devices that share an account.
 #pragma once
 
 #include <string>
 
+#include "bench/Cluster.hpp"
 #include "bench/Device.hpp"
 
 namespace bench {
 
 class Account {
  public:
-  Account(const std::string& programs, const std::string& benchmark);
-  ~Account();  // removes the folder, after the devices
+  // `options` are hearthctl init's that say which account.
+  Account(const std::string& programs, const std::string& options);
 
   Device& member() { return one; }
   // From "on" at one device to its announcement at the other.
-  void measureSwitches();
-  // One is away while the other changes much; leaves both with all that.
-  void measureCatchingUp();
+  void measureSwitches(const std::string& what);
+  // One switches on and on, while servers that lead the account's stream are killed: how long the other is
+  // behind, and that it ends with the same.
+  void measureLossOfLeaders(Cluster& cluster);
+  // One is away while the other changes much; leaves both with all that. `documents` is the account's folder.
+  void measureCatchingUp(const std::string& documents);
 
  private:
-  // The shared one lies in one of its own: whatever happens beside it would wake the devices.
-  const std::string folder, share;
   Device one, two;
 };
 

@@ -1,18 +1,16 @@
 // Measures a whole device beside the bare work, in one run. Usage: pairwell_bench PROGRAMS OUTPUT.json
-#include <unistd.h>
-
 #include <cstdio>
-#include <filesystem>
-#include <fstream>
+#include <exception>
 #include <map>
-#include <stdexcept>
 #include <string>
 #include <thread>
-#include <utility>
+#include <vector>
 
 #include "bench/Account.hpp"
+#include "bench/Cluster.hpp"
 #include "bench/Device.hpp"
 #include "bench/Peers.hpp"
+#include "bench/Process.hpp"
 #include "bench/Report.hpp"
 
 namespace bench {
@@ -73,35 +71,12 @@ void measureSwitches(Device& device) {
   report("switch / bare calls, p50", ours.p50 / bare.p50, "x");
 }
 
-long statusNumber(pid_t pid, const std::string& task, const std::string& field) {
-  std::ifstream status("/proc/" + std::to_string(pid) + task + "/status");
-  for (std::string line; std::getline(status, line);) {
-    if (line.compare(0, field.size(), field) == 0) return std::stol(line.substr(field.size() + 1));
-  }
-  throw std::runtime_error("no " + field);
-}
-
-long wakeUps(pid_t pid) {
-  long sum = 0;
-  for (const auto& task : std::filesystem::directory_iterator("/proc/" + std::to_string(pid) + "/task")) {
-    sum += statusNumber(pid, "/task/" + task.path().filename().string(), "voluntary_ctxt_switches");
-  }
-  return sum;
-}
-
 void reportMemory(const std::string& name, pid_t pid) {
-  const auto mebibytes = [&](const char* field) {
-    return static_cast<double>(statusNumber(pid, "", field)) / 1024;
-  };
-  report(name + ", resident", mebibytes("VmRSS"), "MiB");
-  report(name + ", resident and not shared", mebibytes("RssAnon"), "MiB");
+  report(name + ", resident", residentMebibytes(pid), "MiB");
+  report(name + ", resident and not shared", residentMebibytes(pid, "RssAnon"), "MiB");
 }
 
-// `member` shares an account.
-void measureIdle(Device& device, Device& member) {
-  const std::pair<std::string, pid_t> processes[] = {{"pairwelld", device.job("pairwelld")},
-                                                     {"hearthd", device.hearthd()},
-                                                     {"cloudsyncd", member.job("cloudsyncd")}};
+void measureIdle(const std::map<std::string, pid_t>& processes) {
   for (const auto& [name, pid] : processes) reportMemory(name, pid);
   std::this_thread::sleep_for(1s);  // answers to the clients that just left
   std::map<std::string, long> before;
@@ -124,19 +99,24 @@ void measureStarts(Device& device) {
 }
 
 void run(const std::string& programs, const std::string& output) {
-  char self[4096];
-  const ssize_t length = ::readlink("/proc/self/exe", self, sizeof self);
-  const std::string benchmark(self, static_cast<std::size_t>(length));
-  Device device(programs, benchmark);
+  Device device(programs);
   device.start();
   measureReads(device);
   measureSwitches(device);
   measureStarts(device);
   device.client();
-  Account account(programs, benchmark);
-  account.measureSwitches();
-  measureIdle(device, account.member());
-  account.measureCatchingUp();
+  const TemporaryFolder share;
+  Account account(programs, "--cloud dir:" + share.path + " --account bench");
+  account.measureSwitches("on at one device to on at another");
+  Cluster cluster;
+  Account distant(programs, cluster.initOptions());
+  distant.measureSwitches("on at one device to on at another, over NATS");
+  measureIdle({{"pairwelld", device.job("pairwelld")},
+               {"hearthd", device.hearthd()},
+               {"cloudsyncd", account.member().job("cloudsyncd")},
+               {"cloudsyncd over NATS", distant.member().job("cloudsyncd")}});
+  distant.measureLossOfLeaders(cluster);
+  account.measureCatchingUp(share.path + "/bench/");
   reportMemory("cloudsyncd with 1000 keys", account.member().job("cloudsyncd"));
   writeReport(output);
 }

@@ -10,7 +10,6 @@
 #include <filesystem>
 #include <fstream>
 #include <stdexcept>
-#include <thread>
 #include <utility>
 
 #include "platform/linux/BusServiceListener.hpp"
@@ -21,33 +20,28 @@ namespace bench {
 namespace fs = std::filesystem;
 using platform::linux_::BusClient;
 
-Device::Device(const std::string& programs, const std::string& benchmark, const std::string& options) {
-  char name[] = "/tmp/pairwell-bench-XXXXXX";
-  if (!::mkdtemp(name)) throw std::runtime_error("no temporary folder");
-  root = name;
-  _paths = platform::linux_::Paths::under(root);
-  fs::create_directory(root + "/bin");
+Device::Device(const std::string& programs, const std::string& options) {
+  _paths = platform::linux_::Paths::under(root.path);
+  fs::create_directory(root.path + "/bin");
   for (const char* program : {"hearthd", "pairwelld", "cloudsyncd", "hearthctl", "pairwellctl"}) {
-    fs::copy_file(programs + "/" + program, root + "/bin/" + program);
+    fs::copy_file(programs + "/" + program, root.path + "/bin/" + program);
   }
-  const std::string init = root + "/bin/hearthctl --root " + root + " init " + options + " >/dev/null";
+  const std::string init =
+      root.path + "/bin/hearthctl --root " + root.path + " init " + options + " >/dev/null";
   if (std::system(init.c_str()) != 0) throw std::runtime_error("hearthctl init failed");
   std::ofstream(_paths.entitlements() + "/bench.json")
-      << "{\"executable\": \"" << benchmark << "\", \"entitlements\": {\""
+      << "{\"executable\": \"" << thisProgram() << "\", \"entitlements\": {\""
       << pairwell::names::systemEntitlement << "\": true}}\n";
 }
 
-Device::~Device() {
-  stop();
-  fs::remove_all(root);
-}
+Device::~Device() { stop(); }
 
 void Device::start() {
   pid = ::fork();
   if (pid == 0) {
-    if (!std::freopen((root + "/log").c_str(), "a", stderr)) ::_exit(126);
-    const std::string program = root + "/bin/hearthd";
-    ::execl(program.c_str(), "hearthd", "--root", root.c_str(), nullptr);
+    if (!std::freopen((root.path + "/log").c_str(), "a", stderr)) ::_exit(126);
+    const std::string program = root.path + "/bin/hearthd";
+    ::execl(program.c_str(), "hearthd", "--root", root.path.c_str(), nullptr);
     ::_exit(127);
   }
 }
@@ -60,28 +54,28 @@ void Device::stop() {
 }
 
 pid_t Device::job(const std::string& program) const {
-  const auto deadline = std::chrono::steady_clock::now() + std::chrono::seconds(10);
   const std::string process = "/proc/" + std::to_string(pid);
-  while (std::chrono::steady_clock::now() < deadline) {
+  pid_t child = -1;
+  await(program + " does not run", [&] {
     std::ifstream children(process + "/task/" + std::to_string(pid) + "/children");
-    for (pid_t child; children >> child;) {
+    while (children >> child) {
       std::string name;
       std::getline(std::ifstream("/proc/" + std::to_string(child) + "/comm"), name);
-      if (name == program) return child;
+      if (name == program) return true;
     }
-    std::this_thread::sleep_for(std::chrono::milliseconds(1));
-  }
-  throw std::runtime_error(program + " does not run");
+    return false;
+  });
+  return child;
 }
 
 std::unique_ptr<BusClient> Device::connect(const std::string& socket) {
-  const auto deadline = std::chrono::steady_clock::now() + std::chrono::seconds(10);
-  while (std::chrono::steady_clock::now() < deadline) {
+  std::unique_ptr<BusClient> connected;
+  await(socket + ": nobody answers", [&] {
     auto client = BusClient::connect(socket, std::chrono::seconds(5));
-    if (client) return std::move(*client);
-    std::this_thread::sleep_for(std::chrono::microseconds(200));
-  }
-  throw std::runtime_error(socket + ": nobody answers");
+    if (client) connected = std::move(*client);
+    return connected != nullptr;
+  });
+  return connected;
 }
 
 platform::List call(BusClient& client, const platform::linux_::BusInterface& interface,

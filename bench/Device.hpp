@@ -7,6 +7,7 @@
 #include <string>
 #include <string_view>
 
+#include "bench/Process.hpp"
 #include "pairwelld/Names.hpp"
 #include "platform/linux/BusClient.hpp"
 #include "platform/linux/Paths.hpp"
@@ -16,10 +17,10 @@ namespace bench {
 class Device {
  public:
   // `programs` is the folder of the built programs; they are copied into the root, so that their owner and
-  // mode serve the entitlement files. `benchmark` is this program: it is granted the client's entitlement.
+  // mode serve the entitlement files. This program is granted the client's entitlement.
   // `options` are further ones of hearthctl init.
-  Device(const std::string& programs, const std::string& benchmark, const std::string& options = "");
-  ~Device();  // ends hearthd and removes the root
+  explicit Device(const std::string& programs, const std::string& options = "");
+  ~Device();  // ends hearthd
 
   void start();
   void stop();
@@ -39,7 +40,7 @@ class Device {
  private:
   static std::unique_ptr<platform::linux_::BusClient> connect(const std::string& socket);
 
-  std::string root;
+  const TemporaryFolder root;
   platform::linux_::Paths _paths;
   pid_t pid = -1;
 };

@@ -34,6 +34,14 @@ void report(const std::string& what, double figure, const char* unit) {
   results.emplace(what, Dictionary{{"value", figure}, {"unit", unit}});
 }
 
+void report(const std::string& what, const std::vector<double>& figures, const char* unit) {
+  std::printf("%-46s", what.c_str());
+  for (const double figure : figures) std::printf(" %13.2f", figure);
+  std::printf(" %s\n", unit);
+  std::fflush(stdout);
+  results.emplace(what, Dictionary{{"each", platform::List(figures.begin(), figures.end())}, {"unit", unit}});
+}
+
 void writeReport(const std::string& path) {
   const auto text = platform::linux_::printJson(results, platform::linux_::JsonStyle::indented);
   if (!text || !(std::ofstream(path) << *text << '\n')) throw std::runtime_error("cannot write " + path);

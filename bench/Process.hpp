@@ -1,0 +1,47 @@
+// What the benchmarks see of processes, their own folders, and of what takes its time.
+#pragma once
+
+#include <stdlib.h>
+#include <sys/types.h>
+
+#include <chrono>
+#include <cstddef>
+#include <filesystem>
+#include <stdexcept>
+#include <string>
+#include <thread>
+
+namespace bench {
+
+class TemporaryFolder {
+ public:
+  TemporaryFolder() {
+    char name[] = "/tmp/pairwell-bench-XXXXXX";
+    if (!::mkdtemp(name)) throw std::runtime_error("no temporary folder");
+    path = name;
+  }
+  TemporaryFolder(const TemporaryFolder&) = delete;
+  ~TemporaryFolder() { std::filesystem::remove_all(path); }
+  std::string path;
+};
+
+// `what` is the complaint if it takes too long.
+template <class Condition>
+void await(const std::string& what, Condition condition,
+           std::chrono::seconds limit = std::chrono::seconds(60)) {
+  const auto deadline = std::chrono::steady_clock::now() + limit;
+  while (!condition()) {
+    if (std::chrono::steady_clock::now() > deadline) throw std::runtime_error(what);
+    std::this_thread::sleep_for(std::chrono::microseconds(200));
+  }
+}
+
+std::string thisProgram();
+// A field of /proc/PID/status; of a thread, `task` is "/task/TID".
+long statusNumber(pid_t pid, const std::string& field, const std::string& task = "");
+double residentMebibytes(pid_t pid, const std::string& field = "VmRSS");
+long wakeUps(pid_t pid);
+std::size_t openDescriptors(pid_t pid);
+double processorSeconds(pid_t pid);  // used since its start
+
+}  // namespace bench
