@@ -220,8 +220,10 @@ bool NatsConnection::isAlive() {
 Result<NatsConnection::Stream> NatsConnection::stream(std::string& problem) {
   auto found = lookUp(problem);
   if (found || found.error() != std::errc::no_such_file_or_directory) return found;
-  if (const auto made = makeStream(problem); !made) return made.error();
-  return lookUp(problem);
+  const auto made = makeStream(problem);
+  std::string ignored;  // another device may have made it meanwhile, and so the account has its one
+  found = lookUp(made ? problem : ignored);
+  return found || made ? found : made.error();
 }
 
 Result<NatsConnection::Stream> NatsConnection::lookUp(std::string& problem) {
