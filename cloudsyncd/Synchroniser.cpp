@@ -1,6 +1,8 @@
 #include "cloudsyncd/Synchroniser.hpp"
 
 #include <algorithm>
+#include <functional>
+#include <string_view>
 #include <utility>
 
 #include "cloudsyncd/core/Document.hpp"
@@ -55,11 +57,21 @@ void Synchroniser::received(const std::string& name, std::string_view text) {
   seen.insert(name);
   std::string why;
   auto document = decodeDocument(text, around.account, name, around.wall.now(), why);
-  if (!document) return refuse(name, why);
+  if (!document) {
+    refuse(name, why);
+    // Somebody has written over it. What is refused as it was sent would be so again.
+    if (name == ownDevice() && std::hash<std::string_view>()(text) != sentText) {
+      devices[name].entries.clear();
+      publishIfNews();
+    }
+    return;
+  }
   // An engine may pass on what it does not keep: that is told by its answer.
   if (isPublishing && document->writer == around.writer && document->entries == underWay.entries) return;
   Device& device = devices[name];
   device.problem.clear();
+  // An engine may have gone back to an older one, or somebody has put it there; its device may be off.
+  const bool hasGoneBack = !newsIn(device.entries, document->entries).empty();
   device.entries = std::move(document->entries);
   const auto replica = around.replica.contents();
   if (name == ownDevice() && document->writer != around.writer && !isOwnWriter(*replica, document->writer) &&
@@ -72,7 +84,7 @@ void Synchroniser::received(const std::string& name, std::string_view text) {
   // What comes before the connection stands is taken in as one.
   if (!isConnected) return;
   takeIn(device.entries);
-  if (name == ownDevice()) publishIfNews();  // an engine may have gone back to an older one
+  if (hasGoneBack) publishIfNews();
 }
 
 void Synchroniser::unreadable(const std::string& device, const std::string& why) {
@@ -201,11 +213,12 @@ void Synchroniser::publish() {
   }
   const auto text = encode();
   if (!text) {
-    if (text.error() == Outcome::tooLarge) return exceedsQuota();
+    if (text.error() == Outcome::tooLarge) return pacing.sent(), exceedsQuota();
     return fail(sending, cannotPublish + text.error().message());
   }
   pacing.sent();
   isPublishing = true;
+  sentText = std::hash<std::string_view>()(*text);
   around.transport.publish(underWay.device, *text);
 }
 
@@ -225,20 +238,20 @@ Result<std::string> Synchroniser::encode() {
 void Synchroniser::published(const std::error_code& error, const std::string& problem_) {
   isPublishing = false;
   deadlineMoved();
-  if (error == std::errc::message_size) return exceedsQuota();
-  if (error) {
-    pacing.written(around.steady());
-    return fail(sending, cannotPublish + problem_);
+  if (error) pacing.written(around.steady());
+  if (error == std::errc::message_size) {
+    sending.failed(around.steady(), "");  // the engine's limit may be raised
+    return exceedsQuota();
   }
+  if (error) return fail(sending, cannotPublish + problem_);
   lastOut = around.wall.now();
   isOverQuota = false;
   sending.succeeded();
   devices[underWay.device] = {std::move(underWay.entries), ""};
 }
 
-// What was written stays here, until another write makes it smaller.
+// What was written stays here: until another write makes it smaller, where the quota is the documents' own.
 void Synchroniser::exceedsQuota() {
-  pacing.sent();
   if (std::exchange(isOverQuota, true)) return;
   log().error("the settings exceed what an account may hold: the change stays on this device");
   const auto told = around.replica.update([](Dictionary& replica) {

@@ -1,6 +1,7 @@
 // Keeps the local replica and the account's other devices in step.
 #pragma once
 
+#include <cstddef>
 #include <functional>
 #include <map>
 #include <optional>
@@ -102,7 +103,8 @@ class Synchroniser : public TransportClient {
   Pacing pacing;
   Retry taking, sending;
   bool isPublishing = false;
-  Document underWay;  // that is being published
+  Document underWay;         // that is being published
+  std::size_t sentText = 0;  // a hash of what was published last
   std::string knownDevice;
   bool isForeign = false;  // somebody else publishes under this device's name
   bool isOverQuota = false;

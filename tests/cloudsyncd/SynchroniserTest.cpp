@@ -190,6 +190,24 @@ TEST_F(SynchroniserTest, KeepsWhatExceedsTheQuotaHereAndSaysSoOnce) {
   deliver();
   EXPECT_TRUE(publishNext());
   EXPECT_EQ(synchroniser.status().problem, "");
+
+  write("more", 2);
+  now = *synchroniser.deadline();
+  synchroniser.timePassed();
+  synchroniser.published(std::make_error_code(std::errc::message_size), "too big for the engine");
+  EXPECT_TRUE(publishNext()) << "by then the engine may take it";
+}
+
+TEST_F(SynchroniserTest, PutsBackWhatSomebodyHasReplacedByLess) {
+  make({{"account", "home"}, {"device", "me"}, {"values", Dictionary{{"key", entry(1, 5, "me")}}}});
+  connect();
+  EXPECT_TRUE(publishNext());
+  synchroniser.received("me", "{");
+  EXPECT_TRUE(publishNext());
+  synchroniser.received("peer", document("peer", {{"theirs", entry(2, 7)}}));
+  EXPECT_FALSE(publishNext()) << "that would be everybody's messages to everybody";
+  synchroniser.received("peer", document("peer", {}));
+  EXPECT_THAT(publishNext()->entries, testing::Contains(testing::Key("theirs")));
 }
 
 TEST_F(SynchroniserTest, AFullDiskAndALostReplicaHealByThemselves) {
