@@ -12,6 +12,7 @@
 #include "bench/Peers.hpp"
 #include "bench/Process.hpp"
 #include "bench/Report.hpp"
+#include "tests/fakes/RealFiles.hpp"
 
 namespace bench {
 namespace {
@@ -105,7 +106,7 @@ void run(const std::string& programs, const std::string& output) {
   measureSwitches(device);
   measureStarts(device);
   device.client();
-  const TemporaryFolder share;
+  const fakes::TemporaryFolder share;
   Account account(programs, "--cloud dir:" + share.path + " --account bench");
   account.measureSwitches("on at one device to on at another");
   Cluster cluster;

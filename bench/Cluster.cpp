@@ -1,6 +1,5 @@
 #include "bench/Cluster.hpp"
 
-#include <arpa/inet.h>
 #include <fcntl.h>
 #include <signal.h>
 #include <sys/prctl.h>
@@ -11,6 +10,7 @@
 #include <fstream>
 #include <utility>
 
+#include "bench/Process.hpp"
 #include "platform/linux/Json.hpp"
 #include "platform/linux/UniqueDescriptor.hpp"
 
@@ -21,25 +21,6 @@ using platform::Dictionary;
 using platform::linux_::UniqueDescriptor;
 
 constexpr const char* program = "/usr/sbin/nats-server";
-
-sockaddr_in local(int port) {
-  sockaddr_in address{};
-  address.sin_family = AF_INET;
-  address.sin_port = htons(static_cast<std::uint16_t>(port));
-  address.sin_addr.s_addr = htonl(INADDR_LOOPBACK);
-  return address;
-}
-
-// The kernel gives it to nobody else soon.
-int freePort() {
-  const UniqueDescriptor socket(::socket(AF_INET, SOCK_STREAM | SOCK_CLOEXEC, 0));
-  sockaddr_in address = local(0);
-  socklen_t size = sizeof address;
-  auto* plain = reinterpret_cast<sockaddr*>(&address);
-  if (::bind(socket.get(), plain, size) != 0 || ::getsockname(socket.get(), plain, &size) != 0)
-    throw std::runtime_error("no free port");
-  return ntohs(address.sin_port);
-}
 
 std::string place(int port) { return "127.0.0.1:" + std::to_string(port); }
 
@@ -63,7 +44,7 @@ std::string lastLine(const std::string& file) {
 
 std::string answerOf(int port, const std::string& path) {
   const UniqueDescriptor socket(::socket(AF_INET, SOCK_STREAM | SOCK_CLOEXEC, 0));
-  const sockaddr_in address = local(port);
+  const sockaddr_in address = fakes::loopback(port);
   const std::string request = "GET /" + path + " HTTP/1.0\r\n\r\n";
   if (::connect(socket.get(), reinterpret_cast<const sockaddr*>(&address), sizeof address) != 0 ||
       ::send(socket.get(), request.data(), request.size(), MSG_NOSIGNAL) < 0)
@@ -87,7 +68,7 @@ void forEach(const Dictionary& in, const char* list, Visit visit) {
 }  // namespace
 
 Cluster::Cluster(std::size_t accounts) {
-  for (Server& server : servers) server = {freePort(), freePort(), freePort()};
+  for (Server& server : servers) server = {fakes::freePort(), fakes::freePort(), fakes::freePort()};
   configure(accounts);
   for (std::size_t number = 0; number < size; ++number) start(number);
   await("the servers do not find together", [&] { return isReady(); });

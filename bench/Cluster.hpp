@@ -10,8 +10,8 @@
 #include <string>
 #include <vector>
 
-#include "bench/Process.hpp"
 #include "platform/Value.hpp"
+#include "tests/fakes/RealFiles.hpp"
 
 namespace bench {
 
@@ -51,7 +51,7 @@ class Cluster {
   void configure(std::size_t accounts);
   bool isReady() const;
 
-  const TemporaryFolder root;
+  const fakes::TemporaryFolder root;
   std::array<Server, size> servers;
 };
 

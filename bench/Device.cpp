@@ -12,6 +12,7 @@
 #include <stdexcept>
 #include <utility>
 
+#include "bench/Process.hpp"
 #include "platform/linux/BusServiceListener.hpp"
 #include "platform/linux/HearthInterface.hpp"
 

@@ -7,10 +7,10 @@
 #include <string>
 #include <string_view>
 
-#include "bench/Process.hpp"
 #include "pairwelld/Names.hpp"
 #include "platform/linux/BusClient.hpp"
 #include "platform/linux/Paths.hpp"
+#include "tests/fakes/RealFiles.hpp"
 
 namespace bench {
 
@@ -40,7 +40,7 @@ class Device {
  private:
   static std::unique_ptr<platform::linux_::BusClient> connect(const std::string& socket);
 
-  const TemporaryFolder root;
+  const fakes::TemporaryFolder root;
   platform::linux_::Paths _paths;
   pid_t pid = -1;
 };

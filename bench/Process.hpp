@@ -1,29 +1,15 @@
-// What the benchmarks see of processes, their own folders, and of what takes its time.
+// What the benchmarks see of processes, and of what takes its time.
 #pragma once
 
-#include <stdlib.h>
 #include <sys/types.h>
 
 #include <chrono>
 #include <cstddef>
-#include <filesystem>
 #include <stdexcept>
 #include <string>
 #include <thread>
 
 namespace bench {
-
-class TemporaryFolder {
- public:
-  TemporaryFolder() {
-    char name[] = "/tmp/pairwell-bench-XXXXXX";
-    if (!::mkdtemp(name)) throw std::runtime_error("no temporary folder");
-    path = name;
-  }
-  TemporaryFolder(const TemporaryFolder&) = delete;
-  ~TemporaryFolder() { std::filesystem::remove_all(path); }
-  std::string path;
-};
 
 // `what` is the complaint if it takes too long.
 template <class Condition>

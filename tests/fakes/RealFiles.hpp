@@ -1,10 +1,15 @@
-// Real files and sockets, for tests that go down to them, and how they wait for what nobody announces.
+// Real files and sockets, for tests and benchmarks that go down to them, and how they wait for what nobody
+// announces.
 #pragma once
 
+#include <arpa/inet.h>
+#include <netinet/in.h>
 #include <sys/socket.h>
 #include <sys/un.h>
+#include <unistd.h>
 
 #include <chrono>
+#include <cstdint>
 #include <cstdlib>
 #include <filesystem>
 #include <fstream>
@@ -12,6 +17,7 @@
 #include <sstream>
 #include <string>
 #include <thread>
+#include <utility>
 
 #include "platform/linux/UniqueDescriptor.hpp"
 
@@ -57,5 +63,28 @@ platform::linux_::UniqueDescriptor socketAt(const std::string& path, Use use, in
   if (use(socket.get(), reinterpret_cast<const sockaddr*>(&address), sizeof address) < 0) socket.reset();
   return socket;
 }
+
+inline sockaddr_in loopback(int port) {
+  sockaddr_in address{};
+  address.sin_family = AF_INET;
+  address.sin_port = htons(static_cast<std::uint16_t>(port));
+  address.sin_addr.s_addr = htonl(INADDR_LOOPBACK);
+  return address;
+}
+
+// On a port that is free, and below those that connections get: a server that is started again must find it
+// free once more.
+inline std::pair<platform::linux_::UniqueDescriptor, int> listening() {
+  static int port = 10'000 + ::getpid() % 1'000 * 20;
+  for (int attempt = 0; attempt < 1'000; ++attempt) {
+    platform::linux_::UniqueDescriptor socket(::socket(AF_INET, SOCK_STREAM | SOCK_CLOEXEC, 0));
+    const sockaddr_in address = loopback(++port);
+    if (::bind(socket.get(), reinterpret_cast<const sockaddr*>(&address), sizeof address) == 0 &&
+        ::listen(socket.get(), 1) == 0)
+      return {std::move(socket), port};
+  }
+  std::abort();
+}
+inline int freePort() { return listening().second; }
 
 }  // namespace fakes

@@ -38,13 +38,6 @@ struct Account : Device {
   void stopAll() {
     for (const auto& entry : std::map(running)) EXPECT_EQ(stop(entry.first), 0) << log(entry.first);
   }
-  std::string log(const std::string& name) const { return contents(root / (name + ".err")); }
-  std::size_t timesLogged(const std::string& name, const std::string& text) const {
-    const std::string all = log(name);
-    std::size_t count = 0;
-    for (auto at = all.find(text); at != std::string::npos; at = all.find(text, at + 1)) ++count;
-    return count;
-  }
   testing::AssertionResult comesToSay(const std::string& name, const std::string& text) {
     if (eventually([&] { return cloud(name, "status").output.find(text) != std::string::npos; }))
       return testing::AssertionSuccess();

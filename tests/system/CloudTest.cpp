@@ -51,7 +51,7 @@ TEST_F(CloudTest, FolderThatGoesAwayIsSaidAndComesBack) {
   EXPECT_TRUE(comesToSay("one", "waiting to go out  " + flagKey + ", " + endKey));
   EXPECT_THAT(cloud("one", "status").output,
               HasSubstr("problem            " + share.string() + ": No such file"));
-  EXPECT_EQ(timesLogged("one", "not connected: "), 1u);
+  EXPECT_EQ(timesLogged("not connected: ", "one"), 1u);
   fs::rename(elsewhere, share);
   EXPECT_TRUE(followsOn("two", "one"));
   EXPECT_TRUE(comesToSay("one", "waiting to go out  nothing"));
@@ -85,8 +85,8 @@ TEST_F(CloudTest, AnotherAccountIsTakenWholeOrNotAtAll) {
   EXPECT_EQ(on("one", "hearthctl", "settings list cloud").output, "theirs  2\n");
   EXPECT_TRUE(eventually([&] {
     return timesLogged(
-               "one",
-               "Cloud KVS Notification: [\"ChangeReason\": 3, \"ChangedKeys\": [\"ours\", \"theirs\"]]") == 1;
+               "Cloud KVS Notification: [\"ChangeReason\": 3, \"ChangedKeys\": [\"ours\", \"theirs\"]]",
+               "one") == 1;
   })) << log("one");
   EXPECT_THAT(contents(replica.string() + ".account-home"), HasSubstr("\"ours\""));
   // The same account elsewhere.
@@ -124,8 +124,8 @@ TEST_F(CloudTest, CopyOfADiskIsToldToTakeANewIdentity) {
   EXPECT_EQ(setting("one", endKey), "");
   EXPECT_EQ(cloud("copy", "new-identity").status, 0);
   EXPECT_TRUE(followsOn("one", "copy"));
-  EXPECT_EQ(timesLogged("copy", "publishes under this device's name"), 1u);
-  EXPECT_EQ(timesLogged("one", "publishes under this device's name"), 0u);
+  EXPECT_EQ(timesLogged("publishes under this device's name", "copy"), 1u);
+  EXPECT_EQ(timesLogged("publishes under this device's name", "one"), 0u);
 }
 
 TEST_F(CloudTest, StrangersDocumentsAreRefusedOnceAndForgotten) {
@@ -138,7 +138,7 @@ TEST_F(CloudTest, StrangersDocumentsAreRefusedOnceAndForgotten) {
     switchTo("two", "off");
     EXPECT_TRUE(followsOff("one"));
   }
-  EXPECT_EQ(timesLogged("one", problem), 1u) << log("one");
+  EXPECT_EQ(timesLogged(problem, "one"), 1u) << log("one");
   EXPECT_TRUE(comesToSay("one", "device             stranger, newest change never, refused: "));
   write("share/precious.json", "");
   EXPECT_EQ(cloud("one", "forget ../precious").status, 1);
@@ -169,7 +169,7 @@ TEST_F(CloudTest, WhatIsWrongIsSaidBeforeAnythingIsWritten) {
 
   write("one/etc/cloud.json", "{\n oops}");
   start("one");
-  EXPECT_EQ(timesLogged("one", "one/etc/cloud.json: line 2"), 1u) << log("one");
+  EXPECT_EQ(timesLogged("one/etc/cloud.json: line 2", "one"), 1u) << log("one");
   EXPECT_THAT(on("one", "hearthctl", "check").output, HasSubstr("one/etc/cloud.json: line 2"));
   EXPECT_EQ(cloud("one", "use '" + url + "?poll=0.1' --account home").status, 0) << "which mends it";
   start("two");

@@ -87,9 +87,10 @@ struct Device : testing::Test {
     ::kill(hearthd, signal);
     return finish(std::exchange(hearthd, -1), "hearthd").status;
   }
-  std::string log() const { return contents(root / "hearthd.err"); }
-  std::size_t timesLogged(const std::string& text) const {
-    const std::string all = log();
+  // `of` is a name that spawn() was given.
+  std::string log(const std::string& of = "hearthd") const { return contents(root / (of + ".err")); }
+  std::size_t timesLogged(const std::string& text, const std::string& of = "hearthd") const {
+    const std::string all = log(of);
     std::size_t count = 0;
     for (auto at = all.find(text); at != std::string::npos; at = all.find(text, at + 1)) ++count;
     return count;
