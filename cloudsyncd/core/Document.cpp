@@ -1,6 +1,5 @@
 #include "cloudsyncd/core/Document.hpp"
 
-#include <algorithm>
 #include <cstdint>
 
 #include "platform/linux/CloudReplica.hpp"
@@ -23,7 +22,9 @@ std::string textIn(const Dictionary& fields, std::string_view name) {
 }
 
 // Why it is no document of that device; empty if it is.
-std::string refusal(const Dictionary& fields, const std::string& account, const std::string& device) {
+std::string refusal(const Dictionary& fields, const std::string& account, const std::string& device,
+                    platform::Time now) {
+  constexpr double hundredYears = 3.2e9;
   const auto* format = platform::find<std::int64_t>(fields, "format");
   if (!format) return "it has no format version";
   if (*format != formatVersion) return "its format version is not " + std::to_string(formatVersion);
@@ -33,7 +34,10 @@ std::string refusal(const Dictionary& fields, const std::string& account, const 
   const auto* values = platform::find<Dictionary>(fields, "values");
   if (!values) return "it has no values";
   for (const auto& [key, value] : *values) {
-    if (!CloudEntry::fromValue(value)) return "it has an entry of another form";
+    const auto entry = CloudEntry::fromValue(value);
+    if (!entry) return "it has an entry of another form";
+    if (static_cast<double>(entry->stamp.microseconds) > (now.count() + hundredYears) * 1e6)
+      return "it has an entry that is stamped more than a hundred years ahead";
   }
   if (platform::linux_::cloudValues(*values).size() > documentKeys)
     return "it has more than " + std::to_string(documentKeys) + " keys";
@@ -47,14 +51,6 @@ Dictionary validEntries(const Dictionary& values) {
     if (CloudEntry::fromValue(value)) entries.emplace(key, value);
   }
   return entries;
-}
-
-// In microseconds since 1970.
-double newestStamp(const Dictionary& entries) {
-  std::int64_t newest = 0;
-  for (const auto& [key, value] : entries)
-    newest = std::max(newest, CloudEntry::fromValue(value)->stamp.microseconds);
-  return static_cast<double>(newest);
 }
 
 }  // namespace
@@ -82,13 +78,9 @@ Result<Document> decodeDocument(std::string_view text, const std::string& accoun
     problem = "it does not parse, or does not match its checksum";
     return fields.error();
   }
-  problem = refusal(*fields, account, device);
+  problem = refusal(*fields, account, device, now);
   if (!problem.empty()) return Outcome::malformedFile;
-  Document document{account, device, textIn(*fields, "writer"), platform::linux_::settingsValues(*fields)};
-  constexpr double hundredYears = 3.2e9;
-  if (newestStamp(document.entries) <= (now.count() + hundredYears) * 1e6) return document;
-  problem = "it has an entry that is stamped more than a hundred years ahead";
-  return Outcome::malformedFile;
+  return Document{account, device, textIn(*fields, "writer"), platform::linux_::settingsValues(*fields)};
 }
 
 bool isName(std::string_view text) {
