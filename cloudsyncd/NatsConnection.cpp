@@ -174,6 +174,13 @@ struct NatsConnection::Library {
     ::js_UpdateStream(nullptr, streams.get(), info.Config, nullptr, &ignored);
   }
 
+  // The server's last error, which no call answers.
+  std::string lastSaid() const {
+    const char* said = nullptr;
+    ::natsConnection_GetLastError(connection.get(), &said);
+    return said ? said : "";
+  }
+
   std::error_code fail(natsStatus status, jsErrCode code, const std::string& what, std::string& problem) {
     problem = what + ": " + lastErrorText(status);
     if (code == JSStreamNotFoundErr) return std::make_error_code(std::errc::no_such_file_or_directory);
@@ -181,9 +188,8 @@ struct NatsConnection::Library {
       return std::make_error_code(std::errc::message_size);
     if (status != NATS_TIMEOUT) return make_error_code(Outcome::notConnected);
     // What the server had against a request it says apart from it.
-    const char* said = nullptr;
-    ::natsConnection_GetLastError(connection.get(), &said);
-    problem = what + ": no answer" + (said && *said ? std::string("; ") + said : "");
+    const std::string said = lastSaid();
+    problem = what + ": no answer" + (said.empty() ? "" : "; " + said);
     return make_error_code(Outcome::timedOut);
   }
 };
@@ -221,7 +227,7 @@ Result<NatsConnection::Stream> NatsConnection::stream(std::string& problem) {
   auto found = lookUp(problem);
   if (found || found.error() != std::errc::no_such_file_or_directory) return found;
   const auto made = makeStream(problem);
-  std::string ignored;  // another device may have made it meanwhile, and so the account has its one
+  std::string ignored;  // another device may have made it meanwhile
   found = lookUp(made ? problem : ignored);
   return found || made ? found : made.error();
 }
@@ -250,7 +256,6 @@ std::optional<std::string> NatsConnection::deviceOf(std::string_view subject) co
   return subject.starts_with(prefix) ? nameOf(subject.substr(prefix.size())) : std::nullopt;
 }
 
-// Several devices may do so at once: the second finds it.
 Result<void> NatsConnection::makeStream(std::string& problem) {
   const char* subjects[] = {all.c_str()};
   jsStreamConfig config;
@@ -265,7 +270,7 @@ Result<void> NatsConnection::makeStream(std::string& problem) {
   for (const int copies : {replicas, 1}) {
     config.Replicas = copies;
     status = ::js_AddStream(nullptr, library->streams.get(), &config, nullptr, &code);
-    if (status == NATS_OK || code == JSStreamNameExistErr) return {};
+    if (status == NATS_OK) return {};
     if (code != JSStreamReplicasNotSupportedErr && code != JSClusterNoPeersErr &&
         code != JSInsufficientResourcesErr)
       break;
@@ -317,9 +322,8 @@ Result<NatsConnection::Message> NatsConnection::receive(std::string& problem) {
     const natsStatus status = ::natsSubscription_NextMsg(&found, library->subscription.get(), aDay);
     if (status == NATS_TIMEOUT || status == NATS_SLOW_CONSUMER) continue;
     if (status != NATS_OK) {
-      const char* said = nullptr;
-      ::natsConnection_GetLastError(library->connection.get(), &said);
-      problem = said && *said ? said : ::natsStatus_GetText(status);
+      const std::string said = library->lastSaid();
+      problem = said.empty() ? ::natsStatus_GetText(status) : said;
       return Outcome::notConnected;
     }
     const Handle received(found);

@@ -227,7 +227,6 @@ void NatsTransport::forget(const std::string& device, std::function<void(const s
 
 void NatsTransport::timePassed(Steady now) {
   if (!deadline() || now < *deadline()) return;
-  due.reset();
   connection ? read() : open();
 }
 
