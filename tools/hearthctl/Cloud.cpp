@@ -112,6 +112,12 @@ Result<List> Cloud::call(const std::string& operation, const List& arguments, mi
   return resultsOf((*client)->call(cloudsync::cloudInterface(), operation, arguments, timeout), answer);
 }
 
+Exit Cloud::perform(const std::string& operation, const std::string& argument, const std::string& refusal) {
+  const auto results = call(operation, {argument}, enginePatience);
+  if (results) return done;
+  return answer.empty() ? fail(results.error()) : tools::fail(refusal, results.error(), answer);
+}
+
 Exit Cloud::fail(std::error_code error) const {
   const bool hasAccount = files.identity(paths.cloud()).has_value();
   if (hasAccount || error != platform::Outcome::notConnected)
@@ -141,17 +147,11 @@ Exit Cloud::use(const AccountOptions& account) {
   const auto text =
       platform::linux_::printJson(cloudsync::fieldsOf(*membership), platform::linux_::JsonStyle::line);
   if (!text) return tools::fail(account.access, text.error());
-  const auto results = call("Use", {*text}, enginePatience);
-  if (results) return done;
-  return answer.empty() ? fail(results.error())
-                        : tools::fail("the account is not changed", results.error(), answer);
+  return perform("Use", *text, "the account is not changed");
 }
 
 Exit Cloud::forget(const std::string& device) {
-  const auto results = call("Forget", {device}, enginePatience);
-  if (results) return done;
-  return answer.empty() ? fail(results.error())
-                        : tools::fail(device + " is not forgotten", results.error(), answer);
+  return perform("Forget", device, device + " is not forgotten");
 }
 
 Exit Cloud::makeNewIdentity(Output& output) {

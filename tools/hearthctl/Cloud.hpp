@@ -38,6 +38,8 @@ class Cloud {
  private:
   platform::Result<platform::List> call(const std::string& operation, const platform::List& arguments,
                                         std::chrono::milliseconds patience);
+  // `refusal` is said before what cloudsyncd has against it.
+  Exit perform(const std::string& operation, const std::string& argument, const std::string& refusal);
   Exit fail(std::error_code error) const;
 
   const platform::linux_::Paths& paths;
