@@ -99,7 +99,7 @@ TEST_F(DirectoryTransportTest, DocumentsAreReadAtStartAndWhenTheyChange) {
   files.put("/share/home/b.json", "1");
   for (const char* other : {"b.json.new", "b.txt", ".json", ".b.json", "b c.json", "b.json~", "x/c.json"})
     files.put(std::string("/share/home/") + other, "");
-  files.put("/share/work/d.json", "");
+  files.put("/share/other/d.json", "");
   files.put("/share/home/a.json", std::string(documentBytes + 1, ' '));
   files.unreadable.insert("/share/home/c.json");
   files.put("/share/home/c.json", "3");
