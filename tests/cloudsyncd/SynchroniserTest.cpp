@@ -186,8 +186,10 @@ TEST_F(SynchroniserTest, KeepsWhatExceedsTheQuotaHereAndSaysSoOnce) {
   EXPECT_EQ(whole().at("reasonSequence"), sequence);
   EXPECT_THAT(synchroniser.status().waiting, ElementsAre("more", "still more"));
   EXPECT_THAT(synchroniser.status().problem, testing::HasSubstr("exceed"));
-  for (const char* key : {"0", "1"}) store->setValue(std::nullopt, key);
-  deliver();
+  for (const char* key : {"0", "1", "2"}) store->setValue(std::nullopt, key);
+  write("more", std::string(documentBytes, 'x'));
+  EXPECT_FALSE(publishNext()) << "few keys, but too many bytes";
+  write("more", 1);
   EXPECT_TRUE(publishNext());
   EXPECT_EQ(synchroniser.status().problem, "");
 
@@ -210,7 +212,7 @@ TEST_F(SynchroniserTest, PutsBackWhatSomebodyHasReplacedByLess) {
   EXPECT_THAT(publishNext()->entries, testing::Contains(testing::Key("theirs")));
 }
 
-TEST_F(SynchroniserTest, AFullDiskAndALostReplicaHealByThemselves) {
+TEST_F(SynchroniserTest, AFullDiskAndALostOrDamagedReplicaHealByThemselves) {
   make({{"account", "home"}, {"device", "me"}});
   connect();
   logged();
@@ -230,12 +232,18 @@ TEST_F(SynchroniserTest, AFullDiskAndALostReplicaHealByThemselves) {
   deliver();
   EXPECT_EQ(values(), R"(["key": 1])");
   EXPECT_EQ(whole().at("device"), Value("me"));
+  files.put(path, "{");
+  deliver();
+  synchroniser.received("peer", document("peer", {{"key", entry(2, 6)}}));
+  deliver();
+  EXPECT_EQ(values(), R"(["key": 2])");
+  EXPECT_EQ(whole().at("device"), Value("me"));
   EXPECT_THAT(transport.sent, IsEmpty());
 
   write("mine", 2);
   EXPECT_TRUE(files.remove(path));
   EXPECT_FALSE(publishNext()) << "gone, though no event has said so";
-  EXPECT_EQ(values(), R"(["key": 1])");
+  EXPECT_EQ(values(), R"(["key": 2])");
 }
 
 }  // namespace
