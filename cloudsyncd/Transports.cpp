@@ -4,6 +4,7 @@
 #include <cctype>
 #include <charconv>
 #include <cmath>
+#include <cstdint>
 #include <optional>
 #include <utility>
 #include <variant>
@@ -49,10 +50,20 @@ DirectoryTransport::Place directoryOf(const Membership& membership, std::string_
   return place;
 }
 
-bool isHost(std::string_view host) {
-  return !host.empty() && std::all_of(host.begin(), host.end(), [](unsigned char letter) {
-    return std::isalnum(letter) || letter == '.' || letter == '-' || letter == ':' || letter == '[' ||
-           letter == ']';
+// HOST or HOST:PORT, an address of IPv6 in brackets.
+bool isServer(std::string_view server) {
+  const auto colon = server.ends_with(']') ? server.npos : server.rfind(':');
+  if (colon != server.npos) {
+    const std::string_view text = server.substr(colon + 1);
+    std::uint16_t port = 0;
+    const auto [end, error] = std::from_chars(text.data(), text.data() + text.size(), port);
+    if (error != std::errc() || end != text.data() + text.size() || port == 0) return false;
+  }
+  const std::string_view host = server.substr(0, colon);
+  const bool isInBrackets = host.starts_with('[') && host.ends_with(']');
+  return !host.empty() && std::all_of(host.begin(), host.end(), [&](unsigned char letter) {
+    return std::isalnum(letter) || letter == '.' || letter == '-' ||
+           (isInBrackets && (letter == ':' || letter == '[' || letter == ']'));
   });
 }
 
@@ -81,7 +92,7 @@ NatsTransport::Place natsOf(const Membership& membership, std::string_view rest,
   while (!rest.empty() || place.servers.empty()) {
     const std::string_view server = rest.substr(0, rest.find(','));
     rest.remove_prefix(std::min(rest.size(), server.size() + 1));
-    if (!isHost(server)) problem = "not nats://[USER@]HOST[:PORT][,HOST[:PORT]...]";
+    if (!isServer(server)) problem = "not nats://[USER@]HOST[:PORT][,HOST[:PORT]...]";
     place.servers.emplace_back(server);
   }
   access.isEncrypted =

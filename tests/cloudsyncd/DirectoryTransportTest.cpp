@@ -257,7 +257,8 @@ TEST(TransportsTest, WrongAddressesAreToldApart) {
       {"", {"dir:/a", "dir:/a//?poll=0.5", "dir:/", "nats://a", "nats://user@a:4222,b.example,[::1]:4222"}},
       {"dir: needs an absolute path", {"dir:a", "dir:", "dir:?poll=5"}},
       {"unknown engine; there are dir:PATH and nats://HOST", {"http://a", ""}},
-      {"not nats://[", {"nats://", "nats://user@", "nats://a,,b", "nats://a/b"}},
+      {"not nats://[",
+       {"nats://", "nats://user@", "nats://a,,b", "nats://a/b", "nats://a:b", "nats://a:0", "nats://::1"}},
       {"a password does not belong into the URL", {"nats://user:word@a"}},
       {"after '?' only poll=SECONDS may stand",
        {"dir:/a?", "dir:/a?pol=1", "dir:/a?poll=0", "dir:/a?poll=-1", "dir:/a?poll=nan", "dir:/a?poll=1s"}}};
