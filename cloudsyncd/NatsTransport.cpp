@@ -241,7 +241,7 @@ void NatsTransport::lose(const std::string& problem) {
   if (connection) connection->close();
   connection.reset();
   isConnected = isBusy = isUnanswered = false;
-  stream = {};
+  isUncertain = true;
   tryAgain(problem);
   client->disconnected(problem);
 }

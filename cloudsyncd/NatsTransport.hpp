@@ -87,7 +87,7 @@ class NatsTransport : public Transport, public std::enable_shared_from_this<Nats
   std::size_t moves = 0;      // to another server, since something was published
   Retry retry;
   std::optional<Steady> due;      // the next reading or attempt to connect
-  NatsConnection::Stream stream;  // as it was read on this connection
+  NatsConnection::Stream stream;  // as it was read last
   bool isUncertain = false;       // whether the client has all that was there then: read all again
   std::set<std::string> known;    // the devices whose documents the client has
   std::minstd_rand random;
