@@ -23,14 +23,14 @@
 
 namespace fakes {
 
-// Generous, since the machine may be busy; a condition that is met is noticed at once.
-inline constexpr std::chrono::seconds deadline{30};
+// Generous, since the machine may be busy: a condition that is met is noticed soon.
+inline std::chrono::seconds deadline{30};
 
 inline bool eventually(const std::function<bool()>& condition) {
   const auto end = std::chrono::steady_clock::now() + deadline;
   while (!condition()) {
     if (std::chrono::steady_clock::now() > end) return false;
-    std::this_thread::sleep_for(std::chrono::milliseconds(1));
+    std::this_thread::sleep_for(std::chrono::milliseconds(5));
   }
   return true;
 }

@@ -4,11 +4,14 @@
 
 #include <array>
 #include <atomic>
+#include <future>
+#include <memory>
 #include <optional>
 #include <string_view>
 #include <thread>
 #include <utility>
 
+#include "cloudsyncd/NatsTransport.hpp"
 #include "platform/linux/UniqueDescriptor.hpp"
 #include "tests/system/Account.hpp"
 
@@ -21,6 +24,7 @@ using platform::linux_::UniqueDescriptor;
 
 struct NatsTest : Account {
   NatsTest() {
+    fakes::deadline = std::chrono::seconds(90);  // a cluster killed whole has taken 40 to elect its leaders
     for (Server& server : servers) server = {freePort(), freePort(), freePort()};
     write("nats/routes.conf", "routes: [ nats://127.0.0.1:" + std::to_string(servers[0].cluster) +
                                   ", nats://127.0.0.1:" + std::to_string(servers[1].cluster) +
@@ -54,15 +58,16 @@ struct NatsTest : Account {
     std::ofstream(conf) << text.replace(at, from.size(), to);
   }
 
-  void startServer(std::size_t number, const std::string& certificate = "server") {
+  void startServer(std::size_t number, const std::string& certificate = "server",
+                   const std::string& within = "") {
     const Server& server = servers[number];
     const std::string name = "n" + std::to_string(number);
     servers[number].pid = spawn(
         "env NATS_NAME=" + name + " NATS_LISTEN=127.0.0.1:" + std::to_string(server.port) +
             " NATS_CLUSTER=127.0.0.1:" + std::to_string(server.cluster) + " NATS_STORE=" + tls(name) +
-            " NATS_CERTIFICATE=" + tls(certificate + ".pem") + " NATS_KEY=" + tls(certificate + ".key") +
-            " NATS_HOME_PASSWORD=hp NATS_WORK_PASSWORD=wp /usr/sbin/nats-server -c " + conf.string() +
-            " -m " + std::to_string(server.monitor),
+            " NATS_AUTHORITIES=" + tls("ca.pem") + " NATS_CERTIFICATE=" + tls(certificate + ".pem") +
+            " NATS_KEY=" + tls(certificate + ".key") + " NATS_HOME_PASSWORD=hp NATS_WORK_PASSWORD=wp " +
+            within + "/usr/sbin/nats-server -c " + conf.string() + " -m " + std::to_string(server.monitor),
         name);
   }
   void startServers() {
@@ -132,13 +137,31 @@ TEST_F(NatsTest, SwitchesOutliveTheirLeaderAndAllServers) {
   startServer(*former);
 
   stopServers();
+  fs::create_directory(tls("older"));
+  for (const std::string store : {"n0", "n1", "n2"})
+    fs::copy(tls(store), tls("older/" + store), fs::copy_options::recursive);
+  startServers();
+  switchTo("one", "on");
+  ASSERT_TRUE(isInStep("one"));
+  stopServers();
+  for (const std::string store : {"n0", "n1", "n2"}) {
+    fs::remove_all(tls(store));
+    fs::rename(tls("older/" + store), tls(store));
+  }
+  startServers();
+  joinAndStart("three");
+  EXPECT_TRUE(followsOn("three", "one")) << "though the engine had forgotten it";
+  EXPECT_TRUE(followsOn("two", "one"));
+  EXPECT_EQ(timesLogged("was made anew", "two"), 0u);
+
+  stopServers();
   for (const char* store : {"n0", "n1", "n2"}) fs::remove_all(tls(store));
   ASSERT_TRUE(comesToSay("two", "connected          no"));
-  switchTo("two", "on");
+  switchTo("two", "off");
   startServers();
   ASSERT_TRUE(isInStep("two"));
-  joinAndStart("three");
-  EXPECT_TRUE(followsOn("three", "two"));
+  EXPECT_TRUE(followsOff("three"));
+  EXPECT_EQ(timesLogged("stream of account home was made anew", "two"), 1u);
 }
 
 TEST_F(NatsTest, StoppedServerIsLeftAndWhatItStillHoldsDoesNoHarm) {
@@ -216,6 +239,107 @@ TEST_F(NatsTest, WhatTheEngineHasNoRoomForStaysHere) {
   switchTo("one", "on");
   set("100");
   EXPECT_TRUE(isInStep("one"));
+}
+
+TEST_F(NatsTest, SwitchWaitsHereWhileTheDiskOfASingleServerIsFull) {
+  if (run("unshare -m true").status != 0) GTEST_SKIP() << "no file system of its own to be had";
+  const fs::path operators = fs::path(SOURCE_ROOT) / "tests/system/nats";
+  write(conf, R"(listen: $NATS_LISTEN, jetstream { store_dir: $NATS_STORE }, include operator.conf
+tls { cert_file: $NATS_CERTIFICATE, key_file: $NATS_KEY, verify: true, ca_file: $NATS_AUTHORITIES })");
+  fs::copy_file(operators / "operator.conf", tls("operator.conf"));
+  makeCertificate("device", "DNS:device");
+  write("access.json", R"({"credentials": ")" + (operators / "home.creds").string() +
+                           R"(", "authorities": ")" + tls("ca.pem") + R"(", "certificate": ")" +
+                           tls("device.pem") + R"(", "key": ")" + tls("device.key") + R"("})");
+  fs::create_directory(tls("n0"));
+  startServer(0, "server",
+              "unshare -m sh -c 'mount -t tmpfs -o size=1m none " + tls("n0") + " && exec \"$@\"' - ");
+  const auto joinIt = [&](const std::string& name) {
+    EXPECT_EQ(join(name, "nats://localhost:" + std::to_string(servers[0].port), "--access " + access).status,
+              0);
+    start(name);
+    ASSERT_TRUE(isInStep(name));
+  };
+  joinIt("one");
+  const fs::path filled = "/proc/" + std::to_string(servers[0].pid) + "/root" + tls("n0") + "/filled";
+  std::ofstream(filled) << std::string(1 << 20, 'x');
+  switchTo("one", "on");
+  EXPECT_TRUE(comesToSay("one", "no space left on device"));
+  fs::remove(filled);
+  EXPECT_TRUE(isInStep("one"));
+  joinIt("two");
+  EXPECT_TRUE(followsOn("two", "one"));
+}
+
+// Counts what it is told.
+struct Client : cloudsync::TransportClient {
+  void connected() override {}
+  void disconnected(const std::string&) override {}
+  void received(const std::string&, std::string_view) override { ++documents; }
+  void unreadable(const std::string&, const std::string&) override {}
+  void removed(const std::string&) override { ++removals; }
+  void published(const std::error_code&, const std::string&) override {}
+  void deadlineMoved() override {}
+  std::atomic<int> documents = 0, removals = 0;
+};
+
+// Of what a broken route between servers lost nobody hears; nor of a purge, which stands for it here.
+TEST_F(NatsTest, StreamIsReadAgainEveryQuarterOfAnHour) {
+  using std::chrono::minutes;
+  write(conf, "listen: $NATS_LISTEN, jetstream { store_dir: $NATS_STORE }");
+  startServer(0);
+  const int port = servers[0].port;
+  const auto say = [port](const std::string& subject, const std::string& text) {
+    const UniqueDescriptor raw(::socket(AF_INET, SOCK_STREAM, 0));
+    const sockaddr_in address = fakes::loopback(port);
+    ASSERT_EQ(::connect(raw.get(), reinterpret_cast<const sockaddr*>(&address), sizeof address), 0);
+    const std::string all = "CONNECT {\"verbose\":false}\r\nPUB " + subject + " " +
+                            std::to_string(text.size()) + "\r\n" + text + "\r\n";
+    ::send(raw.get(), all.data(), all.size(), MSG_NOSIGNAL);
+    ::shutdown(raw.get(), SHUT_WR);
+    pollfd closed{raw.get(), POLLRDHUP, 0};
+    ::poll(&closed, 1, 10'000);
+  };
+
+  Client client;
+  std::atomic<minutes> ahead{minutes(0)};
+  const auto now = [&] { return std::chrono::steady_clock::now() + ahead.load(); };
+  std::shared_ptr<cloudsync::NatsTransport> transport;
+  platform::linux_::ThreadPool loop{1};
+  const auto onLoop = [&](const std::function<void()>& work) {
+    std::promise<void> done;
+    loop.async([&] {
+      work();
+      done.set_value();
+    });
+    done.get_future().wait();
+  };
+  // Until the next reading.
+  const auto left = [&] {
+    minutes span{-1};
+    onLoop([&] {
+      transport->timePassed(now());
+      if (const auto due = transport->deadline()) span = std::chrono::ceil<minutes>(*due - now());
+    });
+    return span;
+  };
+  cloudsync::NatsAccess open;
+  open.isEncrypted = false;
+  onLoop([&] {
+    transport =
+        cloudsync::NatsTransport::create(loop, now, {{"127.0.0.1:" + std::to_string(port)}, open, "home"});
+    transport->start(client);
+  });
+  EXPECT_TRUE(eventually([&] { return left() == minutes(15); }));
+  say("pairwell.home.other", "{}");
+  EXPECT_TRUE(eventually([&] { return client.documents == 1; }));
+  say("$JS.API.STREAM.PURGE.pairwell-home", "");
+  ahead = minutes(14);
+  EXPECT_EQ(left(), minutes(1));
+  EXPECT_EQ(client.removals, 0);
+  ahead = minutes(15);
+  EXPECT_TRUE(eventually([&] { return left() == minutes(15) && client.removals == 1; }));
+  onLoop([&] { transport.reset(); });
 }
 
 // Of whatever has the account's password.
