@@ -5,6 +5,7 @@
 #include <sys/resource.h>
 #include <sys/socket.h>
 
+#include <algorithm>
 #include <cerrno>
 #include <utility>
 
@@ -16,6 +17,9 @@ namespace platform::linux_ {
 
 void BusAcceptor::listen(UniqueDescriptor socket) {
   listener = std::move(socket);
+  // The kernel gives out the lowest free number.
+  ownDescriptors =
+      static_cast<std::size_t>(std::max(UniqueDescriptor(::fcntl(epoll, F_DUPFD_CLOEXEC, 0)).get(), 0));
   ::fcntl(listener.get(), F_SETFL, ::fcntl(listener.get(), F_GETFL) | O_NONBLOCK);
   watch(EPOLL_CTL_ADD, EPOLLIN);
 }
@@ -28,14 +32,14 @@ void BusAcceptor::stop() {
   resting.reset();
 }
 
-void BusAcceptor::acceptSome(const std::function<void(UniqueDescriptor)>& offer) {
+void BusAcceptor::acceptSome(std::size_t connections, const Offer& offer) {
   for (int turn = 0; turn < 16 && listener; ++turn) {
-    if (!hasSpareDescriptors()) return takeRest();
+    if (connections >= room()) return takeRest();
     UniqueDescriptor socket(::accept4(listener.get(), nullptr, nullptr, SOCK_CLOEXEC | SOCK_NONBLOCK));
     if (socket) {
-      told = false;
-      offer(std::move(socket));
+      connections = offer(std::move(socket));
     } else if (errno == EAGAIN) {
+      told = false;
       return;
     } else if (errno != ECONNABORTED && errno != EINTR) {
       return takeRest();
@@ -49,12 +53,13 @@ void BusAcceptor::resume() {
   watch(EPOLL_CTL_MOD, EPOLLIN);
 }
 
-// The kernel gives out the lowest free number.
-bool BusAcceptor::hasSpareDescriptors() const {
-  const UniqueDescriptor lowest(::fcntl(epoll, F_DUPFD_CLOEXEC, 0));
+// Counted by connections: the lowest free number says nothing of how many there are above it, and who is in
+// his handshake has not taken all of his yet.
+std::size_t BusAcceptor::room() const {
+  const rlim_t kept = ownDescriptors + limits::spareDescriptors;
   rlimit limit{};
-  if (!lowest || ::getrlimit(RLIMIT_NOFILE, &limit) != 0) return false;
-  return static_cast<rlim_t>(lowest.get()) + limits::spareDescriptors < limit.rlim_cur;
+  if (::getrlimit(RLIMIT_NOFILE, &limit) != 0 || limit.rlim_cur < kept) return 0;
+  return (limit.rlim_cur - kept) / limits::descriptorsPerConnection;
 }
 
 void BusAcceptor::takeRest() {

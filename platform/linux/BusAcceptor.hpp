@@ -22,16 +22,18 @@ class BusAcceptor {
 
   void listen(UniqueDescriptor socket);
   void stop();
-  // Offers some of those who wait, in turns, so that those who are connected already have theirs. `offer` may
-  // call stop().
-  void acceptSome(const std::function<void(UniqueDescriptor client)>& offer);
+  // Offers some of those who wait, in turns, so that those who are connected already have theirs. `offer`
+  // returns how many connections there are with it, and may call stop().
+  using Offer = std::function<std::size_t(UniqueDescriptor client)>;
+  void acceptSome(std::size_t connections, const Offer& offer);
   // A client has gone, or the rest is over.
   void resume();
   // When it is over.
   std::optional<TimePoint> deadline() const { return resting; }
+  // How many connections the process's descriptors are enough for.
+  std::size_t room() const;
 
  private:
-  bool hasSpareDescriptors() const;
   void takeRest();
   void watch(int operation, std::uint32_t events);
 
@@ -39,6 +41,7 @@ class BusAcceptor {
   const std::uint64_t tag;
   const std::chrono::milliseconds rest;
   UniqueDescriptor listener;
+  std::size_t ownDescriptors = 0;  // of the process, without clients
   std::optional<TimePoint> resting;
   bool told = false;  // that the limit is reached
 };

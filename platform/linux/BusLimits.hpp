@@ -6,11 +6,13 @@
 
 namespace platform::linux_::limits {
 
-// Each connection takes four descriptors (socket, the two ends that feed the library, the peer's process) and
-// some 20 KiB in all; a machine's clients are a few dozen.
+// Each connection takes some 20 KiB and four descriptors: its socket and the peer's process, and, once it is
+// through its handshake, the two ends that feed the library. A machine's clients are a few dozen.
 inline constexpr std::size_t connections = 4096;
-// One user's leak or attack leaves three quarters to the others.
-inline constexpr std::size_t connectionsPerUser = 1024;
+inline constexpr std::size_t descriptorsPerConnection = 4;
+// One user's leak or attack leaves three quarters to the others, also of what the process's descriptors are
+// enough for, where these are few.
+inline constexpr std::size_t usersShare = 4;
 
 // The largest call of a sound client is a few hundred bytes; the library itself would buffer 128 MiB.
 inline constexpr std::size_t messageBytes = 16 * 1024;
@@ -36,8 +38,8 @@ inline constexpr std::size_t outstanding = 16;
 
 // One turn of the loop reads this much of a client, then the others have theirs.
 inline constexpr std::size_t bytesPerTurn = 16 * 1024;
-// Left free when clients are accepted: a turn's sixteen clients take four each until they are served, and the
-// process has files to open. Accepted with the last one, a client could only be refused.
+// Left free when clients are accepted, beside what those in their handshake will take: the process has files to
+// open, and a client that is accepted with the last one could only be refused.
 inline constexpr std::size_t spareDescriptors = 64;
 
 }  // namespace platform::linux_::limits

@@ -133,7 +133,10 @@ class BusServer::State : public BusSessionHost, public std::enable_shared_from_t
     } else if (tag == timerTag) {
       handleTimer();
     } else if (tag == listenerTag) {
-      acceptor.acceptSome([this](UniqueDescriptor socket) { offer(std::move(socket)); });
+      acceptor.acceptSome(sessions.size(), [this](UniqueDescriptor socket) {
+        offer(std::move(socket));
+        return sessions.size();
+      });
       deadlines.set(listenerTag, acceptor.deadline());
     } else if (tag % 2 == 0) {
       withSession(tag / 2, [&](BusSession& session) { session.ready(events); });
@@ -246,8 +249,9 @@ class BusServer::State : public BusSessionHost, public std::enable_shared_from_t
   void offer(UniqueDescriptor socket) {
     PeerIdentity peer = establishPeer(socket.get());
     const auto count = perUser.find(peer.uid);
-    if (sessions.size() >= limits::connections ||
-        (count != perUser.end() && count->second >= limits::connectionsPerUser)) {
+    const std::size_t all = std::min(limits::connections, acceptor.room());
+    const std::size_t share = std::max<std::size_t>(all / limits::usersShare, 1);
+    if (sessions.size() >= limits::connections || (count != perUser.end() && count->second >= share)) {
       if (!std::exchange(full, true))
         log().error("too many connections, of user %u among others: further ones are closed", peer.uid);
       return;

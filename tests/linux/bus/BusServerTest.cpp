@@ -1,7 +1,6 @@
 // Clients that do what they should not, and what the others notice of it: nothing.
 #include "platform/linux/BusServer.hpp"
 
-#include <sys/resource.h>
 #include <sys/wait.h>
 
 #include <random>
@@ -19,15 +18,7 @@ using testing::Not;
 
 constexpr std::size_t mebibyte = 1024 * 1024;
 
-struct BusServerTest : World {
-  BusServerTest() { EXPECT_EQ(::getrlimit(RLIMIT_NOFILE, &original), 0); }
-  ~BusServerTest() override { limitDescriptors(original.rlim_cur); }
-  void limitDescriptors(rlim_t count) const {
-    const rlimit limit{count, original.rlim_max};
-    EXPECT_EQ(::setrlimit(RLIMIT_NOFILE, &limit), 0);
-  }
-  rlimit original{};
-};
+using BusServerTest = World;
 
 TEST_F(BusServerTest, CallsThatDoNotFitGetAnErrorAndNoMore) {
   std::string unended = callMessage("Echo", "text");
@@ -210,38 +201,6 @@ TEST_F(BusServerTest, NothingWakesAServerThatNoLongerListens) {
   const Wire wire = connect();  // the service manager's socket takes it
   turn();
   EXPECT_FALSE(isAwake());
-}
-
-TEST_F(BusServerTest, AtTheDescriptorLimitClientsWaitUntilOthersEnd) {
-  constexpr std::size_t clients = 30;
-  limitDescriptors(openDescriptors() + clients + limits::spareDescriptors + 20);
-  std::vector<Wire> wires;
-  while (wires.size() < clients) wires.push_back(connect());
-  for (std::size_t count = 0; count < clients; ++count) turn();
-  EXPECT_LT(connections.size(), clients);
-  EXPECT_FALSE(isAwake()) << "nor do they wake it";
-  // Each one that ends lets the next one in.
-  for (Wire& wire : wires) {
-    wire.shakeHands();
-    ASSERT_TRUE(wire.isServed());
-    wire.socket.reset();
-  }
-}
-
-TEST_F(BusServerTest, OneUsersConnectionsAreLimitedAndOneThatEndsMakesRoom) {
-  if (original.rlim_max < 4 * limits::connectionsPerUser) GTEST_SKIP() << "takes more descriptors";
-  limitDescriptors(original.rlim_max);
-  Wire first = client();
-  std::vector<Wire> wires;
-  while (wires.size() < limits::connectionsPerUser - 1) {
-    wires.push_back(connect());
-    turn();
-  }
-  EXPECT_EQ(connect().readToEnd(), "");
-  EXPECT_TRUE(first.isServed());
-  first.socket.reset();
-  EXPECT_TRUE(waitFor([&] { return closed == 1; }));
-  EXPECT_TRUE(client().isServed());
 }
 
 TEST(BusClientTest, AServiceThatHangsCostsAClientItsTimeoutAndNoMore) {
