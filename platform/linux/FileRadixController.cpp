@@ -3,6 +3,7 @@
 #include <optional>
 #include <utility>
 
+#include "platform/LogSink.hpp"
 #include "platform/linux/SettingsDocument.hpp"
 
 namespace platform::linux_ {
@@ -23,7 +24,10 @@ Result<Dictionary> FileRadixController::readPrefKeys(const std::vector<std::stri
 
 Result<void> FileRadixController::writePrefKey(std::string_view key, const Value& value) {
   const bool removed = value.as<std::nullptr_t>() != nullptr;
-  return file->setValue(key, removed ? std::nullopt : std::optional(value));
+  const auto written = file->setValue(key, removed ? std::nullopt : std::optional(value));
+  if (!written)
+    hearthLog("files").error("root preferences: %s cannot be stored: %s", key, written.error().message());
+  return written;
 }
 
 }  // namespace platform::linux_

@@ -25,21 +25,32 @@ SettingsFile::SettingsFile(FileSystem& files_, std::string path_)
     : files(files_), path(std::move(path_)), document(std::make_shared<const Dictionary>()) {}
 
 Result<SettingsFile::Document> SettingsFile::read() {
+  Result<void> fresh;
+  bool isDamaged;
   {
     std::lock_guard lock(mutex);
-    if (const auto fresh = refresh(); !fresh) return fresh.error();
-    if (damage.empty() || damageStays) return document;
+    if (delivery && !watch) tryToWatch();
+    fresh = refresh();
+    isDamaged = fresh && !damage.empty() && !damageStays;
   }
-  clearDamage();
+  if (isDamaged) clearDamage();
   std::lock_guard lock(mutex);
+  recordFailure(fresh ? std::error_code() : fresh.error());
+  if (!fresh) return fresh.error();
   return document;
+}
+
+// What changed while nothing could be read has not been reported, and its event has passed: so a failure, and
+// the end of one, are looked at again.
+void SettingsFile::recordFailure(const std::error_code& error) {
+  if (std::exchange(failure, error) == error) return;
+  if (error) log().error("%s: cannot be read: %s", path, error.message());
+  if (delivery) lookLater();
 }
 
 SettingsFile::Document SettingsFile::contents() {
   const auto current = read();
   std::lock_guard lock(mutex);
-  const auto previous = std::exchange(failure, current ? std::error_code() : current.error());
-  if (failure && failure != previous) log().error("%s: cannot be read: %s", path, failure.message());
   return current ? *current : document;
 }
 
@@ -152,7 +163,10 @@ void SettingsFile::finishWrite(const Dictionary& before, const Dictionary& next,
     static_cast<void>(refresh());  // a failure is the next reader's to meet
     outsideChange = reported && recordOwnChange(before, next, written);
   }
-  if (!outsideChange) return;
+  if (outsideChange) lookLater();
+}
+
+void SettingsFile::lookLater() {
   delivery->async([weak = weak_from_this()] {
     if (const auto self = weak.lock()) self->look();
   });
@@ -184,8 +198,21 @@ Result<void> SettingsFile::setValue(std::string_view key, const std::optional<Va
 }
 
 bool SettingsFile::startWatching(WorkQueue& delivery_, Changed changed_) {
-  delivery = &delivery_;
   changed = std::move(changed_);
+  {
+    std::lock_guard lock(mutex);
+    delivery = &delivery_;
+    tryToWatch();
+  }
+  // After the watch has begun, and what is in force by then: a change of the meantime, which look() could not
+  // report yet, is read, not told.
+  static_cast<void>(contents());
+  std::lock_guard lock(mutex);
+  reported = document;
+  return watch != nullptr;
+}
+
+void SettingsFile::tryToWatch() {
   const std::string folder = folderOf(path);
   const auto made = files.makeFolder(folder);
   auto begun = made ? files.watch(folder,
@@ -193,17 +220,13 @@ bool SettingsFile::startWatching(WorkQueue& delivery_, Changed changed_) {
                                     if (const auto self = weak.lock()) self->look();
                                   })
                     : Result<std::unique_ptr<FolderWatch>>(made.error());
-  if (!begun) {
-    log().error("%s: changes by others will not be noticed: %s", folder, begun.error().message());
-    return false;
+  const auto previous = std::exchange(watchFailure, begun ? std::error_code() : begun.error());
+  if (begun) {
+    watch = std::move(*begun);
+    if (previous) lookLater();  // what came meanwhile
+  } else if (watchFailure != previous) {
+    log().error("%s: changes by others will not be noticed: %s", folder, watchFailure.message());
   }
-  watch = std::move(*begun);
-  // After the watch has begun, and what is in force by then: a change of the meantime, which look() could not
-  // report yet, is read, not told.
-  static_cast<void>(contents());
-  std::lock_guard lock(mutex);
-  reported = document;
-  return true;
 }
 
 // Compares instead of trusting events: they merge, overflow, and come for own writes, too.

@@ -33,9 +33,9 @@ class SettingsFile : public std::enable_shared_from_this<SettingsFile> {
   static std::shared_ptr<SettingsFile> create(FileSystem& files, std::string path);
 
   // What is stored at this moment. Takes the file's lock only to move damage aside; an error only where the
-  // file cannot be read at all.
+  // file cannot be read at all, which is logged (once, until it is another).
   Result<Document> read();
-  // The same, but a failure is logged (once, until it is another) and the last good contents answer.
+  // The same, but then the last good contents answer.
   Document contents();
 
   // Runs `change` on what is stored, and makes the outcome durable unless it answers false; no other process
@@ -46,7 +46,7 @@ class SettingsFile : public std::enable_shared_from_this<SettingsFile> {
 
   // Once. From now on `changed` hears of what others wrote, once, and of nothing that this object wrote.
   // `delivery`, on whose thread the file system reports, outlives the object. False after a failure, which is
-  // logged: reports stay away.
+  // logged: reports stay away until a read, which tries again, meets no failure.
   bool startWatching(WorkQueue& delivery, Changed changed);
 
  private:
@@ -56,7 +56,10 @@ class SettingsFile : public std::enable_shared_from_this<SettingsFile> {
   void finishWrite(const Dictionary& before, const Dictionary& next, bool written);
   void clearDamage();
   void look();
+  void lookLater();
   // `mutex` held:
+  void tryToWatch();
+  void recordFailure(const std::error_code& error);
   Result<void> refresh();
   Result<void> load();
   void moveAside();
@@ -64,12 +67,12 @@ class SettingsFile : public std::enable_shared_from_this<SettingsFile> {
 
   FileSystem& files;
   const std::string path;
-  WorkQueue* delivery = nullptr;  // these two are set before the watch begins
-  Changed changed;
+  Changed changed;  // set before the watch begins
 
   // Guards the rest. The file's lock is taken first, if both are needed: a reader, who needs only this one,
   // must not wait for a writer in another process.
   std::mutex mutex;
+  WorkQueue* delivery = nullptr;  // null without a wish to watch
   Document document;
   std::unique_ptr<File>
       held;  // the file that `document`, or `damage`, came from; its inode is not reused meanwhile
@@ -78,9 +81,10 @@ class SettingsFile : public std::enable_shared_from_this<SettingsFile> {
   bool damageStays = false;      // it could not be moved
   bool lastGoodInForce = false;  // the file is missing because it was damaged
   std::error_code failure;       // of the last read
+  std::error_code watchFailure;  // of the last attempt to watch
   bool writing = false;
   bool unsynced = false;  // the last write failed, perhaps after its rename
-  Document reported;      // what `changed` has heard of, own writes included; null without a watch
+  Document reported;      // what `changed` has heard of, own writes included; null without a wish to watch
 
   std::unique_ptr<FolderWatch> watch;  // ends first
 };
