@@ -49,6 +49,8 @@ EventSource::~EventSource() = default;
 EventLoop::EventLoop() : wakeUp(::eventfd(0, EFD_CLOEXEC | EFD_NONBLOCK)) {
   require(sd_event_new(&event), "cannot be made");
   if (!wakeUp) require(-errno, "eventfd");
+  // The first timer of a clock opens its descriptor, which stays: here, where a failure is that of the start.
+  for (const int clock : {CLOCK_REALTIME, CLOCK_MONOTONIC}) addTimer(clock, UINT64_MAX, [] {});
   wakeUpSource = watchDescriptor(wakeUp.get(), EPOLLIN, [this](std::uint32_t) { runHandedOver(); });
 }
 
