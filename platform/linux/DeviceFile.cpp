@@ -11,12 +11,8 @@ namespace {
 
 constexpr std::size_t sizeLimit = 1 << 20;
 
-Result<Dictionary> parse(const Result<std::string>& text, std::string& problem) {
-  if (!text) {
-    problem = text.error().message();
-    return text.error();
-  }
-  const auto value = parseJson(*text, problem);
+Result<Dictionary> parse(const std::string& text, std::string& problem) {
+  const auto value = parseJson(text, problem);
   if (!value) return value.error();
   if (const auto* entries = value->as<Dictionary>()) return *entries;
   problem = "line 1, column 1: not an object";
@@ -39,21 +35,20 @@ void DeviceFile::refresh() {
   entries.clear();
   held.reset();
   auto file = files.openToRead(path);
-  const auto previous = std::exchange(failure, file ? std::error_code() : file.error());
-  if (!file) {
+  const auto identity = file ? (*file)->identity() : Result<FileIdentity>(file.error());
+  const auto text = identity ? (*file)->readAll(sizeLimit) : Result<std::string>(identity.error());
+  const auto previous = std::exchange(failure, text ? std::error_code() : text.error());
+  if (!text) {  // not held: the next look may be able to read it
     const bool isNews = failure != previous && failure != std::errc::no_such_file_or_directory;
     if (isNews) hearthLog("files").error("%s: %s; skipped", path, failure.message());
     return;
   }
-  const auto identity = (*file)->identity();
   std::string problem;
-  auto parsed = parse((*file)->readAll(sizeLimit), problem);
+  auto parsed = parse(*text, problem);
   if (!parsed) hearthLog("files").error("%s: %s; skipped", path, problem);
   if (parsed) entries = std::move(*parsed);
-  if (identity) {
-    heldIdentity = *identity;
-    held = std::move(*file);
-  }
+  heldIdentity = *identity;
+  held = std::move(*file);
 }
 
 }  // namespace platform::linux_
