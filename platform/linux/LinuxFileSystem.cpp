@@ -14,6 +14,7 @@
 #include <mutex>
 #include <utility>
 
+#include "platform/LogSink.hpp"
 #include "platform/linux/UniqueDescriptor.hpp"
 
 namespace platform::linux_ {
@@ -22,14 +23,6 @@ namespace {
 Result<void> answer(int result) {
   if (result < 0) return lastError();
   return {};
-}
-
-// The call again when a signal cut it short.
-template <class Call>
-auto retried(Call call) {
-  auto result = call();
-  while (result < 0 && errno == EINTR) result = call();
-  return result;
 }
 
 FileIdentity identityOf(const struct stat& status) {
@@ -146,18 +139,24 @@ class Watched {
     return current >= 0;
   }
 
+  // Where it is not there, its parent will tell when it is.
+  void watchAgain() {
+    if (watchFolder() || errno == ENOENT) return;
+    hearthLog("files").error("%s: changes by others will not be noticed: %s", folder, lastError().message());
+  }
+
   void handle(const inotify_event& event, const std::string& name) {
     if (event.mask & IN_Q_OVERFLOW) {
       report("");
     } else if (event.wd == parent) {
       if (name != std::filesystem::path(folder).filename()) return;
-      watchFolder();
+      watchAgain();
       report("");
     } else if (event.wd == current) {
       if (event.mask & IN_MOVE_SELF) {
         // It may have moved to its name, in place of a link to it: it was watched before its parent told.
         ::inotify_rm_watch(inotify.get(), current);
-        watchFolder();
+        watchAgain();
       }
       const bool all = (event.mask & (IN_MOVE_SELF | IN_DELETE_SELF | IN_UNMOUNT)) != 0;
       if (all || !name.empty()) report(all ? "" : name);

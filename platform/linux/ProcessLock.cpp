@@ -8,9 +8,10 @@
 namespace platform::linux_ {
 
 Result<UniqueDescriptor> takeLock(const std::string& path) {
-  UniqueDescriptor file(::open(path.c_str(), O_RDONLY | O_CREAT | O_CLOEXEC | O_NONBLOCK, 0600));
+  constexpr int flags = O_RDONLY | O_CREAT | O_CLOEXEC | O_NONBLOCK;
+  UniqueDescriptor file(retried([&] { return ::open(path.c_str(), flags, 0600); }));
   if (!file) return lastError();
-  if (::flock(file.get(), LOCK_EX | LOCK_NB) == 0) return file;
+  if (retried([&] { return ::flock(file.get(), LOCK_EX | LOCK_NB); }) == 0) return file;
   if (errno == EWOULDBLOCK) return UniqueDescriptor();
   return lastError();
 }

@@ -35,4 +35,12 @@ class UniqueDescriptor {
   int descriptor = -1;
 };
 
+// The call again when a signal cut it short.
+template <class Call>
+auto retried(Call call) {
+  auto result = call();
+  while (result < 0 && errno == EINTR) result = call();
+  return result;
+}
+
 }  // namespace platform::linux_
