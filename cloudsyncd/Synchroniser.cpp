@@ -226,7 +226,8 @@ void Synchroniser::publish() {
 Result<std::string> Synchroniser::encode() {
   Result<std::string> text{std::string()};
   const auto written = around.replica.update([&](Dictionary& replica) {
-    underWay = {around.account, nameDevice(replica), around.writer, settingsValues(std::as_const(replica))};
+    underWay = {around.account, nameDevice(replica), around.writer,
+                publishableEntries(settingsValues(std::as_const(replica)), around.wall.now())};
     text = encodeDocument(underWay);
     if (!text || isOwnWriter(replica, around.writer)) return false;
     addWriter(replica, around.writer);

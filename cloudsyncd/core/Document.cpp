@@ -24,7 +24,6 @@ std::string textIn(const Dictionary& fields, std::string_view name) {
 // Why it is no document of that device; empty if it is.
 std::string refusal(const Dictionary& fields, const std::string& account, const std::string& device,
                     platform::Time now) {
-  constexpr double hundredYears = 3.2e9;
   const auto* format = platform::find<std::int64_t>(fields, "format");
   if (!format) return "it has no format version";
   if (*format != formatVersion) return "its format version is not " + std::to_string(formatVersion);
@@ -36,7 +35,7 @@ std::string refusal(const Dictionary& fields, const std::string& account, const 
   for (const auto& [key, value] : *values) {
     const auto entry = CloudEntry::fromValue(value);
     if (!entry) return "it has an entry of another form";
-    if (static_cast<double>(entry->stamp.microseconds) > (now.count() + hundredYears) * 1e6)
+    if (!entry->stamp.isCredible(now))
       return "it has an entry that is stamped more than a hundred years ahead";
   }
   if (platform::linux_::cloudValues(*values).size() > documentKeys)
@@ -44,16 +43,16 @@ std::string refusal(const Dictionary& fields, const std::string& account, const 
   return "";
 }
 
-// A person's edit may have left others in the replica, where they count as not there.
-Dictionary validEntries(const Dictionary& values) {
-  Dictionary entries;
-  for (const auto& [key, value] : values) {
-    if (CloudEntry::fromValue(value)) entries.emplace(key, value);
-  }
-  return entries;
-}
-
 }  // namespace
+
+Dictionary publishableEntries(const Dictionary& entries, platform::Time now) {
+  Dictionary publishable;
+  for (const auto& [key, value] : entries) {
+    const auto entry = CloudEntry::fromValue(value);
+    if (entry && entry->stamp.isCredible(now)) publishable.emplace(key, value);
+  }
+  return publishable;
+}
 
 Result<std::string> encodeDocument(const Document& document) {
   if (platform::linux_::cloudValues(document.entries).size() > documentKeys) return Outcome::tooLarge;
@@ -61,7 +60,7 @@ Result<std::string> encodeDocument(const Document& document) {
                                                 {"account", document.account},
                                                 {"device", document.device},
                                                 {"writer", document.writer},
-                                                {"values", validEntries(document.entries)}});
+                                                {"values", document.entries}});
   if (text && text->size() > documentBytes) return Outcome::tooLarge;
   return text;
 }

@@ -37,7 +37,8 @@ CloudStamp nextStamp(const Dictionary& entries, const CloudWrite& write) {
   CloudStamp next{now, 0};
   for (const auto& [key, value] : entries) {
     const auto entry = CloudEntry::fromValue(value);
-    if (!entry || entry->stamp.microseconds < next.microseconds) continue;
+    if (!entry || entry->stamp.microseconds < next.microseconds || !entry->stamp.isCredible(write.now))
+      continue;
     if (entry->stamp.microseconds > now + day && cloudStemOf(key) != stem) continue;
     next = {std::min(entry->stamp.microseconds + 1, greatestStamp), 0};
   }
@@ -62,9 +63,10 @@ std::optional<std::string> passedCompanion(const Dictionary& entries, const Clou
   return end && *end <= write.now.count() + 1 ? std::optional(companion) : std::nullopt;
 }
 
-bool place(Dictionary& entries, const std::string& key, const CloudEntry& entry) {
+bool place(Dictionary& entries, const std::string& key, const CloudEntry& entry, Time now) {
   const auto there = CloudEntry::find(entries, key);
-  if (there && !entry.outranks(*there)) return false;  // somebody else's is newer
+  if (there && there->stamp.isCredible(now) && !entry.outranks(*there))
+    return false;  // somebody else's is newer
   entries.insert_or_assign(key, entry.toValue());
   return true;
 }
@@ -85,7 +87,7 @@ std::optional<bool> writeEndAlone(Dictionary& entries, const CloudWrite& write) 
   }
   if (there && !flag->outranks(*there)) return std::nullopt;
   return place(entries, write.key,
-               {write.value, {flag->stamp.microseconds, flag->stamp.tick - isOn}, flag->device});
+               {write.value, {flag->stamp.microseconds, flag->stamp.tick - isOn}, flag->device}, write.now);
 }
 
 std::optional<std::int64_t> number(const Dictionary& document, std::string_view name) {
@@ -102,6 +104,11 @@ CloudStore::ChangeReason reasonGiven(const Dictionary& before, const Dictionary&
 }
 
 }  // namespace
+
+bool CloudStamp::isCredible(Time now) const {
+  constexpr Time hundredYears{3.2e9};
+  return microseconds <= microsecondsOf(now + hundredYears);
+}
 
 std::optional<CloudEntry> CloudEntry::fromValue(const Value& value) {
   const auto* fields = value.as<Dictionary>();
@@ -182,7 +189,8 @@ std::vector<CloudReport> cloudReports(const Dictionary& before, const Dictionary
 
 bool CloudBursts::write(Dictionary& entries, const CloudWrite& write) {
   if (const auto companion = passedCompanion(entries, write)) return expire(entries, write, *companion);
-  if (!write.value && write.key == expiring) return place(entries, write.key, {{}, stamp, endedDevice});
+  if (!write.value && write.key == expiring)
+    return place(entries, write.key, {{}, stamp, endedDevice}, write.now);
   expiring.clear();  // any other write, an echo too, ends what belongs to the expiry
   const bool isTogether = joins(entries, write);
   if (!isTogether || !isCompanion(write.key)) {
@@ -192,7 +200,7 @@ bool CloudBursts::write(Dictionary& entries, const CloudWrite& write) {
   if (!isTogether) stamp = nextStamp(entries, write);
   lastWrite = write.now;
   lastKey = write.key;
-  return place(entries, write.key, {write.value, stamp, write.device});
+  return place(entries, write.key, {write.value, stamp, write.device}, write.now);
 }
 
 void CloudBursts::finished(Time now) {
@@ -214,7 +222,7 @@ bool CloudBursts::expire(Dictionary& entries, const CloudWrite& write, const std
   expiring = companion;
   endedDevice = ended.device;
   return !(cleared && sameContents(cleared->value, write.value)) &&
-         place(entries, write.key, {write.value, stamp, endedDevice});
+         place(entries, write.key, {write.value, stamp, endedDevice}, write.now);
 }
 
 // Of what was written last: the end time of that flag.

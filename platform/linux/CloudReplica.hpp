@@ -20,6 +20,10 @@ struct CloudStamp {
   std::int64_t microseconds = 0;  // since 1970
   std::int64_t tick = 0;
   friend auto operator<=>(const CloudStamp&, const CloudStamp&) = default;
+
+  // No clock is a hundred years ahead of another: what claims to be could have the last of all stamps, and
+  // nobody could write over it. No device accepts it of another.
+  bool isCredible(Time now) const;
 };
 
 // What one key holds, in a file {"value": v, "time": n, "tick": n, "device": d}, or "removed": true for the

@@ -127,6 +127,17 @@ TEST_F(SynchroniserTest, PublishesOwnWritesTogetherAndNothingThatItMerged) {
   const auto sent = publishNext();
   ASSERT_TRUE(sent);
   EXPECT_EQ(platform::linux_::cloudValues(sent->entries).at("later"), Value(1));
+
+  device.manualClock.time += platform::Time(1e10);
+  write("ahead", 1);
+  device.manualClock.time -= platform::Time(1e10);
+  const auto without = publishNext();
+  ASSERT_TRUE(without);
+  EXPECT_FALSE(without->entries.contains("ahead")) << "the others would refuse all for it";
+  write("ahead", 2);
+  const auto with = publishNext();
+  ASSERT_TRUE(with) << values();
+  EXPECT_TRUE(with->entries.contains("ahead"));
 }
 
 TEST_F(SynchroniserTest, RefusesBadDocumentsWithOneLineEach) {

@@ -240,6 +240,11 @@ TEST(CloudReplicaTest, AClockThatIsYearsAheadIsOverruledAndNotFollowed) {
   ahead.switchOn(5000);
   sane.exchange(ahead);
   EXPECT_EQ(sane.values(), R"(["flag": true, "flagExpiration": 5000.0, "other": 1])");
+  ahead.now = Time(1e11);
+  ahead.write("other", 2);
+  ahead.now = sane.now;
+  ahead.write("other", 3);
+  EXPECT_EQ(ahead.stamp("other").microseconds, 2'000'000'000) << "what no device accepts bars nothing";
 }
 
 TEST(CloudReplicaTest, MergingTakesTheGreaterInWhateverOrder) {
