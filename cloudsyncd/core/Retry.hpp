@@ -20,7 +20,9 @@ class Retry {
   bool failed(Steady now, std::string problem) {
     due = now + delay;
     delay = std::min(delay * 2, longest);
-    return std::exchange(lastProblem, problem) != problem;
+    const bool isAnother = problem != lastProblem;
+    lastProblem = std::move(problem);
+    return isAnother;
   }
   void succeeded() { *this = Retry(); }
   // It is being tried.
