@@ -26,7 +26,7 @@ Alarms AlarmFile::load() {
   if (!bytes) {
     // What cannot be read now may be whole: it is left alone, and nothing is written over it.
     damageStays = bytes.error() != std::errc::no_such_file_or_directory;
-    if (damageStays) log().error("%s: %s; no alarm can be kept", path, bytes.error().message());
+    if (damageStays) log().error("%s: %s; no alarm outlives this run", path, bytes.error().message());
     return {};
   }
   std::string problem;
@@ -41,14 +41,21 @@ Alarms AlarmFile::load() {
 
 platform::Result<void> AlarmFile::save(const Alarms& alarms) {
   if (damageStays) return platform::Outcome::malformedFile;
+  const auto saved = write(alarms);
+  const auto previous = std::exchange(failure, saved ? std::error_code() : saved.error());
+  if (failure && failure != previous)
+    log().error("%s: %s; the alarms are kept in memory until they can be stored", path, failure.message());
+  return saved;
+}
+
+platform::Result<void> AlarmFile::write(const Alarms& alarms) {
   const auto text = platform::linux_::printJson(alarms.toValue(), platform::linux_::JsonStyle::indented);
   if (!text) return text.error();
-  auto saved = files.identity(path)
-                   ? platform::Result<void>()
-                   : platform::linux_::makeFolderDurably(files, platform::linux_::folderOf(path));
-  if (saved) saved = platform::linux_::replaceFile(files, path, *text);
-  if (!saved) log().error("%s: %s", path, saved.error().message());
-  return saved;
+  if (!files.identity(path)) {
+    const auto made = platform::linux_::makeFolderDurably(files, platform::linux_::folderOf(path));
+    if (!made) return made;
+  }
+  return platform::linux_::replaceFile(files, path, *text);
 }
 
 void AlarmFile::moveAside(const std::string& problem) {

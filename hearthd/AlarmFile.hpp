@@ -17,16 +17,18 @@ class AlarmFile {
   // A damaged file is moved aside, with a line in the log; one that cannot be read stays, and nothing can be
   // saved.
   Alarms load();
-  // Durable once it has returned without an error. Outcome::malformedFile where a file stays that
-  // must not be overwritten.
+  // Durable once it has returned without an error, which is logged (once, until it is another).
+  // Outcome::malformedFile where a file stays that must not be overwritten.
   platform::Result<void> save(const Alarms& alarms);
 
  private:
+  platform::Result<void> write(const Alarms& alarms);
   void moveAside(const std::string& problem);
 
   platform::linux_::FileSystem& files;
   const std::string path;
   bool damageStays = false;
+  std::error_code failure;  // of the last save
 };
 
 }  // namespace hearth

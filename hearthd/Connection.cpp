@@ -28,7 +28,6 @@ BusError error(std::string_view name, std::string message) { return {std::string
 BusError notPermitted(std::string message) {
   return error(platform::linux_::notPermittedError, std::move(message));
 }
-BusError failed(std::error_code code) { return error(platform::linux_::failedError, code.message()); }
 
 const char* describe(Job::State state) {
   switch (state) {
@@ -103,11 +102,8 @@ BusReply Connection::perform(std::size_t index, const List& arguments) {
       return controlJob(text(arguments, 0), text(arguments, 1));
     case HearthOperation::listAlarms:
       return listAlarms();
-    case HearthOperation::cancelAlarm: {
-      const auto count = manager.clearAlarms(text(arguments, 0));
-      if (!count) return failed(count.error());
-      return List{static_cast<std::int64_t>(*count)};
-    }
+    case HearthOperation::cancelAlarm:
+      return List{static_cast<std::int64_t>(manager.clearAlarms(text(arguments, 0)))};
   }
   return error(platform::linux_::failedError, "unknown operation");
 }
@@ -133,10 +129,8 @@ BusReply Connection::changeEvent(const List& arguments) {
   std::int64_t generation = 0;
   for (const std::string& owner : owners) {
     const EventKey key{owner, stream, text(arguments, 1)};
-    const auto changed = arguments.size() > 2 ? manager.setAlarm(key, platform::Date{integer(arguments, 2)})
-                                              : manager.clearAlarm(key);
-    if (!changed) return failed(changed.error());
-    generation = *changed;
+    generation = arguments.size() > 2 ? manager.setAlarm(key, platform::Date{integer(arguments, 2)})
+                                      : manager.clearAlarm(key);
   }
   return List{generation};
 }

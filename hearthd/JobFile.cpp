@@ -117,26 +117,27 @@ std::string conflict(const JobDescription& job, const std::vector<JobDescription
 
 }  // namespace
 
-std::vector<JobDescription> readJobs(platform::linux_::FileSystem& files, const std::string& folder,
-                                     const std::string& root) {
+platform::Result<std::vector<JobDescription>> readJobs(platform::linux_::FileSystem& files,
+                                                       const std::string& folder, const std::string& root) {
   std::vector<JobDescription> jobs;
   const auto log = platform::hearthLog("hearthd");
   const auto names = files.list(folder);
   if (!names) {
     log.error("%s: %s", folder, names.error().message());
-    return jobs;
+    if (names.error() == std::errc::no_such_file_or_directory) return jobs;
+    return names.error();
   }
   for (const std::string& name : *names) {
     if (!name.ends_with(".json")) continue;
     const std::string path = folder + "/" + name;
     const auto bytes = platform::linux_::readFile(files, path, fileLimit);
-    std::string problem;
-    JobDescription job;
-    if (bytes) {
-      job = readJob(*bytes, root, problem);
-    } else {
-      problem = bytes.error().message();
+    if (!bytes && bytes.error() != platform::Outcome::tooLarge) {
+      log.error("%s: %s", path, bytes.error().message());
+      return bytes.error();
     }
+    std::string problem = bytes ? "" : bytes.error().message();
+    JobDescription job;
+    if (bytes) job = readJob(*bytes, root, problem);
     if (problem.empty()) problem = conflict(job, jobs);
     if (problem.empty()) {
       jobs.push_back(std::move(job));

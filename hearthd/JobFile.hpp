@@ -28,8 +28,9 @@ struct JobDescription {
 };
 
 // All that are sound, by file name. The others are named in the log, with the place of the fault, and left
-// out; so is one that takes the name, or a service, of an earlier one.
-std::vector<JobDescription> readJobs(platform::linux_::FileSystem& files, const std::string& folder,
-                                     const std::string& root);
+// out; so is one that takes the name, or a service, of an earlier one. What cannot be read at all is an
+// error, which is logged, too.
+platform::Result<std::vector<JobDescription>> readJobs(platform::linux_::FileSystem& files,
+                                                       const std::string& folder, const std::string& root);
 
 }  // namespace hearth

@@ -4,6 +4,7 @@
 #include <unistd.h>
 
 #include <algorithm>
+#include <chrono>
 #include <cstdlib>
 #include <iterator>
 #include <utility>
@@ -16,6 +17,8 @@
 
 namespace hearth {
 namespace {
+
+constexpr std::chrono::seconds untilSavedAgain{10};
 
 using platform::linux_::HearthSignal;
 using platform::linux_::PeerIdentity;
@@ -58,10 +61,19 @@ ServiceManager::ServiceManager(platform::linux_::EventLoop& loop_, platform::lin
       server(platform::linux_::hearthInterface()) {}
 
 platform::Result<void> ServiceManager::start(std::function<void()> ready) {
-  if (const auto listening = listen(); !listening) return listening;
+  if (const auto listening = listen(); !listening) {
+    log().error("%s: %s", paths.hearthdSocket(), listening.error().message());
+    return listening;
+  }
   whenReady = std::move(ready);
-  for (JobDescription& description : readJobs(files, paths.jobs(), paths.root))
-    addJob(std::move(description));
+  // What the system refuses now it may not refuse the next start; a job that is left out would be so for
+  // long.
+  auto descriptions = readJobs(files, paths.jobs(), paths.root);
+  if (!descriptions) return descriptions.error();
+  for (JobDescription& description : *descriptions) {
+    const auto added = addJob(std::move(description));
+    if (!added && added.error() != std::errc::filename_too_long) return added;
+  }
   if (allJobs.empty()) log().default_("%s: no jobs; hearthctl init lays out a device", paths.jobs());
   for (const auto& job : allJobs) job->start();
   startedAll = true;
@@ -92,7 +104,7 @@ platform::Result<void> ServiceManager::listen() {
   return {};
 }
 
-void ServiceManager::addJob(JobDescription description) {
+platform::Result<void> ServiceManager::addJob(JobDescription description) {
   Job::Surroundings surroundings;
   const std::string name = description.name;
   surroundings.lifeLock = paths.run + "/" + name + ".life";
@@ -102,9 +114,10 @@ void ServiceManager::addJob(JobDescription description) {
   };
   surroundings.ended = [this, name] { jobEnded(name); };
   surroundings.changed = [this] { jobChanged(); };
-  if (const auto added = addServices(description, surroundings); !added) return;
+  if (const auto added = addServices(description, surroundings); !added) return added;
   broker.listMatching(name, description.matching);
   allJobs.push_back(std::make_unique<Job>(loop, std::move(description), std::move(surroundings)));
+  return {};
 }
 
 // The sockets are bound once, and stay while the job restarts: its clients wait meanwhile.
@@ -115,8 +128,7 @@ platform::Result<void> ServiceManager::addServices(const JobDescription& descrip
   for (const std::string& service : description.services) {
     auto socket = listenAt(paths.serviceSocket(service));
     if (!socket) {
-      log().error("%s: %s: %s; the job is skipped", description.name, paths.serviceSocket(service),
-                  socket.error().message());
+      log().error("%s: %s: %s", description.name, paths.serviceSocket(service), socket.error().message());
       return socket.error();
     }
     surroundings.services.push_back({service, socket->get()});
@@ -201,28 +213,33 @@ bool ServiceManager::owns(const std::string& job, const std::string& stream) con
   return found && contains(found->description().streams, stream);
 }
 
-template <class Change>
-auto ServiceManager::changeAlarms(Change change)
-    -> platform::Result<decltype(change(std::declval<Alarms&>()))> {
-  Alarms changed = alarms;
-  const auto answer = change(changed);
-  if (const auto saved = alarmFile.save(changed); !saved) return saved.error();
-  alarms = std::move(changed);
+// A period whose alarm a full disk refuses would otherwise have no end. What is not stored is set anew by its
+// job after a restart, or comes once more.
+void ServiceManager::saveAlarms() {
+  saveTimer = {};
+  if (!alarmFile.save(alarms)) saveTimer = loop.callAfter(untilSavedAgain, [this] { saveAlarms(); });
+}
+
+std::int64_t ServiceManager::setAlarm(const EventKey& key, platform::Date date) {
+  const auto generation = alarms.set(key, date);
+  saveAlarms();
   deliverDue();
-  return answer;
+  return generation;
 }
 
-platform::Result<std::int64_t> ServiceManager::setAlarm(const EventKey& key, platform::Date date) {
-  return changeAlarms([&](Alarms& changed) { return changed.set(key, date); });
+std::int64_t ServiceManager::clearAlarm(const EventKey& key) {
+  const bool isStored = alarms.contains(key);
+  const auto generation = alarms.clear(key);
+  if (isStored) saveAlarms();
+  deliverDue();
+  return generation;
 }
 
-platform::Result<std::int64_t> ServiceManager::clearAlarm(const EventKey& key) {
-  if (!alarms.contains(key)) return alarms.clear(key);  // nothing for the disk
-  return changeAlarms([&](Alarms& changed) { return changed.clear(key); });
-}
-
-platform::Result<std::size_t> ServiceManager::clearAlarms(const std::string& name) {
-  return changeAlarms([&](Alarms& changed) { return changed.clearNamed(name); });
+std::size_t ServiceManager::clearAlarms(const std::string& name) {
+  const auto count = alarms.clearNamed(name);
+  saveAlarms();
+  deliverDue();
+  return count;
 }
 
 void ServiceManager::installHandler(Watcher watcher, const std::string& job, const std::string& stream) {
@@ -235,11 +252,7 @@ void ServiceManager::installHandler(Watcher watcher, const std::string& job, con
 }
 
 void ServiceManager::taken(const EventKey& key, std::int64_t generation) {
-  Alarms changed = alarms;
-  if (!changed.taken(key, generation)) return;
-  // Gone from memory even where the disk refuses: this run does not deliver it again, the next one may.
-  alarms = std::move(changed);
-  if (!alarmFile.save(alarms)) log().error("alarm %s may come again after a restart", key.name);
+  if (alarms.taken(key, generation)) saveAlarms();
 }
 
 void ServiceManager::deliver(const EventKey& key) {

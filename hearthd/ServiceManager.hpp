@@ -29,6 +29,7 @@ class ServiceManager {
                  platform::linux_::Paths paths);
 
   // Binds the sockets and starts the jobs; `ready` is called once every one has been given its first start.
+  // After a failure, which is logged, none is started.
   platform::Result<void> start(std::function<void()> ready);
   // `stopped` is called when no job runs any more.
   void stop(std::function<void()> stopped);
@@ -44,10 +45,11 @@ class ServiceManager {
   // The jobs that consume a stream.
   std::vector<std::string> consumers(const std::string& stream) const;
   bool owns(const std::string& job, const std::string& stream) const;
-  // Durable before they return; after an error everything is as it was. The answers are those of Alarms.
-  platform::Result<std::int64_t> setAlarm(const EventKey& key, platform::Date date);
-  platform::Result<std::int64_t> clearAlarm(const EventKey& key);
-  platform::Result<std::size_t> clearAlarms(const std::string& name);
+  // Durable before they return, unless the disk refuses: then for this run at once, and durable when it can
+  // be. The answers are those of Alarms.
+  std::int64_t setAlarm(const EventKey& key, platform::Date date);
+  std::int64_t clearAlarm(const EventKey& key);
+  std::size_t clearAlarms(const std::string& name);
   std::vector<Alarm> listAlarms() const { return alarms.list(); }
   void installHandler(Watcher watcher, const std::string& job, const std::string& stream);
   void taken(const EventKey& key, std::int64_t generation);
@@ -61,13 +63,12 @@ class ServiceManager {
 
  private:
   platform::Result<void> listen();
-  void addJob(JobDescription description);
+  platform::Result<void> addJob(JobDescription description);
   platform::Result<void> addServices(const JobDescription& description, Job::Surroundings& surroundings);
   void adoptLink(const std::string& job, platform::linux_::UniqueDescriptor link, pid_t pid);
   void jobEnded(const std::string& job);
   void jobChanged();
-  template <class Change>
-  auto changeAlarms(Change change) -> platform::Result<decltype(change(std::declval<Alarms&>()))>;
+  void saveAlarms();
   void tellPosted();
   void tell(const std::string& name);
   void deliverDue();
@@ -85,6 +86,7 @@ class ServiceManager {
   std::set<std::string> posted;
   platform::linux_::EventSource wallTimer;
   platform::linux_::EventSource steadyTimer;
+  platform::linux_::EventSource saveTimer;
 
   std::vector<platform::linux_::UniqueDescriptor> serviceSockets;
   std::vector<std::unique_ptr<Job>> allJobs;

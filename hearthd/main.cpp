@@ -118,10 +118,7 @@ int main(int count, char** arguments) {
   const auto stop = [&] { manager.stop([&] { loop.stop(); }); };
   const auto terminated = loop.watchSignal(SIGTERM, stop);
   const auto interrupted = loop.watchSignal(SIGINT, stop);
-  if (const auto started = manager.start(announceReady); !started) {
-    say("hearthd: " + paths.hearthdSocket() + ": " + started.error().message() + "\n");
-    return failed;
-  }
+  if (!manager.start(announceReady)) return failed;
   loop.run();
   return 0;
 }
