@@ -38,8 +38,8 @@ inline constexpr std::size_t outstanding = 16;
 
 // One turn of the loop reads this much of a client, then the others have theirs.
 inline constexpr std::size_t bytesPerTurn = 16 * 1024;
-// Left free when clients are accepted, beside what those in their handshake will take: the process has files to
-// open, and a client that is accepted with the last one could only be refused.
+// Left free when clients are accepted, beside what those in their handshake will take: the process has files
+// to open, and a client that is accepted with the last one could only be refused.
 inline constexpr std::size_t spareDescriptors = 64;
 
 }  // namespace platform::linux_::limits
