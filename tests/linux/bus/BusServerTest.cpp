@@ -16,8 +16,6 @@ using testing::ElementsAre;
 using testing::HasSubstr;
 using testing::Not;
 
-constexpr std::size_t mebibyte = 1024 * 1024;
-
 using BusServerTest = World;
 
 TEST_F(BusServerTest, CallsThatDoNotFitGetAnErrorAndNoMore) {
@@ -32,38 +30,6 @@ TEST_F(BusServerTest, CallsThatDoNotFitGetAnErrorAndNoMore) {
   Wire wire = client();
   for (const auto& [message, answer] : rows) EXPECT_TRUE(wire.send(message) && wire.reads(answer)) << answer;
   EXPECT_THAT(calls, ElementsAre("text"));
-}
-
-TEST_F(BusServerTest, DamageEndsItsClientAloneAndIsNotReadOn) {
-  const std::string good = callMessage("Echo", "good");
-  const auto damaged = [&](std::size_t at, char byte) {
-    std::string message = good;
-    message[at] = byte;
-    return message;
-  };
-  std::string giant = good.substr(0, 16);
-  giant[7] = 0x07;  // a body of 112 MiB
-  const std::pair<const char*, std::string> rows[] = {
-      {"giant", giant},
-      {"damaged, then giant", damaged(17, 9) + giant},
-      {"no byte order", damaged(0, 'x')},
-      {"descriptors that are not there", damaged(16, 9)},
-  };
-  Wire witness = client();
-  int ended = 0;
-  for (const auto& [name, bytes] : rows) {
-    SCOPED_TRACE(name);
-    Wire wire = client();
-    std::size_t sent = bytes.size();
-    // Until the server has had enough; what is not damaged in itself it would go on reading.
-    for (bool taken = wire.send(bytes + good); taken && sent < 8 * mebibyte; sent += 4096)
-      taken = wire.send(std::string(4096, '\0'));
-    EXPECT_LT(sent, mebibyte) << "what is not read takes no memory";
-    EXPECT_EQ(wire.readToEnd(), "");
-    EXPECT_TRUE(witness.isServed());
-    EXPECT_EQ(closed, ++ended);
-  }
-  EXPECT_THAT(calls, Not(testing::Contains("good")));
 }
 
 TEST_F(BusServerTest, PipelinedCallsAreAnsweredAsTheyAreCompletedThoughTheClientSaysNoMore) {
@@ -245,27 +211,6 @@ TEST_F(HastyBusServerTest, WhoeverStallsIsDisconnected) {
   late.socket = UniqueDescriptor(ends[1]);
   late.shakeHands();
   EXPECT_TRUE(late.isServed()) << "adopted: it takes its time";
-}
-
-TEST_F(HastyBusServerTest, AFloodThatIsNeverReadIsBoundedAndEnds) {
-  Wire witness = client();
-  Wire flood = client();
-  const std::string message = callMessage("Echo", std::string(4096, 'x'));
-  std::size_t sent = 0;
-  bool blocked = false;
-  for (;;) {
-    const ssize_t count = flood.sendSome(message.substr(sent % message.size()));
-    if (count < 0 && errno != EAGAIN) break;  // disconnected
-    if (count < 0) {
-      blocked = true;
-      EXPECT_TRUE(witness.isServed());
-    } else {
-      sent += static_cast<std::size_t>(count);
-      ASSERT_LT(sent, 2 * mebibyte);
-    }
-  }
-  EXPECT_TRUE(blocked) << "reading never stopped";
-  EXPECT_TRUE(witness.isServed());
 }
 
 }  // namespace

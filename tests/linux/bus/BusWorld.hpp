@@ -28,20 +28,24 @@ inline std::string text(const std::string& value) {
 }
 inline std::string answerTo(std::uint32_t serial) { return std::string("\5\1u\0", 4) + number(serial); }
 
-// A method call with a text as its argument, written by hand: libraries refuse to make bad ones.
+// What a call is of: an object's interface, and the types of its arguments.
+struct Callee {
+  std::string path = "/test", interface = "test.Interface", signature = "s";
+};
+// A method call with a text as its argument, or none, written by hand: libraries refuse to make bad ones.
 inline std::string callMessage(const std::string& member, const std::string& argument,
-                               std::uint32_t serial = 1) {
+                               std::uint32_t serial = 1, const Callee& callee = {}) {
   const auto align = [](std::string& bytes) { bytes.resize((bytes.size() + 7) / 8 * 8); };
   std::string fields;
   const auto add = [&](char code, char type, const std::string& value) {
     align(fields);
     fields += std::string{code, 1, type, 0} + value;
   };
-  add(1, 'o', text("/test"));
-  add(2, 's', text("test.Interface"));
+  add(1, 'o', text(callee.path));
+  add(2, 's', text(callee.interface));
   add(3, 's', text(member));
-  add(8, 'g', std::string("\1s\0", 3));
-  const std::string body = text(argument);
+  add(8, 'g', static_cast<char>(callee.signature.size()) + callee.signature + '\0');
+  const std::string body = callee.signature.empty() ? "" : text(argument);
   std::string message{'l', 1, 0, 1};
   message += number(static_cast<std::uint32_t>(body.size())) + number(serial) +
              number(static_cast<std::uint32_t>(fields.size())) + fields;
