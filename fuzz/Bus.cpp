@@ -1,60 +1,176 @@
-// What a client writes to the socket of a service: from its first byte on or, where the first is even, behind
-// a handshake. hearthd's interface is served, as its operations take all types that there are.
-#include <poll.h>
+// What comes through a socket; the first byte says to whom. The client service: from a client that is
+// refused, one that is let in, one that is through its handshake. hearthd: from root, a stranger, a job on
+// its link. A job: from hearthd. The sockets are real, and so is the code that serves them, all on one
+// thread.
+#include <sys/epoll.h>
 #include <sys/socket.h>
-#include <unistd.h>
-
-#include <memory>
-#include <string>
 
 #include "fuzz/Target.hpp"
-#include "platform/linux/BusServer.hpp"
+#include "hearthd/AlarmFile.hpp"
+#include "hearthd/Connection.hpp"
+#include "hearthd/ListeningSocket.hpp"
+#include "hearthd/ServiceManager.hpp"
+#include "pairwelld/Names.hpp"
+#include "pairwelld/service/ConduitConnection.hpp"
+#include "pairwelld/service/ConduitListener.hpp"
+#include "platform/linux/BusHandshake.hpp"
+#include "platform/linux/BusServiceListener.hpp"
 #include "platform/linux/HearthInterface.hpp"
+#include "platform/linux/HearthLink.hpp"
+#include "tests/fakes/RealFiles.hpp"
+#include "tests/pairwelld/World.hpp"
 
 namespace linux_ = platform::linux_;
+using linux_::UniqueDescriptor;
 
 namespace {
 
-struct Handler : linux_::BusHandler {
-  void call(std::size_t operation, platform::List arguments, linux_::BusCompletion completion) override {
-    fuzz::require(operation < linux_::hearthInterface().operations.size());
-    static_cast<void>(platform::describe(platform::Value(std::move(arguments))));
-    completion(linux_::BusError{std::string(linux_::failedError), "no"});
+enum class Whom { refused, admitted, authenticated, root, stranger, job, hearthd, count };
+
+const std::string clientsHandshake("\0AUTH EXTERNAL\r\nDATA\r\nBEGIN\r\n", 29);
+const std::string hearthsHandshake = "DATA\r\nOK 0123456789abcdef0123456789abcdef\r\nERROR\r\n";
+
+// However it is cut, it says the same.
+void checkHandshake(std::string_view text) {
+  using Progress = linux_::BusHandshake::Progress;
+  linux_::BusHandshake whole(0, "server"), pieces(0, "server");
+  std::string answer, answers;
+  std::string_view rest = text;
+  const Progress progress = whole.advance(rest, answer);
+  Progress reached = Progress::going;
+  std::string held;
+  for (std::size_t at = 0; at < text.size() && reached == Progress::going; ++at) {
+    held += text[at];
+    std::string_view left = held;
+    reached = pieces.advance(left, answers);
+    held = left;
   }
-  void closed() override {}
+  fuzz::require(reached == progress && answers == answer);
+}
+
+struct World : pairwell::World {
+  // Sends `bytes`, then shuts that side, and lets everybody do what this brings forth; what comes back.
+  std::string talk(const UniqueDescriptor& socket, std::string_view bytes) {
+    constexpr int quiet = 20;  // turns; whatever moves needs some four to be seen here
+    std::string answers;
+    int idle = 0;
+    const std::function<void()> turn = [&] {
+      run();
+      const ssize_t sent = ::send(socket.get(), bytes.data(), bytes.size(), MSG_NOSIGNAL | MSG_DONTWAIT);
+      if (sent > 0) bytes.remove_prefix(static_cast<std::size_t>(sent));
+      char buffer[4096];
+      const ssize_t got = ::recv(socket.get(), buffer, sizeof buffer, MSG_DONTWAIT);
+      if (got > 0) answers.append(buffer, static_cast<std::size_t>(got));
+      idle = sent > 0 || got > 0 ? 0 : idle + 1;
+      if (idle == quiet) ::shutdown(socket.get(), SHUT_WR);
+      idle < 2 * quiet ? loop.async(turn) : loop.stop();
+    };
+    turn();
+    loop.run();
+    return answers;
+  }
+
+  // Alike for all inputs, which share the sockets' names.
+  static std::string folder() {
+    static const fakes::TemporaryFolder made;
+    return made.path;
+  }
+  linux_::EventLoop loop;
+  fakes::MemoryFileSystem files;
 };
 
-void serve(linux_::BusServer& server, int client) {
-  pollfd ready{server.descriptor(), POLLIN, 0};
-  while (::poll(&ready, 1, 0) > 0) {
-    server.dispatch();
-    char answers[4096];
-    while (::recv(client, answers, sizeof answers, MSG_DONTWAIT) > 0) {
-    }
+struct Pair {
+  Pair() {
+    int ends[2];
+    fuzz::require(::socketpair(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC | SOCK_NONBLOCK, 0, ends) == 0);
+    own.reset(ends[0]);
+    other.reset(ends[1]);
   }
+  UniqueDescriptor own, other;
+};
+
+// Lets everybody in: what a grant needs depends on where the build lies.
+struct Admitting : platform::ServiceListenerDelegate {
+  bool listenerShouldAcceptNewConnection(
+      const std::shared_ptr<platform::ServiceListener>&,
+      const std::shared_ptr<platform::ClientConnection>& connection) override {
+    connection->setExportedInterface(platform::RadixUserControllerConduitInterface());
+    connection->setExportedObject(
+        pairwell::ConduitConnection::create(service, service->serialQueue, connection));
+    connection->resume();
+    return true;
+  }
+  std::shared_ptr<pairwell::ConduitListener> service;
+};
+
+void callService(World& world, Whom whom, const std::string& bytes) {
+  const std::string path = World::folder() + "/service.sock";
+  linux_::Entitlements entitlements(world.files, linux_::Paths::under("/nowhere"));
+  const auto listener = linux_::BusServiceListener::create(world.loop, entitlements, pairwell::names::service,
+                                                           std::move(*hearth::listenAt(path)));
+  const auto admitting = std::make_shared<Admitting>();
+  admitting->service = pairwell::ConduitListener::create();
+  admitting->service->debugManager = world.makeDebugManager();
+  listener->setQueue(admitting->service->serialQueue);
+  if (whom == Whom::refused)
+    listener->setDelegate(admitting->service);
+  else
+    listener->setDelegate(admitting);
+  listener->resume();
+  const auto answers = world.talk(fakes::socketAt(path, ::connect), bytes);
+  if (whom == Whom::refused) fuzz::require(answers == linux_::busRefusal);
+  if (whom == Whom::authenticated) fuzz::require(answers.starts_with("DATA\r\nOK "));
+}
+
+// A job is there that is never started, as its lock cannot be had.
+void callHearth(World& world, Whom whom, const std::string& bytes) {
+  const auto paths = linux_::Paths::under(World::folder());
+  std::filesystem::create_directories(paths.run + "/a.life");
+  world.files.put(paths.jobs() + "/a.json",
+                  R"({"name": "a", "program": "/a", "streams": ["s"], "matching": ["n"]})");
+  hearth::ServiceManager manager(world.loop, world.files, paths);
+  fuzz::require(manager.start([] {}).has_value());
+  linux_::BusServer server(linux_::hearthInterface());
+  const auto watch =
+      world.loop.watchDescriptor(server.descriptor(), EPOLLIN, [&](std::uint32_t) { server.dispatch(); });
+  Pair pair;
+  const hearth::Connection::Rights rights{whom == Whom::root, whom == Whom::job ? "a" : ""};
+  manager.connected(99, server.adopt(std::move(pair.other), linux_::PeerIdentity(),
+                                     std::make_shared<hearth::Connection>(manager, 99, rights)));
+  fuzz::require(world.talk(pair.own, bytes).starts_with("DATA\r\nOK "));
+  // What it has promised is on disk.
+  const auto promised = manager.listAlarms();
+  const auto kept = hearth::AlarmFile(world.files, paths.alarms()).load().list();
+  fuzz::require(kept.size() == promised.size() && (kept.empty() || whom != Whom::stranger));
+  for (std::size_t index = 0; index < kept.size(); ++index)
+    fuzz::require(kept[index].key == promised[index].key && kept[index].date == promised[index].date);
+}
+
+void answerJob(World& world, const std::string& bytes) {
+  Pair pair;
+  const auto& queue = world.platform.loop.queue;
+  linux_::HearthLink hearth(world.loop, std::move(pair.other), queue, [] {});
+  std::int32_t token = 0;
+  hearth.setHandler("s", queue, [](const platform::Dictionary&) {});
+  hearth.setEvent("s", "n", platform::Dictionary{{"Date", platform::Date{5}}});
+  hearth.registerHandler("n", token, queue, [](std::int32_t) {});
+  world.talk(pair.own, bytes);
 }
 
 }  // namespace
 
 int LLVMFuzzerTestOneInput(const std::uint8_t* data, std::size_t size) {
-  constexpr std::string_view handshake{"\0AUTH EXTERNAL\r\nDATA\r\nBEGIN\r\n", 29};
   if (size == 0) return 0;
-  int ends[2];
-  fuzz::require(::socketpair(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC | SOCK_NONBLOCK, 0, ends) == 0);
-  const linux_::UniqueDescriptor client(ends[0]);
-  linux_::BusServer server(linux_::hearthInterface());
-  linux_::PeerIdentity peer;
-  peer.uid = ::geteuid();
-  server.adopt(linux_::UniqueDescriptor(ends[1]), peer, std::make_shared<Handler>());
-  std::string input(data[0] % 2 == 0 ? handshake : "");
-  input += fuzz::textOf(data + 1, size - 1);
-  for (std::string_view rest = input; !rest.empty();) {
-    const ssize_t sent = ::send(client.get(), rest.data(), rest.size(), MSG_NOSIGNAL);
-    if (sent > 0) rest.remove_prefix(static_cast<std::size_t>(sent));
-    if (sent < 0 && errno != EAGAIN) break;  // the server has closed
-    serve(server, client.get());
+  const auto whom = static_cast<Whom>(data[0] % static_cast<int>(Whom::count));
+  const std::string bytes(fuzz::textOf(data + 1, size - 1));
+  World world;
+  if (whom <= Whom::authenticated) {
+    callService(world, whom, (whom == Whom::authenticated ? clientsHandshake : "") + bytes);
+  } else if (whom == Whom::hearthd) {
+    answerJob(world, hearthsHandshake + bytes);
+  } else {
+    callHearth(world, whom, clientsHandshake + bytes);
   }
-  ::shutdown(client.get(), SHUT_WR);
-  serve(server, client.get());
+  checkHandshake(bytes);
   return 0;
 }

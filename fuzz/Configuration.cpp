@@ -1,42 +1,103 @@
-// What an administrator writes in etc/: jobs, the device, entitlements, the account.
+// What lies in etc/, what the machine says of itself, and hearthd's own file of alarms.
+#include <sys/stat.h>
+#include <unistd.h>
+
+#include <fstream>
 #include <string>
 
 #include "cloudsyncd/CloudFile.hpp"
 #include "cloudsyncd/Transports.hpp"
 #include "fuzz/Target.hpp"
+#include "hearthd/AlarmFile.hpp"
 #include "hearthd/JobFile.hpp"
-#include "platform/LogSink.hpp"
-#include "platform/linux/DeviceFile.hpp"
 #include "platform/linux/Entitlements.hpp"
-#include "tests/fakes/MemoryFileSystem.hpp"
+#include "platform/linux/FileDeviceProperties.hpp"
+#include "platform/linux/Json.hpp"
+#include "tests/fakes/RealFiles.hpp"
+
+namespace linux_ = platform::linux_;
 
 namespace {
 
-struct SilentLog : platform::LogSink {
-  bool enabled(const platform::LogChannel&, platform::LogLevel) override { return false; }
-  void write(const platform::LogChannel&, platform::LogLevel, std::string_view,
-             std::span<const platform::LogArgument>) override {}
-};
+// Who may write to a grant and its program is asked of the disk, whatever the files' contents come from.
+linux_::Paths pathsOnDisk() {
+  static const fakes::TemporaryFolder root;
+  static const auto paths = linux_::Paths::under(root.path);
+  for (const std::string& file : {paths.entitlements() + "/a.json", root.path + "/program"}) {
+    if (std::filesystem::exists(file)) continue;
+    ::umask(022);
+    std::filesystem::create_directories(linux_::folderOf(file));
+    std::ofstream made(file);
+  }
+  return paths;
+}
+
+void checkJob(fuzz::World& world, const std::string& folder) {
+  const auto jobs = hearth::readJobs(world.files, folder, "/root");
+  fuzz::require(jobs.empty() == (world.logged().size() == 1));
+  for (const auto& job : jobs)
+    fuzz::require(!job.name.empty() && job.name.find('/') == std::string::npos &&
+                  job.program.starts_with('/'));
+}
+
+void checkGrant(fuzz::World& world, const linux_::Paths& paths) {
+  const auto grants = linux_::readGrants(world.files, paths);
+  fuzz::require(grants.size() == 1 && (!grants[0].problem.empty() || grants[0].executable.starts_with('/')));
+  linux_::PeerIdentity peer;
+  peer.uid = ::geteuid();
+  fuzz::require(linux_::Entitlements(world.files, paths).of(peer).empty());  // it runs nothing
+}
+
+void checkDevice(fuzz::World& world, const std::string& path) {
+  linux_::DeviceFile file(world.files, path);
+  linux_::FileDeviceProperties properties(world.files, file);
+  std::int32_t error = 0;
+  for (const char* key : {"UserAssignedDeviceName", "BuildVersion", "ProductVersion", "UniqueDeviceID"})
+    static_cast<void>(properties.copyAnswerWithError(key, error));
+  static_cast<void>(properties.isInternalBuild());
+  char buffer[37];
+  std::size_t length = sizeof buffer;
+  if (linux_::LinuxSystemControl(world.files, file).sysctlbyname("kern.bootsessionuuid", buffer, &length) ==
+      0)
+    fuzz::require(length <= sizeof buffer && buffer[length - 1] == '\0');
+}
+
+void checkAlarms(fuzz::World& world, std::string_view text, const std::string& path) {
+  hearth::AlarmFile file(world.files, path);
+  auto alarms = file.load();
+  if (!world.files.exists(path)) fuzz::require(world.files.bytes(path + ".damaged-1") == text);
+  for (const auto& alarm : alarms.list()) alarms.handlerInstalled(alarm.key.job, alarm.key.stream, {});
+  for (const auto& alarm : alarms.takeDue({platform::Time(1e9), platform::Time(9)}))
+    fuzz::require(alarms.set(alarm.key, alarm.date) > alarm.generation);
+  static_cast<void>(alarms.next({}));
+  fuzz::require(file.save(alarms).has_value());
+  fuzz::require(file.load().toValue() == alarms.toValue());
+}
+
+void checkCloud(std::string_view text) {
+  std::string problem;
+  const auto membership = cloudsync::parseMembership(text, problem);
+  fuzz::require(membership || !problem.empty());
+  if (!membership) return;
+  static_cast<void>(cloudsync::problemOf(*membership));
+  const auto kept = linux_::printJson(cloudsync::fieldsOf(*membership), linux_::JsonStyle::line);
+  fuzz::require(kept && *cloudsync::parseMembership(*kept, problem) == *membership);
+}
 
 }  // namespace
 
 int LLVMFuzzerTestOneInput(const std::uint8_t* data, std::size_t size) {
-  static SilentLog log;
-  platform::installLogSink(log);
   const auto text = fuzz::textOf(data, size);
-  const auto paths = platform::linux_::Paths::under("/nowhere");
-  fakes::MemoryFileSystem files;
-  for (const std::string& path : {paths.jobs() + "/a.json", paths.entitlements() + "/a.json", paths.device()})
-    files.put(path, text);
-  for (const auto& job : hearth::readJobs(files, paths.jobs(), "/nowhere"))
-    fuzz::require(!job.name.empty() && job.program.starts_with('/'));
-  for (const auto& grant : platform::linux_::readGrants(files, paths))
-    fuzz::require(!grant.problem.empty());  // its executable is not there
-  platform::linux_::DeviceFile(files, paths.device()).entry("DeviceName");
-
-  std::string problem;
-  const auto membership = cloudsync::parseMembership(text, problem);
-  fuzz::require(membership || !problem.empty());
-  if (membership) static_cast<void>(cloudsync::problemOf(*membership));
+  const auto paths = pathsOnDisk();
+  fuzz::World world;
+  for (const std::string& path :
+       {paths.jobs() + "/a.json", paths.entitlements() + "/a.json", paths.device(), paths.alarms(),
+        std::string("/etc/os-release"), std::string("/etc/machine-id")})
+    world.files.put(path, text);
+  checkJob(world, paths.jobs());
+  checkGrant(world, paths);
+  checkDevice(world, paths.device());
+  checkAlarms(world, text, paths.alarms());
+  checkCloud(text);
   return 0;
 }
