@@ -137,8 +137,11 @@ void Synchroniser::takeIn(const Dictionary& entries) {
   settle("");
 }
 
-// The name outlives a replica that is deleted under us.
+// The name outlives a replica that is deleted under us. What a person's edit has left may be no name: nobody
+// would look for a document that is called so, and its path may lead elsewhere.
 std::string Synchroniser::nameDevice(Dictionary& replica) {
+  const auto* name = platform::find<std::string>(replica, "device");
+  if (!name || !isName(*name)) replica.erase("device");
   if (!knownDevice.empty() && !replica.contains("device")) replica["device"] = knownDevice;
   return knownDevice = platform::linux_::cloudDeviceOf(replica);
 }
