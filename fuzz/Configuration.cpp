@@ -1,6 +1,5 @@
 // What lies in etc/, what the machine says of itself, and hearthd's own file of alarms.
 #include <sys/stat.h>
-#include <unistd.h>
 
 #include <fstream>
 #include <string>
@@ -19,16 +18,15 @@ namespace linux_ = platform::linux_;
 
 namespace {
 
-// Who may write to a grant and its program is asked of the disk, whatever the files' contents come from.
+// Who may write to a grant and its program is asked of the disk, wherever their contents come from.
 linux_::Paths pathsOnDisk() {
   static const fakes::TemporaryFolder root;
-  static const auto paths = linux_::Paths::under(root.path);
-  for (const std::string& file : {paths.entitlements() + "/a.json", root.path + "/program"}) {
-    if (std::filesystem::exists(file)) continue;
-    ::umask(022);
-    std::filesystem::create_directories(linux_::folderOf(file));
-    std::ofstream made(file);
-  }
+  const auto paths = linux_::Paths::under(root.path);
+  if (std::filesystem::exists(paths.entitlements())) return paths;
+  ::umask(022);
+  std::filesystem::create_directories(paths.entitlements());
+  for (const std::string& file : {paths.entitlements() + "/a.json", root.path + "/program"})
+    std::ofstream{file};
   return paths;
 }
 
@@ -43,9 +41,8 @@ void checkJob(fuzz::World& world, const std::string& folder) {
 void checkGrant(fuzz::World& world, const linux_::Paths& paths) {
   const auto grants = linux_::readGrants(world.files, paths);
   fuzz::require(grants.size() == 1 && (!grants[0].problem.empty() || grants[0].executable.starts_with('/')));
-  linux_::PeerIdentity peer;
-  peer.uid = ::geteuid();
-  fuzz::require(linux_::Entitlements(world.files, paths).of(peer).empty());  // it runs nothing
+  // To who runs nothing.
+  fuzz::require(linux_::Entitlements(world.files, paths).of(linux_::PeerIdentity()).empty());
 }
 
 void checkDevice(fuzz::World& world, const std::string& path) {
