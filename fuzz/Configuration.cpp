@@ -31,11 +31,15 @@ linux_::Paths pathsOnDisk() {
 }
 
 void checkJob(fuzz::World& world, const std::string& folder) {
-  const auto jobs = hearth::readJobs(world.files, folder, "/root");
+  auto jobs = hearth::readJobs(world.files, folder, "/root");
   fuzz::require(jobs.empty() == (world.logged().size() == 1));
-  for (const auto& job : jobs)
-    fuzz::require(!job.name.empty() && job.name.find('/') == std::string::npos &&
-                  job.program.starts_with('/'));
+  for (auto& job : jobs) {
+    fuzz::require(job.program.starts_with('/'));
+    job.services.push_back(job.name);
+    for (const std::string& name : job.services)
+      fuzz::require(name.find_first_of(std::string_view("/\0", 2)) == std::string::npos &&
+                    !name.starts_with('.'));
+  }
 }
 
 void checkGrant(fuzz::World& world, const linux_::Paths& paths) {

@@ -25,9 +25,11 @@ class Reader {
     return *text;
   }
 
-  // Part of a file name below run/.
+  // Part of a file name below run/, whose path the system would read to the first NUL only: "hearthd.sock"
+  // with one behind it would be hearthd's own socket.
   std::string fileName(std::string_view key, std::string name) {
-    if (name.find('/') != std::string::npos || name.starts_with('.')) fail(key, "cannot be a file's name");
+    if (name.find_first_of(std::string_view("/\0", 2)) != std::string::npos || name.starts_with('.'))
+      fail(key, "cannot be a file's name");
     return name;
   }
 
