@@ -40,7 +40,8 @@ constexpr std::optional<Case> fromRawValue(std::string_view text) {
 template <class Case>
 constexpr auto allCases() {
   std::array<Case, rawValues<Case>.size()> cases{};
-  for (std::size_t index = 0; index < cases.size(); ++index) cases[index] = rawValues<Case>[index].first;
+  std::size_t index = 0;
+  for (const auto& named : rawValues<Case>) cases[index++] = named.first;
   return cases;
 }
 
