@@ -42,7 +42,7 @@ std::vector<UniqueDescriptor> endHolders(const std::string& path) {
   struct stat file {};
   if (::stat(path.c_str(), &file) != 0) return ended;
   forEachEntry("/proc", [&](const fs::path& process) {
-    const pid_t pid = std::atoi(process.filename().c_str());
+    const pid_t pid = std::atoi(process.filename().c_str());  // NOLINT(cert-err34-c): 0 where it is no number
     if (pid <= 0 || pid == ::getpid()) return;
     // The handle first: what is then found to hold the file is what the handle stands for, or has ended.
     UniqueDescriptor handle = openProcess(pid);
