@@ -32,8 +32,8 @@ linux_::Paths pathsOnDisk() {
 
 void checkJob(fuzz::World& world, const std::string& folder) {
   auto jobs = hearth::readJobs(world.files, folder, "/root");
-  fuzz::require(jobs.empty() == (world.logged().size() == 1));
-  for (auto& job : jobs) {
+  fuzz::require(jobs && jobs->empty() == (world.logged().size() == 1));
+  for (auto& job : *jobs) {
     fuzz::require(job.program.starts_with('/'));
     job.services.push_back(job.name);
     for (const std::string& name : job.services)
