@@ -1,11 +1,13 @@
 #include "hearthd/core/Broker.hpp"
 
+#include "platform/ClientLimits.hpp"
+
 namespace hearth {
 
 bool Broker::watch(Watcher watcher, const std::string& name) {
-  if (name.size() > nameLength) return false;
+  if (name.size() > platform::limits::nameBytes) return false;
   auto& names = byWatcher[watcher];
-  if (names.size() >= namesPerWatcher && names.count(name) == 0) return false;
+  if (names.size() >= platform::limits::watchedNames && names.count(name) == 0) return false;
   names.insert(name);
   byName[name].insert(watcher);
   return true;

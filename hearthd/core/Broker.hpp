@@ -12,10 +12,6 @@ namespace hearth {
 class Broker {
  public:
   using Watcher = std::uint64_t;
-  // Anyone may watch, so a connection's share of memory has an end: names are a few dozen bytes, and whoever
-  // watches knows a handful.
-  static constexpr std::size_t namesPerWatcher = 64;
-  static constexpr std::size_t nameLength = 255;
 
   // Watching a name twice is watching it once. False when the watcher has as many names as it may, or the
   // name is longer than names are.

@@ -9,9 +9,9 @@
 #include <cerrno>
 #include <utility>
 
+#include "platform/ClientLimits.hpp"
 #include "platform/LogSink.hpp"
 #include "platform/Platform.hpp"
-#include "platform/linux/BusLimits.hpp"
 
 namespace platform::linux_ {
 

@@ -5,7 +5,7 @@
 #include <cstring>
 #include <utility>
 
-#include "platform/linux/BusLimits.hpp"
+#include "platform/ClientLimits.hpp"
 
 namespace platform::linux_ {
 namespace {

@@ -9,10 +9,10 @@
 #include <mutex>
 #include <optional>
 
+#include "platform/ClientLimits.hpp"
 #include "platform/LogSink.hpp"
 #include "platform/Platform.hpp"
 #include "platform/linux/BusAcceptor.hpp"
-#include "platform/linux/BusLimits.hpp"
 #include "platform/linux/BusSession.hpp"
 #include "platform/linux/DeadlineTimer.hpp"
 

@@ -11,9 +11,9 @@
 #include <variant>
 #include <vector>
 
+#include "platform/ClientLimits.hpp"
 #include "platform/Result.hpp"
 #include "platform/Value.hpp"
-#include "platform/linux/BusLimits.hpp"
 #include "platform/linux/PeerIdentity.hpp"
 #include "platform/linux/UniqueDescriptor.hpp"
 

@@ -4,7 +4,7 @@
 #include <string>
 #include <vector>
 
-#include "platform/linux/BusLimits.hpp"
+#include "platform/ClientLimits.hpp"
 #include "platform/linux/BusServer.hpp"
 #include "platform/linux/UniqueDescriptor.hpp"
 

@@ -8,8 +8,8 @@
 #include <algorithm>
 #include <cerrno>
 
+#include "platform/ClientLimits.hpp"
 #include "platform/LogSink.hpp"
-#include "platform/linux/BusLimits.hpp"
 #include "platform/linux/BusValue.hpp"
 
 namespace platform::linux_ {

@@ -12,6 +12,7 @@
 #include "hearthd/core/Broker.hpp"
 #include "hearthd/core/PendingEvents.hpp"
 #include "hearthd/core/Restarts.hpp"
+#include "platform/ClientLimits.hpp"
 
 namespace hearth {
 namespace {
@@ -156,8 +157,8 @@ TEST(Broker, KnowsWhoWatchesUntilTheyLeave) {
   EXPECT_THAT(broker.watchers("a"), ElementsAre(2));
   EXPECT_THAT(broker.watchers("b"), IsEmpty());
   std::size_t most = 0;
-  while (most <= Broker::namesPerWatcher && broker.watch(3, std::to_string(most))) ++most;
-  EXPECT_EQ(most, Broker::namesPerWatcher);
+  while (most <= platform::limits::watchedNames && broker.watch(3, std::to_string(most))) ++most;
+  EXPECT_EQ(most, platform::limits::watchedNames);
   EXPECT_TRUE(broker.watch(3, "0")) << "watched already";
 }
 

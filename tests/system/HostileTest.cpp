@@ -15,7 +15,7 @@
 namespace processes {
 namespace {
 
-namespace limits = platform::linux_::limits;
+namespace limits = platform::limits;
 using platform::linux_::answerTo;
 using platform::linux_::Callee;
 using platform::linux_::callMessage;

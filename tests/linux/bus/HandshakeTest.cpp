@@ -3,7 +3,7 @@
 
 #include <gtest/gtest.h>
 
-#include "platform/linux/BusLimits.hpp"
+#include "platform/ClientLimits.hpp"
 
 namespace platform::linux_ {
 namespace {

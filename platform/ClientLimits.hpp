@@ -1,10 +1,10 @@
-// What one client may take from a BusServer, so that no client costs the others theirs.
+// What local clients may take, so that none costs the others theirs.
 #pragma once
 
 #include <chrono>
 #include <cstddef>
 
-namespace platform::linux_::limits {
+namespace platform::limits {
 
 // Each connection takes some 20 KiB and four descriptors: its socket and the peer's process, and, once it is
 // through its handshake, the two ends that feed the library. A machine's clients are a few dozen.
@@ -42,4 +42,9 @@ inline constexpr std::size_t bytesPerTurn = 16 * 1024;
 // to open, and a client that is accepted with the last one could only be refused.
 inline constexpr std::size_t spareDescriptors = 64;
 
-}  // namespace platform::linux_::limits
+// At hearthd anyone may watch named notifications: names are a few dozen bytes, and whoever watches knows a
+// handful.
+inline constexpr std::size_t watchedNames = 64;
+inline constexpr std::size_t nameBytes = 255;
+
+}  // namespace platform::limits
