@@ -117,6 +117,13 @@ std::string conflict(const JobDescription& job, const std::vector<JobDescription
   return "";
 }
 
+// What the system may not refuse the next time: all else is wrong with the one file, and stays so.
+bool mayPass(std::error_code error) {
+  const auto is = [error](std::errc other) { return error == other; };
+  return is(std::errc::io_error) || is(std::errc::interrupted) || is(std::errc::not_enough_memory) ||
+         is(std::errc::too_many_files_open) || is(std::errc::too_many_files_open_in_system);
+}
+
 }  // namespace
 
 platform::Result<std::vector<JobDescription>> readJobs(platform::linux_::FileSystem& files,
@@ -126,14 +133,14 @@ platform::Result<std::vector<JobDescription>> readJobs(platform::linux_::FileSys
   const auto names = files.list(folder);
   if (!names) {
     log.error("%s: %s", folder, names.error().message());
-    if (names.error() == std::errc::no_such_file_or_directory) return jobs;
-    return names.error();
+    if (mayPass(names.error())) return names.error();
+    return jobs;
   }
   for (const std::string& name : *names) {
     if (!name.ends_with(".json")) continue;
     const std::string path = folder + "/" + name;
     const auto bytes = platform::linux_::readFile(files, path, fileLimit);
-    if (!bytes && bytes.error() != platform::Outcome::tooLarge) {
+    if (!bytes && mayPass(bytes.error())) {
       log.error("%s: %s", path, bytes.error().message());
       return bytes.error();
     }

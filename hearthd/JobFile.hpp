@@ -28,8 +28,8 @@ struct JobDescription {
 };
 
 // All that are sound, by file name. The others are named in the log, with the place of the fault, and left
-// out; so is one that takes the name, or a service, of an earlier one. What cannot be read at all is an
-// error, which is logged, too.
+// out; so is one that takes the name, or a service, of an earlier one. A refusal that may pass, of a disk, or
+// for want of descriptors or memory, is an error, and logged, too: whoever starts hearthd tries again.
 platform::Result<std::vector<JobDescription>> readJobs(platform::linux_::FileSystem& files,
                                                        const std::string& folder, const std::string& root);
 

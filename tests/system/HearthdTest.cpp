@@ -108,6 +108,8 @@ TEST_F(HearthdTest, BrokenFilesAndJobsAreNamedAndDisturbNobody) {
       {"path.json", R"({"name": "../x", "program": "p"})", ": \"name\" cannot be a file's name"},
   };
   for (const auto& row : rows) write(fs::path("etc/jobs") / row.file, row.text);
+  fs::create_directory(root / "etc/jobs/folder.json");
+  fs::create_symlink("nowhere", root / "etc/jobs/link.json");
   write("etc/jobs/missing.json", R"({"name": "missing", "program": "nowhere"})");
   start();
   EXPECT_THAT(listed("ListJobs", 0), ElementsAre("dies", "good", "missing"));
@@ -118,6 +120,8 @@ TEST_F(HearthdTest, BrokenFilesAndJobsAreNamedAndDisturbNobody) {
   for (const auto& row : rows) {
     EXPECT_THAT(log(), HasSubstr(std::string(row.file) + row.problem));
   }
+  EXPECT_THAT(log(), AllOf(HasSubstr("folder.json: Is a directory; the file is skipped"),
+                           HasSubstr("link.json: No such file or directory; the file is skipped")));
   EXPECT_THAT(log(), HasSubstr("nowhere: No such file or directory; next start in 100 ms"));
 }
 
