@@ -117,14 +117,14 @@ std::string conflict(const JobDescription& job, const std::vector<JobDescription
   return "";
 }
 
-// What the system may not refuse the next time: all else is wrong with the one file, and stays so.
+}  // namespace
+
 bool mayPass(std::error_code error) {
   const auto is = [error](std::errc other) { return error == other; };
   return is(std::errc::io_error) || is(std::errc::interrupted) || is(std::errc::not_enough_memory) ||
-         is(std::errc::too_many_files_open) || is(std::errc::too_many_files_open_in_system);
+         is(std::errc::no_space_on_device) || is(std::errc::too_many_files_open) ||
+         is(std::errc::too_many_files_open_in_system);
 }
-
-}  // namespace
 
 platform::Result<std::vector<JobDescription>> readJobs(platform::linux_::FileSystem& files,
                                                        const std::string& folder, const std::string& root) {

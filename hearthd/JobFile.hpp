@@ -3,6 +3,7 @@
 
 #include <map>
 #include <string>
+#include <system_error>
 #include <vector>
 
 #include "platform/linux/FileSystem.hpp"
@@ -27,9 +28,14 @@ struct JobDescription {
   bool restart = true;                // after it has ended by itself
 };
 
+// Whether the system may grant another time what it refused: for an error of its disk, or want of space,
+// descriptors or memory. hearthd then ends, and whoever starts it tries again; a job that is left out would be
+// so for long. All else is wrong with the one job, and no reason to keep the others down.
+bool mayPass(std::error_code error);
+
 // All that are sound, by file name. The others are named in the log, with the place of the fault, and left
-// out; so is one that takes the name, or a service, of an earlier one. A refusal that may pass, of a disk, or
-// for want of descriptors or memory, is an error, and logged, too: whoever starts hearthd tries again.
+// out; so is one that takes the name, or a service, of an earlier one. A refusal that may pass is an error, and
+// logged, too.
 platform::Result<std::vector<JobDescription>> readJobs(platform::linux_::FileSystem& files,
                                                        const std::string& folder, const std::string& root);
 

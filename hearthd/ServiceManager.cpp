@@ -66,13 +66,11 @@ platform::Result<void> ServiceManager::start(std::function<void()> ready) {
     return listening;
   }
   whenReady = std::move(ready);
-  // What the system refuses now it may not refuse the next start; a job that is left out would be so for
-  // long.
   auto descriptions = readJobs(files, paths.jobs(), paths.root);
   if (!descriptions) return descriptions.error();
   for (JobDescription& description : *descriptions) {
     const auto added = addJob(std::move(description));
-    if (!added && added.error() != std::errc::filename_too_long) return added;
+    if (!added && mayPass(added.error())) return added;
   }
   if (allJobs.empty()) log().default_("%s: no jobs; hearthctl init lays out a device", paths.jobs());
   for (const auto& job : allJobs) job->start();
@@ -217,7 +215,9 @@ bool ServiceManager::owns(const std::string& job, const std::string& stream) con
 // job after a restart, or comes once more.
 void ServiceManager::saveAlarms() {
   saveTimer = {};
-  if (!alarmFile.save(alarms)) saveTimer = loop.callAfter(untilSavedAgain, [this] { saveAlarms(); });
+  const auto saved = alarmFile.save(alarms);
+  if (saved || saved.error() == platform::Outcome::malformedFile) return;  // a damaged one stays
+  saveTimer = loop.callAfter(untilSavedAgain, [this] { saveAlarms(); });
 }
 
 std::int64_t ServiceManager::setAlarm(const EventKey& key, platform::Date date) {

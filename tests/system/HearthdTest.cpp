@@ -110,6 +110,10 @@ TEST_F(HearthdTest, BrokenFilesAndJobsAreNamedAndDisturbNobody) {
   for (const auto& row : rows) write(fs::path("etc/jobs") / row.file, row.text);
   fs::create_directory(root / "etc/jobs/folder.json");
   fs::create_symlink("nowhere", root / "etc/jobs/link.json");
+  write("etc/jobs/long.json",
+        R"({"name": "long", "program": "p", "services": [")" + std::string(200, 's') + R"("]})");
+  write("etc/jobs/taken.json", R"({"name": "taken", "program": "p", "services": ["folder"]})");
+  fs::create_directories(root / "run/folder.sock");
   write("etc/jobs/missing.json", R"({"name": "missing", "program": "nowhere"})");
   start();
   EXPECT_THAT(listed("ListJobs", 0), ElementsAre("dies", "good", "missing"));
@@ -120,8 +124,10 @@ TEST_F(HearthdTest, BrokenFilesAndJobsAreNamedAndDisturbNobody) {
   for (const auto& row : rows) {
     EXPECT_THAT(log(), HasSubstr(std::string(row.file) + row.problem));
   }
-  EXPECT_THAT(log(), AllOf(HasSubstr("folder.json: Is a directory; the file is skipped"),
-                           HasSubstr("link.json: No such file or directory; the file is skipped")));
+  EXPECT_THAT(log(),
+              AllOf(HasSubstr("folder.json: Is a directory; the file is skipped"),
+                    HasSubstr("link.json: No such file or directory; the file is skipped"),
+                    HasSubstr("folder.sock: Is a directory"), HasSubstr("s.sock: File name too long")));
   EXPECT_THAT(log(), HasSubstr("nowhere: No such file or directory; next start in 100 ms"));
 }
 
