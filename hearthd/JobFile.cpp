@@ -121,7 +121,7 @@ std::string conflict(const JobDescription& job, const std::vector<JobDescription
 
 bool mayPass(std::error_code error) {
   const auto is = [error](std::errc other) { return error == other; };
-  return is(std::errc::io_error) || is(std::errc::interrupted) || is(std::errc::not_enough_memory) ||
+  return is(std::errc::interrupted) || is(std::errc::not_enough_memory) ||
          is(std::errc::no_space_on_device) || is(std::errc::too_many_files_open) ||
          is(std::errc::too_many_files_open_in_system);
 }
@@ -141,7 +141,7 @@ platform::Result<std::vector<JobDescription>> readJobs(platform::linux_::FileSys
     const std::string path = folder + "/" + name;
     const auto bytes = platform::linux_::readFile(files, path, fileLimit);
     if (!bytes && mayPass(bytes.error())) {
-      log.error("%s: %s", path, bytes.error().message());
+      log.error("%s: %s; hearthd ends", path, bytes.error().message());
       return bytes.error();
     }
     std::string problem = bytes ? "" : bytes.error().message();

@@ -28,9 +28,9 @@ struct JobDescription {
   bool restart = true;                // after it has ended by itself
 };
 
-// Whether the system may grant another time what it refused: for an error of its disk, or want of space,
-// descriptors or memory. hearthd then ends, and whoever starts it tries again; a job that is left out would be
-// so for long. All else is wrong with the one job, and no reason to keep the others down.
+// Whether the system may grant another time what it refused: for want of space, descriptors or memory. hearthd
+// then ends, and whoever starts it tries again; a job that is left out would be so for long. All else, a bad
+// sector, too, is wrong with the one job, and no reason to keep the others down.
 bool mayPass(std::error_code error);
 
 // All that are sound, by file name. The others are named in the log, with the place of the fault, and left

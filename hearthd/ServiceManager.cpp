@@ -84,6 +84,7 @@ void ServiceManager::stop(std::function<void()> stopped) {
   stopping = true;
   whenReady = nullptr;
   whenStopped = std::move(stopped);
+  if (saveTimer) saveAlarms();
   for (const auto& job : allJobs) job->stop();
   jobChanged();
 }
@@ -126,7 +127,8 @@ platform::Result<void> ServiceManager::addServices(const JobDescription& descrip
   for (const std::string& service : description.services) {
     auto socket = listenAt(paths.serviceSocket(service));
     if (!socket) {
-      log().error("%s: %s: %s", description.name, paths.serviceSocket(service), socket.error().message());
+      log().error("%s: %s: %s; %s", description.name, paths.serviceSocket(service), socket.error().message(),
+                  mayPass(socket.error()) ? "hearthd ends" : "the job is skipped");
       return socket.error();
     }
     surroundings.services.push_back({service, socket->get()});

@@ -34,8 +34,8 @@ struct Alarm {
   std::int64_t generation = 0;
 };
 
-// A plain value: a change is made on a copy, which takes the place of the original once it is on disk. What
-// is on disk are the alarms and the last generation; handlers and deliveries are of this run.
+// A plain value. What is on disk are the alarms and the last generation; handlers and deliveries are of this
+// run.
 class Alarms {
  public:
   // Registers or replaces; the generation of this registration, above all earlier ones.

@@ -160,7 +160,8 @@ void SettingsFile::finishWrite(const Dictionary& before, const Dictionary& next,
     std::lock_guard lock(mutex);
     writing = false;
     unsynced = !written;
-    static_cast<void>(refresh());  // a failure is the next reader's to meet
+    const auto fresh = refresh();  // a failure is the next reader's to meet
+    if (!fresh && written) document = std::make_shared<const Dictionary>(next);
     outsideChange = reported && recordOwnChange(before, next, written);
   }
   if (outsideChange) lookLater();
