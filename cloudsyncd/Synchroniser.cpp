@@ -225,16 +225,18 @@ void Synchroniser::publish() {
   around.transport.publish(underWay.device, *text);
 }
 
-// The replica as a document; before, the file has to know its writer.
+// The replica as a document; before, the file has to know its writer and its name.
 Result<std::string> Synchroniser::encode() {
   Result<std::string> text{std::string()};
   const auto written = around.replica.update([&](Dictionary& replica) {
+    const auto device = platform::valueOf(replica, "device");
     underWay = {around.account, nameDevice(replica), around.writer,
                 publishableEntries(settingsValues(std::as_const(replica)), around.wall.now())};
     text = encodeDocument(underWay);
-    if (!text || isOwnWriter(replica, around.writer)) return false;
-    addWriter(replica, around.writer);
-    return true;
+    if (!text) return false;
+    const bool isKnown = isOwnWriter(replica, around.writer);
+    if (!isKnown) addWriter(replica, around.writer);
+    return !isKnown || platform::valueOf(replica, "device") != device;
   });
   return written ? text : Result<std::string>(written.error());
 }
