@@ -198,7 +198,8 @@ void makeAccounts(const Cluster& cluster, std::size_t from, std::size_t to, cons
     }
   };
   std::vector<std::future<void>> makers;
-  for (int count = 0; count < 8; ++count) makers.push_back(std::async(std::launch::async, work));
+  makers.reserve(8);
+  while (makers.size() < 8) makers.push_back(std::async(std::launch::async, work));
   for (std::future<void>& maker : makers) maker.get();
   report(std::to_string(to) + " accounts, the last " + std::to_string(to - from) + " made within",
          (now() - start) / 1e6, "s");
