@@ -35,7 +35,7 @@ class HearthLink::State : public std::enable_shared_from_this<State> {
       if (!self) return;
       self->client = std::make_unique<AsyncBusClient>(
           self->io, std::move(*shared), hearthInterface(),
-          [weak](std::size_t signal, List arguments) {
+          [weak](std::size_t signal, const List& arguments) {
             if (auto live = weak.lock()) live->received(signal, arguments);
           },
           self->lost);

@@ -31,6 +31,7 @@
 #include "platform/linux/UnifiedLog.hpp"
 
 // Present in builds with the leak check alone.
+// NOLINTNEXTLINE(bugprone-reserved-identifier,cert-dcl37-c,cert-dcl51-cpp): the sanitizer's own
 extern "C" __attribute__((weak)) int __lsan_do_recoverable_leak_check();
 
 namespace platform::linux_ {
