@@ -132,8 +132,9 @@ platform::Result<std::vector<JobDescription>> readJobs(platform::linux_::FileSys
   const auto log = platform::hearthLog("hearthd");
   const auto names = files.list(folder);
   if (!names) {
-    log.error("%s: %s", folder, names.error().message());
-    if (mayPass(names.error())) return names.error();
+    const bool ends = mayPass(names.error());
+    log.error("%s: %s%s", folder, names.error().message(), ends ? "; hearthd ends" : "");
+    if (ends) return names.error();
     return jobs;
   }
   for (const std::string& name : *names) {

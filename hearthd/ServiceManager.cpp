@@ -222,25 +222,27 @@ void ServiceManager::saveAlarms() {
   saveTimer = loop.callAfter(untilSavedAgain, [this] { saveAlarms(); });
 }
 
-std::int64_t ServiceManager::setAlarm(const EventKey& key, platform::Date date) {
-  const auto generation = alarms.set(key, date);
+void ServiceManager::alarmsChanged() {
   saveAlarms();
   deliverDue();
+}
+
+std::int64_t ServiceManager::setAlarm(const EventKey& key, platform::Date date) {
+  const auto generation = alarms.set(key, date);
+  alarmsChanged();
   return generation;
 }
 
 std::int64_t ServiceManager::clearAlarm(const EventKey& key) {
   const bool isStored = alarms.contains(key);
   const auto generation = alarms.clear(key);
-  if (isStored) saveAlarms();
-  deliverDue();
+  if (isStored) alarmsChanged();
   return generation;
 }
 
 std::size_t ServiceManager::clearAlarms(const std::string& name) {
   const auto count = alarms.clearNamed(name);
-  saveAlarms();
-  deliverDue();
+  alarmsChanged();
   return count;
 }
 

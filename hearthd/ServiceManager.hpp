@@ -69,6 +69,7 @@ class ServiceManager {
   void jobEnded(const std::string& job);
   void jobChanged();
   void saveAlarms();
+  void alarmsChanged();
   void tellPosted();
   void tell(const std::string& name);
   void deliverDue();
