@@ -23,9 +23,11 @@ struct Account : Device {
     return on(name, "hearthctl", "cloud " + arguments);
   }
 
+  pid_t spawnHearthd(const std::string& name) {
+    return running[name] = spawn(hearthdCommand + (" --root " + (root / name).string()), name);
+  }
   void start(const std::string& name) {
-    const std::string command = "env HEARTH_LOG_LEVEL=info HEARTH_LOG_PRIVATE=show hearthd --root ";
-    running[name] = spawn(command + (root / name).string(), name);
+    spawnHearthd(name);
     ASSERT_TRUE(eventually([&] { return on(name, "pairwellctl", "status").status == 0; })) << log(name);
     ASSERT_TRUE(comesToSay(name, "connected          "));
   }

@@ -12,6 +12,9 @@
 #include <string>
 #include <utility>
 
+#include "platform/linux/BusClient.hpp"
+#include "platform/linux/HearthInterface.hpp"
+#include "platform/linux/Paths.hpp"
 #include "tests/fakes/RealFiles.hpp"
 
 namespace processes {
@@ -25,6 +28,7 @@ using testing::HasSubstr;
 
 inline const std::string flagKey = "VelaLogCloudCollectionEnabled", endKey = flagKey + "Expiration";
 inline constexpr uid_t nobody = 65534;
+inline const std::string hearthdCommand = "env HEARTH_LOG_LEVEL=info HEARTH_LOG_PRIVATE=show hearthd";
 
 struct Device : testing::Test {
   struct Outcome {
@@ -80,12 +84,29 @@ struct Device : testing::Test {
 
   void start() {
     const std::size_t before = timesLogged("hearthd: ready\n");
-    hearthd = spawn("env HEARTH_LOG_LEVEL=info HEARTH_LOG_PRIVATE=show hearthd", "hearthd");
+    hearthd = spawn(hearthdCommand, "hearthd");
     ASSERT_TRUE(eventually([&] { return timesLogged("hearthd: ready\n") > before; })) << log();
   }
   int stop(int signal = SIGTERM) {
     ::kill(hearthd, signal);
     return finish(std::exchange(hearthd, -1), "hearthd").status;
+  }
+  // What the hearthd of that root answers; an error of the connection, too.
+  static platform::linux_::BusReply askHearthd(const fs::path& at, const std::string& operation,
+                                               const platform::List& arguments = {}) {
+    using platform::linux_::BusError;
+    const std::string socket = platform::linux_::Paths::under(at).hearthdSocket();
+    const auto client = platform::linux_::BusClient::connect(socket, fakes::deadline);
+    if (!client) return BusError{client.error().message(), ""};
+    const auto reply =
+        (*client)->call(platform::linux_::hearthInterface(), operation, arguments, fakes::deadline);
+    return reply ? *reply : platform::linux_::BusReply(BusError{reply.error().message(), ""});
+  }
+  // The daemon's process, 0 if none runs.
+  pid_t pairwelld() {
+    const std::string row = run("hearthctl --json jobs").output, field = "\"pid\":";
+    const auto at = row.find(field);
+    return at == row.npos ? 0 : std::atoi(row.c_str() + at + field.size());
   }
   // `of` is a name that spawn() was given.
   std::string log(const std::string& of = "hearthd") const { return contents(root / (of + ".err")); }

@@ -202,15 +202,16 @@ TEST_F(FaultTest, StartOfHearthdServesOrEndsAndSaysWhy) {
     const std::string end = setting("one", endKey);
     EXPECT_EQ(stop("one"), 0);
     armAgain(call);
-    const pid_t pid = spawn("env HEARTH_LOG_LEVEL=info hearthd --root " + (root / "one").string(), "one");
-    running["one"] = pid;
+    const pid_t pid = spawnHearthd("one");
     bool hasEnded = false, isSkipped = false;
     EXPECT_TRUE(Account::comesTo("one", [&] {
       hasEnded = ::waitpid(pid, nullptr, WNOHANG) == pid;
       isSkipped = log("one").find(" is skipped", armedAt) != std::string::npos;
       return hasEnded || isSkipped || on("one", "pairwellctl", "status").status == 0;
     }));
-    if (isSkipped) stop("one");
+    if (isSkipped) {
+      EXPECT_EQ(stop("one"), 0);
+    }
     if (hasEnded || isSkipped) {
       EXPECT_TRUE(hasFailed());
       EXPECT_THAT(log("one").substr(armedAt), HasSubstr(::strerror(faults::errorOf(control->kind))));

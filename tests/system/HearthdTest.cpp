@@ -51,26 +51,17 @@ struct HearthdTest : Device {
 
   // The results, or the error's name.
   std::string call(const std::string& operation, const List& arguments = {}) {
-    const BusReply reply = replyTo(operation, arguments);
+    const BusReply reply = askHearthd(root, operation, arguments);
     if (const auto* error = std::get_if<BusError>(&reply)) return error->name;
     return platform::describe(Value(std::get<List>(reply)));
   }
   // The n-th column of a listing, by the name in its first.
   Texts listed(const std::string& operation, std::size_t column) {
     Texts found;
-    const BusReply reply = replyTo(operation, {});
+    const BusReply reply = askHearthd(root, operation);
     for (const Value& row : *std::get<List>(reply)[0].as<List>())
       found.push_back(platform::describe((*row.as<List>())[column]));
     return found;
-  }
-
- private:
-  BusReply replyTo(const std::string& operation, const List& arguments) {
-    auto client = BusClient::connect(platform::linux_::Paths::under(root).hearthdSocket(), fakes::deadline);
-    if (!client) return BusError{client.error().message(), ""};
-    const auto reply =
-        (*client)->call(platform::linux_::hearthInterface(), operation, arguments, fakes::deadline);
-    return reply ? *reply : BusReply(BusError{reply.error().message(), ""});
   }
 };
 

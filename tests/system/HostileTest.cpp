@@ -146,9 +146,8 @@ struct HostileTest : Device {
     ::setrlimit(RLIMIT_NOFILE, &descriptors);
     start();
     EXPECT_EQ(run("pairwellctl status").status, 0) << log();
-    const std::string jobs = run("hearthctl --json jobs").output;
     ofHearthd.daemon = hearthd;
-    ofPairwelld.daemon = std::atoi(jobs.c_str() + jobs.find("\"pid\":") + 6);
+    ofPairwelld.daemon = pairwelld();
     for (Target* target : targets) target->guest = std::make_unique<Client>(*this, "client", attacker);
     innocent = std::make_unique<Client>(*this, "client");
   }

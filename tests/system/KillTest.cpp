@@ -7,8 +7,6 @@
 #include <set>
 
 #include "hearthd/ProcessHandle.hpp"
-#include "platform/linux/BusClient.hpp"
-#include "platform/linux/HearthInterface.hpp"
 #include "platform/linux/LinuxFileSystem.hpp"
 #include "tests/system/Account.hpp"
 #include "tools/StoredSettings.hpp"
@@ -17,7 +15,6 @@ namespace processes {
 namespace {
 
 using platform::List;
-using platform::linux_::BusClient;
 using platform::linux_::Paths;
 
 constexpr double shortPeriod = 1.2, longPeriod = 1000;
@@ -61,11 +58,8 @@ struct KillTest : Account {
 
   // What hearthd answers; absent while there is none.
   std::optional<List> ask(const std::string& name, const std::string& operation, const List& arguments = {}) {
-    const auto client = BusClient::connect(Paths::under(root / name).hearthdSocket(), fakes::deadline);
-    if (!client) return std::nullopt;
-    const auto& interface = platform::linux_::hearthInterface();
-    const auto reply = (*client)->call(interface, operation, arguments, fakes::deadline);
-    const auto* results = reply ? std::get_if<List>(&*reply) : nullptr;
+    const auto reply = askHearthd(root / name, operation, arguments);
+    const auto* results = std::get_if<List>(&reply);
     return results ? std::optional(*results) : std::nullopt;
   }
   // 0 while it does not run.
@@ -143,8 +137,7 @@ struct KillTest : Account {
     stop(name, SIGKILL);
     ++killed[name + " hearthd"];
     pauseUpTo(0.02);
-    const std::string command = "env HEARTH_LOG_LEVEL=info HEARTH_LOG_PRIVATE=show hearthd --root ";
-    running[name] = spawn(command + (root / name).string(), name);
+    spawnHearthd(name);
   }
   int cutsOf(const std::string& name) { return killed[name + " pairwelld"] + killed[name + " hearthd"]; }
 

@@ -70,6 +70,16 @@ struct NatsTest : Account {
             within + "/usr/sbin/nats-server -c " + conf.string() + " -m " + std::to_string(server.monitor),
         name);
   }
+  // By hand, in the clear.
+  UniqueDescriptor connectTo(std::size_t number) const {
+    UniqueDescriptor raw(::socket(AF_INET, SOCK_STREAM, 0));
+    const sockaddr_in address = fakes::loopback(servers[number].port);
+    EXPECT_EQ(::connect(raw.get(), reinterpret_cast<const sockaddr*>(&address), sizeof address), 0);
+    return raw;
+  }
+  static std::string publication(const std::string& subject, const std::string& text) {
+    return "PUB " + subject + " " + std::to_string(text.size()) + "\r\n" + text + "\r\n";
+  }
   void startServers() {
     for (std::size_t number = 0; number < servers.size(); ++number) startServer(number);
   }
@@ -288,13 +298,9 @@ TEST_F(NatsTest, StreamIsReadAgainEveryQuarterOfAnHour) {
   using std::chrono::minutes;
   write(conf, "listen: $NATS_LISTEN, jetstream { store_dir: $NATS_STORE }");
   startServer(0);
-  const int port = servers[0].port;
-  const auto say = [port](const std::string& subject, const std::string& text) {
-    const UniqueDescriptor raw(::socket(AF_INET, SOCK_STREAM, 0));
-    const sockaddr_in address = fakes::loopback(port);
-    ASSERT_EQ(::connect(raw.get(), reinterpret_cast<const sockaddr*>(&address), sizeof address), 0);
-    const std::string all = "CONNECT {\"verbose\":false}\r\nPUB " + subject + " " +
-                            std::to_string(text.size()) + "\r\n" + text + "\r\n";
+  const auto say = [&](const std::string& subject, const std::string& text) {
+    const UniqueDescriptor raw = connectTo(0);
+    const std::string all = "CONNECT {\"verbose\":false}\r\n" + publication(subject, text);
     ::send(raw.get(), all.data(), all.size(), MSG_NOSIGNAL);
     ::shutdown(raw.get(), SHUT_WR);
     pollfd closed{raw.get(), POLLRDHUP, 0};
@@ -326,8 +332,8 @@ TEST_F(NatsTest, StreamIsReadAgainEveryQuarterOfAnHour) {
   cloudsync::NatsAccess open;
   open.isEncrypted = false;
   onLoop([&] {
-    transport =
-        cloudsync::NatsTransport::create(loop, now, {{"127.0.0.1:" + std::to_string(port)}, open, "home"});
+    transport = cloudsync::NatsTransport::create(
+        loop, now, {{"127.0.0.1:" + std::to_string(servers[0].port)}, open, "home"});
     transport->start(client);
   });
   EXPECT_TRUE(eventually([&] { return left() == minutes(15); }));
@@ -349,13 +355,10 @@ TEST_F(NatsTest, FloodOfOneDeviceKeepsNoOtherWaiting) {
   startServers();
   for (const char* name : {"one", "two"}) joinAndStart(name);
   for (const char* name : {"one", "two"}) ASSERT_TRUE(isInStep(name));
-  const UniqueDescriptor flood(::socket(AF_INET, SOCK_STREAM, 0));
-  const sockaddr_in address = fakes::loopback(servers[0].port);
-  ASSERT_EQ(::connect(flood.get(), reinterpret_cast<const sockaddr*>(&address), sizeof address), 0);
-  const std::string noise(100'000, '{');
-  const std::string message =
-      "PUB pairwell.home.flood " + std::to_string(noise.size()) + "\r\n" + noise + "\r\n";
-  std::string all = "CONNECT {\"user\":\"home\",\"pass\":\"hp\",\"verbose\":false,\"pedantic\":false}\r\n";
+  const UniqueDescriptor flood = connectTo(0);
+  const std::string message = publication("pairwell.home.flood", std::string(100'000, '{'));
+  const std::string all =
+      "CONNECT {\"user\":\"home\",\"pass\":\"hp\",\"verbose\":false,\"pedantic\":false}\r\n";
   std::atomic<bool> isEnough = false;
   std::thread flooder([&] {
     ::send(flood.get(), all.data(), all.size(), MSG_NOSIGNAL);

@@ -16,12 +16,6 @@ struct SystemTest : Device {
     Device::start();
     ASSERT_EQ(run("pairwellctl status").status, 0) << log();
   }
-  // The running daemon's process, 0 if none runs.
-  pid_t pairwelld() {
-    const std::string row = run("hearthctl --json jobs").output, field = "\"pid\":";
-    const auto at = row.find(field);
-    return at == row.npos ? 0 : std::atoi(row.c_str() + at + field.size());
-  }
   std::string setting(const std::string& source, const std::string& key) {
     const std::string line = run("hearthctl settings get " + source + " " + key).output;
     return line.substr(0, line.find('\n'));
