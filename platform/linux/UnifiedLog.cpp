@@ -11,13 +11,12 @@
 #include <climits>
 #include <cstdio>
 #include <cstdlib>
-#include <cstring>
 #include <ctime>
 
 namespace platform::linux_ {
 namespace {
 
-constexpr const char* journalSocket = "/run/systemd/journal/socket";
+constexpr std::string_view journalSocket = "/run/systemd/journal/socket";
 
 std::string_view levelName(LogLevel level) {
   switch (level) {
@@ -114,12 +113,12 @@ void UnifiedLog::write(const LogChannel& channel, LogLevel level, std::string_vi
 }
 
 void UnifiedLog::open() {
-  if (!rootIsSet && ::access(journalSocket, W_OK) == 0) {
+  if (!rootIsSet && ::access(journalSocket.data(), W_OK) == 0) {
     // Not through the journal's library: its calls wait when the journal does not read.
     own.reset(::socket(AF_UNIX, SOCK_DGRAM | SOCK_CLOEXEC | SOCK_NONBLOCK, 0));
     sockaddr_un address{};
     address.sun_family = AF_UNIX;
-    std::strcpy(address.sun_path, journalSocket);
+    journalSocket.copy(address.sun_path, sizeof address.sun_path - 1);
     if (own && ::connect(own.get(), reinterpret_cast<const sockaddr*>(&address), sizeof address) == 0) {
       kind = Kind::journal;
       return;
