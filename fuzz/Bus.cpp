@@ -114,7 +114,7 @@ void callHearth(World& world, Whom whom, const std::string& bytes) {
   fuzz::require(world.talk(own, bytes).starts_with("DATA\r\nOK "));
   // What it has promised is on disk.
   const auto promised = manager.listAlarms();
-  const auto kept = hearth::AlarmFile(world.files, paths.alarms()).load().list();
+  const auto kept = hearth::AlarmFile(world.files, paths.alarms()).load()->list();
   fuzz::require(kept.size() == promised.size() && (kept.empty() || whom != Whom::stranger));
   for (std::size_t index = 0; index < kept.size(); ++index)
     fuzz::require(kept[index].key == promised[index].key && kept[index].date == promised[index].date);

@@ -65,14 +65,14 @@ void checkDevice(fuzz::World& world, const std::string& path) {
 
 void checkAlarms(fuzz::World& world, std::string_view text, const std::string& path) {
   hearth::AlarmFile file(world.files, path);
-  auto alarms = file.load();
+  auto alarms = *file.load();
   if (!world.files.exists(path)) fuzz::require(world.files.bytes(path + ".damaged-1") == text);
   for (const auto& alarm : alarms.list()) alarms.handlerInstalled(alarm.key.job, alarm.key.stream, {});
   for (const auto& alarm : alarms.takeDue({platform::Time(1e9), platform::Time(9)}))
     fuzz::require(alarms.set(alarm.key, alarm.date) > alarm.generation);
   static_cast<void>(alarms.next({}));
   fuzz::require(file.save(alarms).has_value());
-  fuzz::require(file.load().toValue() == alarms.toValue());
+  fuzz::require(file.load()->toValue() == alarms.toValue());
 }
 
 void checkCloud(std::string_view text) {

@@ -3,6 +3,7 @@
 #include <system_error>
 #include <utility>
 
+#include "hearthd/JobFile.hpp"
 #include "platform/LogSink.hpp"
 #include "platform/linux/Json.hpp"
 
@@ -21,26 +22,29 @@ const platform::Logger& log() {
 AlarmFile::AlarmFile(platform::linux_::FileSystem& files_, std::string path_)
     : files(files_), path(std::move(path_)) {}
 
-Alarms AlarmFile::load() {
-  const auto bytes = platform::linux_::readFile(files, path, fileLimit);
-  if (!bytes) {
-    // What cannot be read now may be whole: it is left alone, and nothing is written over it.
-    damageStays = bytes.error() != std::errc::no_such_file_or_directory;
-    if (damageStays) log().error("%s: %s; no alarm outlives this run", path, bytes.error().message());
-    return {};
+platform::Result<Alarms> AlarmFile::load() {
+  auto bytes = platform::linux_::readFile(files, path, fileLimit);
+  // A disk may refuse once, and alarms that are aside are not kept.
+  if (!bytes && bytes.error() == std::errc::io_error)
+    bytes = platform::linux_::readFile(files, path, fileLimit);
+  if (!bytes && bytes.error() == std::errc::no_such_file_or_directory) return Alarms();
+  if (!bytes && mayPass(bytes.error())) {
+    log().error("%s: %s; hearthd ends", path, bytes.error().message());
+    return bytes.error();
   }
-  std::string problem;
-  const auto value = platform::linux_::parseJson(*bytes, problem);
+  std::string problem = bytes ? "" : bytes.error().message();
+  const auto value =
+      bytes ? platform::linux_::parseJson(*bytes, problem) : platform::Result<platform::Value>(bytes.error());
   if (value) {
     if (auto alarms = Alarms::fromValue(*value)) return std::move(*alarms);
     problem = "is not a list of alarms";
   }
   moveAside(problem);
-  return {};
+  return Alarms();
 }
 
 platform::Result<void> AlarmFile::save(const Alarms& alarms) {
-  if (damageStays) return platform::Outcome::malformedFile;
+  if (failure == platform::Outcome::malformedFile) return failure;
   const auto saved = write(alarms);
   const auto previous = std::exchange(failure, saved ? std::error_code() : saved.error());
   if (failure && failure != previous)
@@ -60,11 +64,12 @@ platform::Result<void> AlarmFile::write(const Alarms& alarms) {
 
 void AlarmFile::moveAside(const std::string& problem) {
   const auto moved = platform::linux_::moveAside(files, path);
-  damageStays = !moved;
   if (moved) {
     log().error("%s: %s; moved to %s", path, problem, *moved);
   } else {
-    log().error("%s: %s; cannot be moved aside: %s", path, problem, moved.error().message());
+    log().error("%s: %s; cannot be moved aside: %s; no alarm outlives this run", path, problem,
+                moved.error().message());
+    failure = platform::Outcome::malformedFile;
   }
 }
 

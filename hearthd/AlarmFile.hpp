@@ -14,9 +14,9 @@ class AlarmFile {
   // Its folder is made when it is needed.
   AlarmFile(platform::linux_::FileSystem& files, std::string path);
 
-  // A damaged file is moved aside, with a line in the log; one that cannot be read stays, and nothing can be
-  // saved.
-  Alarms load();
+  // A file that is damaged, or cannot be read, is moved aside, with a line in the log; where that fails, too,
+  // it stays, and nothing can be saved. What may pass is an error, and logged.
+  platform::Result<Alarms> load();
   // Durable once it has returned without an error, which is logged (once, until it is another).
   // Outcome::malformedFile where a file stays that must not be overwritten.
   platform::Result<void> save(const Alarms& alarms);
@@ -27,8 +27,7 @@ class AlarmFile {
 
   platform::linux_::FileSystem& files;
   const std::string path;
-  bool damageStays = false;
-  std::error_code failure;  // of the last save
+  std::error_code failure;  // of the last save; Outcome::malformedFile stays
 };
 
 }  // namespace hearth

@@ -28,14 +28,15 @@ struct JobDescription {
   bool restart = true;                // after it has ended by itself
 };
 
-// Whether the system may grant another time what it refused: for want of space, descriptors or memory. hearthd
-// then ends, and whoever starts it tries again; a job that is left out would be so for long. All else, a bad
-// sector, too, is wrong with the one job, and no reason to keep the others down.
+// Whether the system may grant another time what it refused: for want of space, descriptors or memory.
+// hearthd then ends, and whoever starts it tries again; a job that is left out, or the alarms, would be so
+// for long. All else, a bad sector, too, is wrong with the one file, and no reason to keep the other jobs
+// down.
 bool mayPass(std::error_code error);
 
 // All that are sound, by file name. The others are named in the log, with the place of the fault, and left
-// out; so is one that takes the name, or a service, of an earlier one. A refusal that may pass is an error, and
-// logged, too.
+// out; so is one that takes the name, or a service, of an earlier one. A refusal that may pass is an error,
+// and logged, too.
 platform::Result<std::vector<JobDescription>> readJobs(platform::linux_::FileSystem& files,
                                                        const std::string& folder, const std::string& root);
 

@@ -57,10 +57,12 @@ ServiceManager::ServiceManager(platform::linux_::EventLoop& loop_, platform::lin
       paths(std::move(paths_)),
       files(files_),
       alarmFile(files_, paths.alarms()),
-      alarms(alarmFile.load()),
       server(platform::linux_::hearthInterface()) {}
 
 platform::Result<void> ServiceManager::start(std::function<void()> ready) {
+  auto stored = alarmFile.load();
+  if (!stored) return stored.error();
+  alarms = std::move(*stored);
   if (const auto listening = listen(); !listening) {
     log().error("%s: %s", paths.hearthdSocket(), listening.error().message());
     return listening;

@@ -3,6 +3,9 @@
 
 #include <gtest/gtest.h>
 
+#include <cerrno>
+#include <tuple>
+
 #include "tests/fakes/FakePlatform.hpp"
 #include "tests/fakes/MemoryFileSystem.hpp"
 
@@ -31,13 +34,41 @@ TEST(AlarmFile, CutAtAnyCallLeavesTheOldAlarmsOrTheNew) {
       disk.failFrom = std::numeric_limits<int>::max();
       for (const bool power : {false, true}) {
         if (power) disk.powerCut();
-        const auto found = AlarmFile(disk, path).load().toValue();
+        const auto found = AlarmFile(disk, path).load()->toValue();
         EXPECT_TRUE(found == alarms.toValue() || (!saved && found == old)) << platform::describe(found);
       }
       EXPECT_TRUE(file.save(alarms));
       disk.powerCut();
-      EXPECT_EQ(AlarmFile(disk, path).load().toValue(), alarms.toValue());
+      EXPECT_EQ(AlarmFile(disk, path).load()->toValue(), alarms.toValue());
     }
+  }
+}
+
+struct RefusingDisk : fakes::MemoryFileSystem {
+  int refusals = 0, error = 0;
+  platform::Result<std::unique_ptr<platform::linux_::File>> openToRead(const std::string& path) override {
+    if (refusals-- > 0) return std::error_code(error, std::system_category());
+    return MemoryFileSystem::openToRead(path);
+  }
+};
+
+TEST(AlarmFile, WhatCannotBeReadIsReadAgainOrKeptAside) {
+  fakes::FakePlatform device;
+  const platform::PlatformScope scope{device};
+  const std::string path = "/alarms.json";
+  for (const auto& [error, refusals, count] : {std::tuple(EMFILE, 1, -1), {EIO, 1, 1}, {EIO, 2, 0}}) {
+    RefusingDisk disk;
+    Alarms alarms;
+    alarms.set({"job", "stream", "name"}, {1});
+    ASSERT_TRUE(AlarmFile(disk, path).save(alarms));
+    const std::string old = disk.bytes(path);
+    disk.refusals = refusals;
+    disk.error = error;
+    AlarmFile file(disk, path);
+    const auto found = file.load();
+    EXPECT_EQ(found ? static_cast<int>(found->list().size()) : -1, count) << error;
+    EXPECT_EQ(disk.bytes(count == 0 ? path + ".damaged-1" : path), old);
+    EXPECT_TRUE(file.save(alarms)) << "this run's own are kept";
   }
 }
 
