@@ -20,6 +20,8 @@ class AlarmFile {
   // Durable once it has returned without an error, which is logged (once, until it is another).
   // Outcome::malformedFile where a file stays that must not be overwritten.
   platform::Result<void> save(const Alarms& alarms);
+  // Why the last save failed.
+  const std::error_code& problem() const { return failure; }
 
  private:
   platform::Result<void> write(const Alarms& alarms);

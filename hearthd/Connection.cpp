@@ -103,7 +103,7 @@ BusReply Connection::perform(std::size_t index, const List& arguments) {
     case HearthOperation::listAlarms:
       return listAlarms();
     case HearthOperation::cancelAlarm:
-      return List{static_cast<std::int64_t>(manager.clearAlarms(text(arguments, 0)))};
+      return cancelAlarm(text(arguments, 0));
   }
   return error(platform::linux_::failedError, "unknown operation");
 }
@@ -156,6 +156,14 @@ BusReply Connection::controlJob(const std::string& action, const std::string& na
     return error("org.freedesktop.DBus.Error.InvalidArgs", "start, stop or restart, not " + action);
   }
   return List();
+}
+
+BusReply Connection::cancelAlarm(const std::string& name) {
+  const auto count = manager.clearAlarms(name);
+  if (count) return List{static_cast<std::int64_t>(*count)};
+  return error(platform::linux_::failedError,
+               "cancelled, but a restart may bring it back, as the alarms cannot be stored: " +
+                   count.error().message());
 }
 
 BusReply Connection::listJobs() const {

@@ -29,6 +29,7 @@ class Connection : public platform::linux_::BusHandler {
   platform::linux_::BusReply changeEvent(const platform::List& arguments);
   platform::linux_::BusReply deliverEvent(const std::string& stream, const std::string& name);
   platform::linux_::BusReply controlJob(const std::string& action, const std::string& name);
+  platform::linux_::BusReply cancelAlarm(const std::string& name);
   platform::linux_::BusReply listJobs() const;
   platform::linux_::BusReply listAlarms() const;
 

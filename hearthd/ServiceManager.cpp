@@ -242,9 +242,11 @@ std::int64_t ServiceManager::clearAlarm(const EventKey& key) {
   return generation;
 }
 
-std::size_t ServiceManager::clearAlarms(const std::string& name) {
+platform::Result<std::size_t> ServiceManager::clearAlarms(const std::string& name) {
   const auto count = alarms.clearNamed(name);
+  if (count == 0) return count;
   alarmsChanged();
+  if (alarmFile.problem()) return alarmFile.problem();
   return count;
 }
 

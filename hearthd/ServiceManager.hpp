@@ -46,10 +46,10 @@ class ServiceManager {
   std::vector<std::string> consumers(const std::string& stream) const;
   bool owns(const std::string& job, const std::string& stream) const;
   // Durable before they return, unless the disk refuses: then for this run at once, and durable when it can
-  // be. The answers are those of Alarms.
+  // be. The answers are those of Alarms; of a name's alarms, which nobody sets anew, the refusal.
   std::int64_t setAlarm(const EventKey& key, platform::Date date);
   std::int64_t clearAlarm(const EventKey& key);
-  std::size_t clearAlarms(const std::string& name);
+  platform::Result<std::size_t> clearAlarms(const std::string& name);
   std::vector<Alarm> listAlarms() const { return alarms.list(); }
   void installHandler(Watcher watcher, const std::string& job, const std::string& stream);
   void taken(const EventKey& key, std::int64_t generation);
