@@ -71,7 +71,7 @@ void Synchroniser::received(const std::string& name, std::string_view text) {
   Device& device = devices[name];
   device.problem.clear();
   // An engine may have gone back to an older one, or somebody has put it there; its device may be off.
-  const bool hasGoneBack = !newsIn(device.entries, document->entries).empty();
+  const bool hasGoneBack = !newsIn(device.entries, document->entries, around.wall.now()).empty();
   device.entries = std::move(document->entries);
   const auto replica = around.replica.contents();
   if (name == ownDevice() && document->writer != around.writer && !isOwnWriter(*replica, document->writer) &&
@@ -108,7 +108,7 @@ void Synchroniser::removed(const std::string& device) {
 
 Dictionary Synchroniser::allDocuments() const {
   Dictionary all;
-  for (const auto& [name, device] : devices) mergeCloudEntries(device.entries, all);
+  for (const auto& [name, device] : devices) mergeCloudEntries(device.entries, all, around.wall.now());
   return all;
 }
 
@@ -150,7 +150,8 @@ std::string Synchroniser::nameDevice(Dictionary& replica) {
 Result<bool> Synchroniser::change(Dictionary& replica, const Dictionary& entries) {
   nameDevice(replica);
   const auto account = accountOf(replica);
-  if (account == around.account) return mergeCloudEntries(entries, settingsValues(replica));
+  if (account == around.account)
+    return mergeCloudEntries(entries, settingsValues(replica), around.wall.now());
   if (around.changing) {
     if (const auto allowed = around.changing(); !allowed) return allowed.error();
   }
@@ -181,9 +182,9 @@ void Synchroniser::replicaChanged(const Dictionary& before, const Dictionary& af
 
 void Synchroniser::publishIfNews() {
   const auto replica = around.replica.contents();
-  if (accountOf(*replica) == around.account && !newsIn(settingsValues(*replica), allDocuments()).empty()) {
+  if (accountOf(*replica) == around.account &&
+      !newsIn(settingsValues(*replica), allDocuments(), around.wall.now()).empty())
     pacing.written(around.steady());
-  }
   deadlineMoved();
 }
 
@@ -283,7 +284,7 @@ void Synchroniser::settle(const std::string& text) {
 
 Synchroniser::Status Synchroniser::status() const {
   Status status{isConnected, problem, disconnectedSince, lastOut, lastIn, {}, ownDevice(), devices};
-  status.waiting = newsIn(settingsValues(*around.replica.contents()), allDocuments());
+  status.waiting = newsIn(settingsValues(*around.replica.contents()), allDocuments(), around.wall.now());
   if (!isConnected) return status;
   if (isForeign)
     status.problem = "another device publishes under this one's name: hearthctl cloud new-identity";

@@ -29,7 +29,7 @@ std::optional<Dictionary> entriesOf(std::string_view text, const std::string& de
 }
 
 Dictionary merged(const Dictionary& first, Dictionary into) {
-  linux_::mergeCloudEntries(first, into);
+  linux_::mergeCloudEntries(first, into, now);
   return into;
 }
 
@@ -98,7 +98,7 @@ int LLVMFuzzerTestOneInput(const std::uint8_t* data, std::size_t size) {
   // It has what they have, and they can have what it has.
   const Dictionary own = linux_::settingsValues(*self.replica->contents());
   for (const auto& entries : {other, third})
-    fuzz::require(!entries || cloudsync::newsIn(*entries, own).empty());
+    fuzz::require(!entries || cloudsync::newsIn(*entries, own, now).empty());
   fuzz::require(status.waiting.empty());
   if (status.device == "other" || status.device == "third" || !self.files.exists(pathOf(status.device)))
     return 0;

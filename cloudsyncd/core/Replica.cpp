@@ -78,9 +78,9 @@ void makeNewIdentity(Dictionary& replica) {
   platform::linux_::cloudDeviceOf(replica);
 }
 
-std::vector<std::string> newsIn(const Dictionary& entries, const Dictionary& documents) {
+std::vector<std::string> newsIn(const Dictionary& entries, const Dictionary& documents, platform::Time now) {
   Dictionary merged = documents;
-  platform::linux_::mergeCloudEntries(entries, merged);
+  platform::linux_::mergeCloudEntries(entries, merged, now);
   return platform::linux_::differingKeys(documents, merged);
 }
 

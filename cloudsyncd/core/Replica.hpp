@@ -37,6 +37,7 @@ void changeAccount(platform::Dictionary& replica, const std::string& account,
 void makeNewIdentity(platform::Dictionary& replica);
 
 // The keys of which `entries` has something that the union of all documents lacks; sorted.
-std::vector<std::string> newsIn(const platform::Dictionary& entries, const platform::Dictionary& documents);
+std::vector<std::string> newsIn(const platform::Dictionary& entries, const platform::Dictionary& documents,
+                                platform::Time now);
 
 }  // namespace cloudsync

@@ -63,10 +63,15 @@ std::optional<std::string> passedCompanion(const Dictionary& entries, const Clou
   return end && *end <= write.now.count() + 1 ? std::optional(companion) : std::nullopt;
 }
 
+// A stamp that is nobody's gives way to all that are somebody's.
+bool takesThePlaceOf(const CloudEntry& there, const CloudEntry& entry, Time now) {
+  const bool isCredible = entry.stamp.isCredible(now);
+  return isCredible == there.stamp.isCredible(now) ? entry.outranks(there) : isCredible;
+}
+
 bool place(Dictionary& entries, const std::string& key, const CloudEntry& entry, Time now) {
   const auto there = CloudEntry::find(entries, key);
-  if (there && there->stamp.isCredible(now) && !entry.outranks(*there))
-    return false;  // somebody else's is newer
+  if (there && !takesThePlaceOf(*there, entry, now)) return false;  // somebody else's is newer
   entries.insert_or_assign(key, entry.toValue());
   return true;
 }
@@ -161,12 +166,12 @@ Dictionary cloudValues(const Dictionary& entries) {
   return values;
 }
 
-bool mergeCloudEntries(const Dictionary& other, Dictionary& into) {
+bool mergeCloudEntries(const Dictionary& other, Dictionary& into, Time now) {
   bool changed = false;
   for (const auto& [key, value] : other) {
     const auto theirs = CloudEntry::fromValue(value);
     const auto ours = CloudEntry::find(into, key);
-    if (!theirs || (ours && !theirs->outranks(*ours))) continue;
+    if (!theirs || (ours && !takesThePlaceOf(*ours, *theirs, now))) continue;
     into.insert_or_assign(key, value);
     changed = true;
   }

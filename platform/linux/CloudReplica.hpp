@@ -53,9 +53,10 @@ std::string cloudDeviceOf(Dictionary& document);
 // The values that are there, tombstones left out.
 Dictionary cloudValues(const Dictionary& entries);
 
-// Takes, key by key, the greater of the two, and says whether that changed `into`. Commutative, associative,
-// idempotent: order, repetition and loss of documents do not matter.
-bool mergeCloudEntries(const Dictionary& other, Dictionary& into);
+// Takes, key by key, the greater of the two, one that is not credible being less than all that are, and says
+// whether that changed `into`. Commutative, associative, idempotent: order, repetition and loss of documents
+// do not matter.
+bool mergeCloudEntries(const Dictionary& other, Dictionary& into, Time now);
 
 // What to tell of a change from elsewhere. Where the account, the first download or the quota changed the
 // document, it says so ("reason", told once for each "reasonSequence"), which is news even without a key.

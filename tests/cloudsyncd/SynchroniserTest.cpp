@@ -134,6 +134,8 @@ TEST_F(SynchroniserTest, PublishesOwnWritesTogetherAndNothingThatItMerged) {
   const auto without = publishNext();
   ASSERT_TRUE(without);
   EXPECT_FALSE(without->entries.contains("ahead")) << "the others would refuse all for it";
+  synchroniser.received("peer", document("peer", {{"ahead", entry("theirs", 1)}}));
+  EXPECT_THAT(values(), testing::HasSubstr(R"("ahead": "theirs")"));
   write("ahead", 2);
   const auto with = publishNext();
   ASSERT_TRUE(with) << values();

@@ -37,8 +37,8 @@ struct Device {
   CloudStamp stamp(const std::string& key) { return CloudEntry::find(entries, key)->stamp; }
   std::string values() const { return describe(cloudValues(entries)); }
   void exchange(Device& other) {
-    mergeCloudEntries(other.entries, entries);
-    mergeCloudEntries(entries, other.entries);
+    mergeCloudEntries(other.entries, entries, now);
+    mergeCloudEntries(entries, other.entries, now);
     EXPECT_EQ(entries, other.entries);
   }
 
@@ -151,7 +151,7 @@ TEST(CloudReplicaTest, ExpiryRanksRightAfterTheSwitchThatItEnds) {
   home.switchOn(20000);  // echoes
   away.now += Time(2);
   away.write("flag", false);
-  mergeCloudEntries(away.entries, home.entries);
+  mergeCloudEntries(away.entries, home.entries, home.now);
   home.read("flag");
   EXPECT_TRUE(home.write("flagExpiration", std::nullopt));
 }
@@ -161,7 +161,7 @@ TEST(CloudReplicaTest, ASwitchThatIsOvertakenMidwayLosesBothItsKeys) {
   theirs.now += Time(0.01);
   theirs.switchOn(7000);
   ours.write("flag", true);
-  mergeCloudEntries(theirs.entries, ours.entries);
+  mergeCloudEntries(theirs.entries, ours.entries, ours.now);
   EXPECT_FALSE(ours.write("flagExpiration", 5000.0));
   EXPECT_EQ(ours.entries, theirs.entries);
 }
@@ -251,20 +251,21 @@ TEST(CloudReplicaTest, MergingTakesTheGreaterInWhateverOrder) {
   std::mt19937 random(7);
   const auto below = [&](int limit) { return static_cast<int>(random() % static_cast<unsigned>(limit)); };
   const auto merged = [](Dictionary into, const Dictionary& other) {
-    mergeCloudEntries(other, into);
+    mergeCloudEntries(other, into, Time(1));
     return into;
   };
   for (int round = 0; round < 1000; ++round) {
     Dictionary replicas[3];
     for (Dictionary& replica : replicas) {
       const std::optional<Value> value = below(3) == 0 ? std::nullopt : std::optional<Value>(below(3));
-      if (below(4) > 0) replica["a"] = CloudEntry{value, {below(2), below(2)}, "d"}.toValue();
+      const std::int64_t time = below(3) == 0 ? std::int64_t{1} << 60 : below(2);
+      if (below(4) > 0) replica["a"] = CloudEntry{value, {time, below(2)}, "d"}.toValue();
     }
     const auto& [a, b, c] = replicas;
     Dictionary both = merged(a, b);
     ASSERT_EQ(both, merged(b, a));
     ASSERT_EQ(merged(both, c), merged(a, merged(b, c)));
-    ASSERT_FALSE(mergeCloudEntries(b, both)) << "nothing new the second time";
+    ASSERT_FALSE(mergeCloudEntries(b, both, Time(1))) << "nothing new the second time";
   }
 }
 
