@@ -21,11 +21,13 @@ constexpr std::pair<const char*, std::string Membership::*> texts[] = {
     {"certificate", &Membership::certificate},
     {"key", &Membership::key}};
 
-// False: there is no such field, or it holds something else.
+// False: there is no such field, or it holds something else, or a NUL, to which alone the system and the
+// libraries would read it.
 bool take(const std::string& name, const platform::Value& value, Membership& membership) {
   if (name == "tls" && value.as<bool>()) return membership.tls = *value.as<bool>(), true;
   for (const auto& [field, member] : texts) {
-    if (name == field && value.as<std::string>()) return membership.*member = *value.as<std::string>(), true;
+    const auto* text = value.as<std::string>();
+    if (name == field && text && text->find('\0') == text->npos) return membership.*member = *text, true;
   }
   return false;
 }
@@ -39,7 +41,7 @@ Result<Membership> parseMembership(std::string_view text, std::string& problem) 
   Membership membership;
   for (const auto& [name, field] : fields ? *fields : Dictionary()) {
     if (take(name, field, membership)) continue;
-    problem = "\"" + name + "\" is no field, or of another type";
+    problem = "\"" + name + "\" is no field, or of another type, or has a NUL in it";
     return Outcome::malformedFile;
   }
   if (fields) return membership;

@@ -22,6 +22,8 @@ class Reader {
     if (!value) return fail(key, "is missing"), "";
     const auto text = platform::toText(*value);
     if (!text || text->empty()) return fail(key, "is not a text"), "";
+    // The system would take a path, or a variable, to end there.
+    if (text->find('\0') != text->npos) fail(key, "has a NUL in it");
     return *text;
   }
 

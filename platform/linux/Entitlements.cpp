@@ -65,7 +65,8 @@ std::string readFields(const Value& value, const std::string& root, EntitlementG
   const auto* fields = value.as<Dictionary>();
   if (!fields) return "not an object";
   const auto* path = find<std::string>(*fields, "executable");
-  if (!path || path->empty()) return "\"executable\" is not the path of a program";
+  if (!path || path->empty() || path->find('\0') != path->npos)
+    return "\"executable\" is not the path of a program";
   grant.executable = fs::path(*path).is_absolute() || root.empty() ? *path : root + "/" + *path;
   if (!fs::path(grant.executable).is_absolute()) return "\"executable\" is not an absolute path";
   if (!readIdentifier(*fields, "uid", grant.user)) return "\"uid\" is not a user's number";

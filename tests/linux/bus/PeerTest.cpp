@@ -100,6 +100,7 @@ TEST_F(EntitlementsTest, CountOnlyIfNobodyElseCanChangeThem) {
       {"loop", [&] { execute("loop"); }, "too many links"},
       {"missing", [&] { execute("bin/none"); }, "bin/none: No such file"},
       {"no program", [&] { write(grant, R"({"entitlements": {}})"); }, "\"executable\" is not"},
+      {"a NUL", [&] { execute("bin/prog\\u0000"); }, "\"executable\" is not"},
       {"no entitlements", [&] { write(grant, R"({"executable": "bin/prog", "entitlements": []})"); },
        "\"entitlements\" is not"},
       {"group below 0", [&] { write(grant, R"({"executable": "bin/prog", "gid": -1})"); }, "\"gid\" is not"},
