@@ -38,13 +38,13 @@ void DeviceFile::refresh() {
   const auto identity = file ? (*file)->identity() : Result<FileIdentity>(file.error());
   const auto text = identity ? (*file)->readAll(sizeLimit) : Result<std::string>(identity.error());
   const auto previous = std::exchange(failure, text ? std::error_code() : text.error());
-  if (!text) {  // not held: the next look may be able to read it
+  if (!text && text.error() != Outcome::tooLarge) {  // not held: the next look may be able to read it
     const bool isNews = failure != previous && failure != std::errc::no_such_file_or_directory;
     if (isNews) hearthLog("files").error("%s: %s; skipped", path, failure.message());
     return;
   }
-  std::string problem;
-  auto parsed = parse(*text, problem);
+  std::string problem = text ? "" : text.error().message();
+  auto parsed = text ? parse(*text, problem) : Result<Dictionary>(text.error());
   if (!parsed) hearthLog("files").error("%s: %s; skipped", path, problem);
   if (parsed) entries = std::move(*parsed);
   heldIdentity = *identity;

@@ -41,6 +41,12 @@ TEST_F(DeviceTest, FileComesFirstThenTheMachine) {
   files.put(etc, "{\n\"BuildVersion\": }");
   EXPECT_EQ(answer("BuildVersion"), "21A5");
   EXPECT_THAT(logged(), testing::ElementsAre(testing::HasSubstr(etc + ": line 2, column"))) << "once";
+  files.put(etc, std::string((1 << 20) + 1, ' '));
+  EXPECT_EQ(answer("UniqueChipID"), "nil");
+  EXPECT_THAT(logged(), testing::ElementsAre(testing::HasSubstr(etc + ": ")));
+  files.calls = 0;
+  EXPECT_EQ(answer("UniqueChipID"), "nil");
+  EXPECT_EQ(files.calls, 1) << "not read again";
   EXPECT_TRUE(files.exists(etc)) << "it is its administrator's";
 }
 
