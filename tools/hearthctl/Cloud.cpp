@@ -46,7 +46,8 @@ const List& listIn(const Dictionary& fields, std::string_view name) {
 // The lines for people.
 std::vector<std::vector<std::string>> linesOf(const Dictionary& status) {
   std::vector<std::vector<std::string>> lines;
-  const bool isConnected = platform::find(status, "connected") && *platform::find<bool>(status, "connected");
+  const auto* connected = platform::find<bool>(status, "connected");
+  const bool isConnected = connected && *connected;
   if (status.contains("url"))
     lines.push_back({"engine", textIn(status, "url") + ", account " + textIn(status, "account")});
   // Its document may not be there: one that has only followed others has published nothing.
@@ -59,10 +60,11 @@ std::vector<std::vector<std::string>> linesOf(const Dictionary& status) {
   lines.push_back({"last in", timeIn(status, "in")});
   std::string waiting;
   for (const Value& key : listIn(status, "waiting"))
-    waiting += (waiting.empty() ? "" : ", ") + *key.as<std::string>();
+    waiting += (waiting.empty() ? "" : ", ") + platform::describe(key);
   lines.push_back({"waiting to go out", waiting.empty() ? "nothing" : waiting});
   for (const Value& row : listIn(status, "devices")) {
-    const auto& device = *row.as<Dictionary>();
+    const auto* fields = row.as<Dictionary>();
+    const Dictionary device = fields ? *fields : Dictionary();
     const std::string name = textIn(device, "device");
     std::string line = name + (name == textIn(status, "device") ? " (this one)" : "") + ", newest change " +
                        timeIn(device, "newest");
