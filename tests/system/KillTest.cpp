@@ -7,6 +7,7 @@
 #include <set>
 
 #include "hearthd/ProcessHandle.hpp"
+#include "pairwelld/Names.hpp"
 #include "platform/linux/LinuxFileSystem.hpp"
 #include "tests/system/Account.hpp"
 #include "tools/StoredSettings.hpp"
@@ -107,9 +108,10 @@ struct KillTest : Account {
     EXPECT_GE(now(), std::floor(promised.end)) << "a period has ended early";
   }
   double upTo(double seconds) { return seconds * static_cast<double>(random() % 1000) / 1000; }
-  // The moment of a kill is what varies: no condition is waited for.
-  void pauseUpTo(double seconds) {
-    for (const double end = now() + upTo(seconds); now() < end;) {
+  // The moment of a kill is what varies: no condition has to be met.
+  void pauseUpTo(
+      double seconds, const std::function<bool()>& isEnough = [] { return false; }) {
+    for (const double end = now() + upTo(seconds); now() < end && !isEnough();) {
       observe();
       std::this_thread::sleep_for(std::chrono::milliseconds(1));
     }
@@ -187,10 +189,27 @@ struct KillTest : Account {
     const bool switches = random() % 3 > 0;
     const double begin = now();
     const int cuts = cutsOf(device), allCuts = cutsOf("one") + cutsOf("two");
+    const auto listener =
+        platform::linux_::BusClient::connect(Paths::under(root / device).hearthdSocket(), fakes::deadline);
+    ASSERT_TRUE(listener) << listener.error().message();
+    EXPECT_TRUE((*listener)->call(platform::linux_::hearthInterface(), "Watch",
+                                  {std::string(pairwell::names::settingsChanged)}, fakes::deadline));
+    bool isAnnounced = false;
+    // Whoever was started anew announces what it finds, not the switch.
+    const auto hears = [&] {
+      if (cutsOf(device) > cuts) return false;
+      const auto signal = (*listener)->nextSignal(std::chrono::milliseconds(0));
+      const bool isHeard = signal && *signal;
+      isAnnounced |= isHeard;
+      return isHeard;
+    };
     const std::string command = "pairwellctl --root " + (root / device).string() + " logging ";
     const pid_t client = switches ? spawn(command + (before.isOn ? "off" : "on"), "client") : 0;
+    if (switches && random() % 2 > 0) {
+      EXPECT_TRUE(eventually([&] { return observe(), hears(); })) << "a switch is not announced";
+    }
     for (auto left = std::min(victims.size(), 1 + random() % 3); left > 0; --left) {
-      pauseUpTo(1.5 * callTime);
+      pauseUpTo(1.5 * callTime, hears);
       killNext(random() % 4 > 0 ? device : names[random() % 2]);
     }
     const int status = switches ? finish(client, "client").status : 3;
@@ -199,8 +218,10 @@ struct KillTest : Account {
     settle(cutsOf("one") + cutsOf("two") > allCuts);
     switched += switches;
     inForce += period != before;
+    announced += isAnnounced;
     if (period == before) {
       EXPECT_TRUE(status != 0 || isCut) << "a switch is lost, and nothing that carries it was killed";
+      EXPECT_FALSE(isAnnounced) << "a switch is lost that was announced";
     } else {
       EXPECT_TRUE(switches && period.isOn != before.isOn) << "an acknowledged switch is lost";
       EXPECT_TRUE(!period.isOn || (period.end > begin + longPeriod && period.end < now() + longPeriod));
@@ -265,7 +286,7 @@ struct KillTest : Account {
   std::set<std::string> alarms, fired;  // device and date
   std::map<std::string, int> killed, residues;
   std::map<std::string, std::string> lastFindings;
-  int switched = 0, inForce = 0, mended = 0;
+  int switched = 0, inForce = 0, announced = 0, mended = 0;
   double longestOverrun = 0;
 };
 
@@ -303,7 +324,7 @@ TEST_F(KillTest, KillsAtRandomMomentsLoseNothing) {
       << "a write is lost";
   settle(false);
   for (const auto& name : names) judgeLog(name);
-  std::cout << switched << " switches, " << inForce << " in force; "
+  std::cout << switched << " switches, " << inForce << " in force, " << announced << " announced; "
             << acknowledged("one") + acknowledged("two") << " writes and " << alarms.size()
             << " alarms acknowledged\n";
   for (const auto& kind : residueKinds) std::cout << residues[kind] << " times: " << kind << "\n";
