@@ -175,6 +175,17 @@ TEST_F(HearthdTest, AlarmsOutliveEverythingAndEventsReachTheirJobs) {
   stop(SIGKILL);
   start();
   EXPECT_THAT(listed("ListAlarms", 2), ElementsAre("far"));
+  // One that the disk refuses is stored when it can be, though nothing else happens.
+  const fs::path inTheWay = root / "var/hearthd/alarms.json.new";
+  fs::create_directory(inTheWay);
+  call("SetEvent", {alarmStream, "refused", fromNow(3600)});
+  fs::remove(inTheWay);
+  const auto isStored = [&] {
+    return contents(root / "var/hearthd/alarms.json").find("refused") != std::string::npos;
+  };
+  EXPECT_FALSE(isStored());
+  EXPECT_TRUE(eventually(isStored));
+  EXPECT_EQ(call("CancelAlarm", {"refused"}), "[1]");
   EXPECT_EQ(call("CancelAlarm", {"far"}), "[1]");
   EXPECT_THAT(listed("ListAlarms", 2), ElementsAre());
   EXPECT_THAT(lines("events"), ElementsAre("com.kestrel.alarm soon"));
