@@ -21,6 +21,7 @@ using platform::linux_::Callee;
 using platform::linux_::callMessage;
 using platform::linux_::handshakeAhead;
 using platform::linux_::number;
+using platform::linux_::text;
 using platform::linux_::UniqueDescriptor;
 using platform::linux_::Wire;
 
@@ -235,6 +236,11 @@ struct HostileTest : Device {
     Wire wire = target.enter();
     for (const auto& [message, answer] : rows)
       EXPECT_TRUE(wire.send(message) && wire.reads(answer)) << answer;
+    // What only looks odd is answered, in the server's own order.
+    Callee foreign = target.callee;
+    foreign.order = std::endian::big;
+    EXPECT_TRUE(wire.send(callMessage(target.member, "attack", 0x01020304, foreign)));
+    EXPECT_TRUE(wire.reads(answerTo(0x01020304)));
     for (std::uint32_t number = 1; number <= 100; ++number) {
       pass(wire.socket.get(), target.call(number), std::vector<int>(10, STDERR_FILENO));
       EXPECT_TRUE(wire.reads(answerTo(number)));
@@ -276,8 +282,9 @@ struct HostileTest : Device {
       EXPECT_TRUE(eventually([&] { return wire.sendSome("x") < 0 && errno != EAGAIN; }));
   }
   void twoThousandConnections(const Target& target) {
-    // Where the innocent one is another user, and descriptors are not what is short.
-    if (attacker == 0 || descriptors.rlim_max < 4 * limits::connections + 200) return;
+    if (attacker == 0) GTEST_SKIP() << "2,000 connections: only root can be another user";
+    if (descriptors.rlim_max < 4 * limits::connections + 200)
+      GTEST_SKIP() << "2,000 connections: this machine allows " << descriptors.rlim_max << " descriptors";
     std::vector<Wire> wires;
     while (wires.size() < 2000) {
       wires.push_back(target.connect());
@@ -339,6 +346,21 @@ struct HostileTest : Device {
     Wire poster = target.enter();
     EXPECT_TRUE(sendAll(poster, calls("Post", 10'000, 64), 10'000));
   }
+  void othersEvents(const Target& target) {
+    if (&target != &ofHearthd) return;
+    if (attacker == 0) GTEST_SKIP() << "events of others: only root can be another user";
+    Callee three = target.callee;
+    three.signature = "ssx";
+    const std::string date(sizeof(std::int64_t), '\x1f');  // far ahead
+    std::string calls;
+    for (std::uint32_t number = 1; number <= 10'000; ++number)
+      calls += callMessage("SetEvent", text("com.kestrel.alarm") + std::string(2, '\0') + text("any") + date,
+                           number, three);
+    Wire wire = target.enter();
+    EXPECT_TRUE(sendAll(wire, calls, 10'000));
+    EXPECT_THAT(wire.received, HasSubstr("hearth.NotPermitted"));
+    EXPECT_EQ(run("hearthctl alarms").output, "");
+  }
   rlimit descriptors{};
   const uid_t attacker = ::geteuid() == 0 ? nobody : 0;
   const platform::linux_::Paths paths = platform::linux_::Paths::under(root);
@@ -366,7 +388,8 @@ TEST_F(HostileTest, NobodyElseNoticesAnAttackAndNothingIsLeftOfIt) {
               {"2,000 connections", &HostileTest::twoThousandConnections},
               {"10,000 calls at once", &HostileTest::tenThousandCalls},
               {"gone in the middle", &HostileTest::goneInTheMiddle},
-              {"deaf watchers", &HostileTest::deafWatchers}};
+              {"deaf watchers", &HostileTest::deafWatchers},
+              {"events of others", &HostileTest::othersEvents}};
   serveInnocentWhile("nobody else", [] { return false; });
   for (const auto& row : rows) {
     SCOPED_TRACE(row.name);
