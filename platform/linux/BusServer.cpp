@@ -45,6 +45,7 @@ class BusServer::State : public BusSessionHost, public std::enable_shared_from_t
   }
 
   void dispatch() {
+    const auto turn = takeTurn();
     const State* const outer = std::exchange(dispatching, this);
     settleChanged();
     runHandedOver();
@@ -60,17 +61,20 @@ class BusServer::State : public BusSessionHost, public std::enable_shared_from_t
   }
 
   void listen(UniqueDescriptor socket, Admitter admitter_) {
+    const auto turn = takeTurn();
     admitter = std::move(admitter_);
     acceptor.listen(std::move(socket));
   }
 
   void stopListening() {
+    const auto turn = takeTurn();
     acceptor.stop();
     deadlines.set(listenerTag, std::nullopt);
   }
 
   std::shared_ptr<BusConnection> adopt(UniqueDescriptor socket, PeerIdentity peer,
                                        std::shared_ptr<BusHandler> handler) {
+    const auto turn = takeTurn();
     ::fcntl(socket.get(), F_SETFL, ::fcntl(socket.get(), F_GETFL) | O_NONBLOCK);
     const auto session = add(std::move(socket), std::move(peer));
     begin(*session, std::move(handler), std::nullopt);  // it may be used late, or never
@@ -78,6 +82,7 @@ class BusServer::State : public BusSessionHost, public std::enable_shared_from_t
   }
 
   void drain(std::function<void()> drained) {
+    const auto turn = takeTurn();
     stopListening();
     whenDrained = std::move(drained);
     forEachSession([](BusSession& session) { session.stopReading(); });
@@ -85,6 +90,7 @@ class BusServer::State : public BusSessionHost, public std::enable_shared_from_t
   }
 
   void closeAll() {
+    const auto turn = takeTurn();
     stopListening();
     forEachSession([](BusSession& session) { session.close(); });
     settleChanged();  // there may be no further dispatch()
@@ -93,6 +99,7 @@ class BusServer::State : public BusSessionHost, public std::enable_shared_from_t
   int descriptor() const { return epoll.get(); }
 
   // BusSessionHost
+  std::unique_lock<std::recursive_mutex> takeTurn() override { return std::unique_lock(turns); }
   const BusService& service() const override { return _service; }
   void changed(BusSession& session) override { changed(session.number); }
   void socketMoved(BusSession& session, int before) override {
@@ -103,7 +110,7 @@ class BusServer::State : public BusSessionHost, public std::enable_shared_from_t
   BusCompletion completion(std::uint64_t session, std::uint64_t call) override {
     return [weak = weak_from_this(), session, call](BusReply reply) {
       const auto self = weak.lock();
-      if (!self) return;
+      if (!self || self->answerAtOnce(session, call, reply)) return;
       self->handOver([self = self.get(), session, call, reply = std::move(reply)]() mutable {
         self->withSession(session, [&](BusSession& found) { found.complete(call, std::move(reply)); });
       });
@@ -114,6 +121,10 @@ class BusServer::State : public BusSessionHost, public std::enable_shared_from_t
   struct Entry {
     std::shared_ptr<BusSession> session;
     std::uint32_t events = 0;  // what epoll watches for
+    std::optional<BusSession::TimePoint> deadline;
+    bool isUnsettled() const {
+      return session->hasEnded() || session->wantedEvents() != events || session->deadline() != deadline;
+    }
   };
   using Work = std::function<void()>;
 
@@ -143,6 +154,20 @@ class BusServer::State : public BusSessionHost, public std::enable_shared_from_t
     } else {
       withSession(tag / 2, [&](BusSession& session) { session.processEnded(); });
     }
+  }
+
+  // By the thread that has the answer, if the server's own is waiting: that one need not wake for it.
+  bool answerAtOnce(std::uint64_t number, std::uint64_t call, BusReply& reply) {
+    if (dispatching == this) return false;
+    const std::unique_lock turn(turns, std::try_to_lock);
+    if (!turn) return false;
+    const auto found = sessions.find(number);
+    if (found == sessions.end()) return true;
+    BusSession& session = *found->second.session;
+    if (!session.canBeAnsweredElsewhere()) return false;
+    session.complete(call, std::move(reply));
+    changed(number);
+    return true;
   }
 
   // Work of other threads, at once where this is the server's own turn.
@@ -187,7 +212,11 @@ class BusServer::State : public BusSessionHost, public std::enable_shared_from_t
   // Settled by dispatch(), when nothing of the session is on the stack: it may be the session's end, and its
   // handler may let go of the connection that is emitting.
   void changed(std::uint64_t number) {
-    if (dispatching != this && changedSessions.empty()) eventfd_write(wakeUp.get(), 1);
+    if (dispatching != this) {
+      const auto found = sessions.find(number);
+      if (found == sessions.end() || !found->second.isUnsettled()) return;
+      if (changedSessions.empty()) eventfd_write(wakeUp.get(), 1);
+    }
     if (changedSessions.empty() || changedSessions.back() != number) changedSessions.push_back(number);
   }
 
@@ -215,7 +244,10 @@ class BusServer::State : public BusSessionHost, public std::enable_shared_from_t
       entry.events = wanted;
       control(EPOLL_CTL_MOD, entry.session->socket(), wanted, socketTag(number));
     }
-    deadlines.set(number, entry.session->deadline());
+    if (entry.deadline != entry.session->deadline()) {
+      entry.deadline = entry.session->deadline();
+      deadlines.set(number, entry.deadline);
+    }
   }
 
   void remove(std::uint64_t number) {
@@ -323,6 +355,8 @@ class BusServer::State : public BusSessionHost, public std::enable_shared_from_t
   std::vector<std::uint64_t> changedSessions;  // to be settled
   std::map<uid_t, std::size_t> perUser;
 
+  // Guards everything but what `mutex` does. The same thread may come back to it: a handler emits.
+  std::recursive_mutex turns;
   std::mutex mutex;
   std::vector<Work> handedOver;  // guarded by `mutex`
 };

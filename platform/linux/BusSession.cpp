@@ -4,6 +4,7 @@
 #include <sys/epoll.h>
 #include <sys/socket.h>
 #include <systemd/sd-bus.h>
+#include <unistd.h>
 
 #include <algorithm>
 #include <cerrno>
@@ -149,16 +150,18 @@ std::size_t BusSession::shakeHands() {
   return input.size() - rest.size();
 }
 
-// Makes the library's bus. It insists on a handshake of its own: it gets one on the pair, and its answer goes
-// to the pair, too. Only then the client's socket takes the place of the output.
+// Makes the library's bus. It insists on a handshake of its own: it gets one through the pipe, and its answer
+// is thrown away. Only then the client's socket takes the place of the output.
 bool BusSession::beginMessages() {
-  int pair[2];
-  if (::socketpair(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC | SOCK_NONBLOCK, 0, pair) < 0) return false;
-  UniqueDescriptor inner(pair[0]);
-  feed.reset(pair[1]);
-  UniqueDescriptor output(::fcntl(inner.get(), F_DUPFD_CLOEXEC, 0));
+  int ends[2], answer[2];
+  if (::pipe2(ends, O_CLOEXEC | O_NONBLOCK) < 0) return false;
+  UniqueDescriptor inner(ends[0]);
+  feed.reset(ends[1]);
+  if (::socketpair(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC | SOCK_NONBLOCK, 0, answer) < 0) return false;
+  UniqueDescriptor output(answer[0]);
+  const UniqueDescriptor thrownAway(answer[1]);
   const int outputNumber = output.get();
-  if (!output || !sendAll(feed.get(), std::string_view("\0AUTH ANONYMOUS\r\nBEGIN\r\n", 24))) return false;
+  if (!pass(std::string_view("\0AUTH ANONYMOUS\r\nBEGIN\r\n", 24))) return false;
   int result = host.service().open(*this, std::move(inner), std::move(output), bus);
   while (result > 0) result = sd_bus_process(bus, nullptr);
   if (result < 0 || sd_bus_is_ready(bus) <= 0) return false;
@@ -172,9 +175,13 @@ bool BusSession::beginMessages() {
   return true;
 }
 
+// To the library. The pipe is empty, and holds four times the largest message.
+bool BusSession::pass(std::string_view bytes) {
+  return ::write(feed.get(), bytes.data(), bytes.size()) == static_cast<ssize_t>(bytes.size());
+}
+
 bool BusSession::handleMessage(std::string_view message) {
-  // The pair is empty, and its buffer many times the largest message.
-  if (!sendAll(feed.get(), message)) {
+  if (!pass(message)) {
     fail("a message cannot be passed on");
     return false;
   }
@@ -237,6 +244,7 @@ void BusSession::stopReading() {
 }
 
 void BusSession::emit(std::size_t signal, List arguments, const std::string& mergeKey) {
+  const auto turn = host.takeTurn();
   if (phase == Phase::ended || phase == Phase::refused) return;
   const auto earlier = std::find_if(signals.begin(), signals.end(), [&](const Signal& candidate) {
     return candidate.signal == signal && candidate.mergeKey == mergeKey;
@@ -279,7 +287,7 @@ void BusSession::flush() {
   if (phase != Phase::running) return;
   const std::size_t before = unsent();
   int result = 1;
-  while (result > 0) result = sd_bus_process(bus, nullptr);  // the pair is empty: it only writes
+  while (result > 0) result = sd_bus_process(bus, nullptr);  // the pipe is empty: it only writes
   if (result < 0) return close();
   sendSignals();
   reconsiderDeadline(unsent() < before);
@@ -306,6 +314,7 @@ void BusSession::reconsiderDeadline(bool moved) {
 }
 
 void BusSession::close() {
+  const auto turn = host.takeTurn();
   if (std::exchange(phase, Phase::ended) != Phase::ended) host.changed(*this);
 }
 

@@ -6,6 +6,7 @@
 #include <functional>
 #include <map>
 #include <memory>
+#include <mutex>
 #include <optional>
 #include <string>
 #include <string_view>
@@ -25,6 +26,8 @@ namespace platform::linux_ {
 class BusSessionHost {
  public:
   virtual ~BusSessionHost() = default;
+  // Held while anything is done with a session.
+  virtual std::unique_lock<std::recursive_mutex> takeTurn() = 0;
   virtual const BusService& service() const = 0;
   // What the session wants may have changed, or it has ended.
   virtual void changed(class BusSession& session) = 0;
@@ -33,10 +36,10 @@ class BusSessionHost {
   virtual BusCompletion completion(std::uint64_t session, std::uint64_t call) = 0;
 };
 
-// The server's thread.
+// The server's thread, but for an answer: that may be sent by the thread that has it.
 //
-// The library reads from one end of a socket pair, into which the session writes one whole message of an
-// allowed size at a time; it answers on the client's socket itself. So what the library holds is bounded, a
+// The library reads from a pipe, into which the session writes one whole message of an allowed size at a
+// time; it answers on the client's socket itself. So what the library holds is bounded, a
 // message that it drops as malformed is noticed, and nothing of a client is parsed before its handshake is
 // done.
 class BusSession : public BusConnection {
@@ -57,6 +60,10 @@ class BusSession : public BusConnection {
   void processEnded();
   void deadlinePassed();
   void complete(std::uint64_t call, BusReply reply);
+  // Whether an answer would lead to nothing that the server's thread has to do.
+  bool canBeAnsweredElsewhere() const {
+    return phase == Phase::running && input.empty() && !inputEnded && !readingStopped && unsent() == 0;
+  }
   void stopReading();
 
   // What the server watches for: epoll's events, none before the decision; and the end of patience.
@@ -94,6 +101,7 @@ class BusSession : public BusConnection {
   void handleInput();
   std::size_t shakeHands();
   bool beginMessages();
+  bool pass(std::string_view bytes);
   bool handleMessage(std::string_view message);
   Message makeAnswer(const Call& call, const BusReply& reply) const;
   void send(Message message);
