@@ -105,8 +105,10 @@ void callHearth(World& world, Whom whom, const std::string& bytes) {
   hearth::ServiceManager manager(world.loop, world.files, paths);
   fuzz::require(manager.start([] {}).has_value());
   linux_::BusServer server(linux_::hearthInterface());
-  const auto watch =
-      world.loop.watchDescriptor(server.descriptor(), EPOLLIN, [&](std::uint32_t) { server.dispatch(); });
+  const auto watch = world.loop.watchDescriptor(server.descriptor(), EPOLLIN, [&](std::uint32_t) {
+    server.dispatch();
+    manager.tellPosted();
+  });
   auto [own, other] = makePair();
   const hearth::Connection::Rights rights{whom == Whom::root, whom == Whom::job ? "a" : ""};
   manager.connected(99, server.adopt(std::move(other), linux_::PeerIdentity(),

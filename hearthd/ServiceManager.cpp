@@ -100,8 +100,10 @@ platform::Result<void> ServiceManager::listen() {
     decide({std::make_shared<Connection>(*this, watcher, Connection::Rights{privileged, ""}),
             [this, watcher](auto connection) { connected(watcher, std::move(connection)); }});
   });
-  serverWatch =
-      loop.watchDescriptor(server.descriptor(), EPOLLIN, [this](std::uint32_t) { server.dispatch(); });
+  serverWatch = loop.watchDescriptor(server.descriptor(), EPOLLIN, [this](std::uint32_t) {
+    server.dispatch();
+    tellPosted();
+  });
   return {};
 }
 
@@ -181,21 +183,20 @@ void ServiceManager::disconnected(Watcher watcher) {
   connections.erase(watcher);
 }
 
-void ServiceManager::post(const std::string& name) {
-  if (posted.empty()) loop.async([this] { tellPosted(); });
-  posted.insert(name);
-}
+void ServiceManager::post(const std::string& name) { posted.insert(name); }
 
 void ServiceManager::tellPosted() {
   for (const std::string& name : std::exchange(posted, {})) tell(name);
 }
 
 void ServiceManager::tell(const std::string& name) {
+  const platform::List arguments{name};
+  const std::string mergeKey = "notification:" + name;
   for (const Watcher watcher : broker.watchers(name)) {
     const auto found = connections.find(watcher);
     if (found == connections.end()) continue;
     const auto connection = found->second;  // writing may find it dead
-    connection->emit(static_cast<std::size_t>(HearthSignal::notification), {name}, "notification:" + name);
+    connection->emit(static_cast<std::size_t>(HearthSignal::notification), arguments, mergeKey);
   }
   for (const std::string& job : broker.matchingJobs(name))
     deliver({job, std::string(platform::EventStreams::matching), name});

@@ -40,7 +40,9 @@ class ServiceManager {
   void disconnected(Watcher watcher);
   [[nodiscard]] bool watch(Watcher watcher, const std::string& name) { return broker.watch(watcher, name); }
   void unwatch(Watcher watcher, const std::string& name) { broker.unwatch(watcher, name); }
+  // Remembered, and told by tellPosted(): after the server's turn, each name once.
   void post(const std::string& name);
+  void tellPosted();
 
   // The jobs that consume a stream.
   std::vector<std::string> consumers(const std::string& stream) const;
@@ -70,7 +72,6 @@ class ServiceManager {
   void jobChanged();
   void saveAlarms();
   void alarmsChanged();
-  void tellPosted();
   void tell(const std::string& name);
   void deliverDue();
   void emitEvent(const EventKey& key, std::int64_t generation);
@@ -83,7 +84,7 @@ class ServiceManager {
   Alarms alarms;
   Broker broker;
   PendingEvents pendingEvents;
-  // Told in the loop's next turn, each once: a flood of posts costs its many watchers one notification.
+  // Told after the server's turn, each once: a flood of posts costs its many watchers one notification.
   std::set<std::string> posted;
   platform::linux_::EventSource wallTimer;
   platform::linux_::EventSource steadyTimer;
