@@ -3,6 +3,7 @@
 #include <sys/stat.h>
 #include <unistd.h>
 
+#include <algorithm>
 #include <cerrno>
 #include <cstring>
 #include <filesystem>
@@ -85,21 +86,10 @@ std::string readGrant(FileSystem& files, const std::string& root, EntitlementGra
   std::string problem;
   const auto value = parseJson(*text, problem);
   if (!value) return problem;
-  if (problem = readFields(*value, root, grant); !problem.empty()) return problem;
-  return writableByOthers(fs::absolute(grant.executable));
+  return readFields(*value, root, grant);
 }
 
-bool isFor(const EntitlementGrant& grant, const PeerIdentity& peer) {
-  if (grant.user && *grant.user != peer.uid) return false;
-  if (grant.group && *grant.group != peer.gid) return false;
-  struct stat status {};
-  if (::stat(grant.executable.c_str(), &status) != 0) return false;
-  return peer.executable == PeerIdentity::Executable{status.st_dev, status.st_ino};
-}
-
-}  // namespace
-
-std::vector<EntitlementGrant> readGrants(FileSystem& files, const Paths& paths) {
+std::vector<EntitlementGrant> readFiles(FileSystem& files, const Paths& paths) {
   std::vector<EntitlementGrant> grants;
   const auto names = files.list(paths.entitlements());
   if (!names) {
@@ -116,14 +106,36 @@ std::vector<EntitlementGrant> readGrants(FileSystem& files, const Paths& paths) 
   return grants;
 }
 
+void checkExecutable(EntitlementGrant& grant) {
+  if (grant.problem.empty()) grant.problem = writableByOthers(fs::absolute(grant.executable));
+}
+
+bool isFor(const EntitlementGrant& grant, const PeerIdentity& peer) {
+  if (grant.user && *grant.user != peer.uid) return false;
+  if (grant.group && *grant.group != peer.gid) return false;
+  struct stat status {};
+  if (::stat(grant.executable.c_str(), &status) != 0) return false;
+  return peer.executable == PeerIdentity::Executable{status.st_dev, status.st_ino};
+}
+
+}  // namespace
+
+std::vector<EntitlementGrant> readGrants(FileSystem& files, const Paths& paths) {
+  auto grants = readFiles(files, paths);
+  std::for_each(grants.begin(), grants.end(), checkExecutable);
+  return grants;
+}
+
 Entitlements::Entitlements(FileSystem& files_, Paths paths_) : files(files_), paths(std::move(paths_)) {}
 
 Dictionary Entitlements::of(const PeerIdentity& peer) {
   Dictionary entitlements;
-  for (const EntitlementGrant& grant : readGrants(files, paths)) {
+  for (EntitlementGrant& grant : readFiles(files, paths)) {
+    if (grant.problem.empty() && !isFor(grant, peer)) continue;
+    checkExecutable(grant);  // of those alone that count for this peer: it takes as long as all the rest
     if (!grant.problem.empty()) {
       sayOnce(grant);
-    } else if (isFor(grant, peer)) {
+    } else {
       for (const auto& [name, value] : grant.entitlements) entitlements.insert_or_assign(name, value);
     }
   }
