@@ -10,9 +10,10 @@
 #include <thread>
 #include <vector>
 
-#include "bench/Peers.hpp"
+#include "bench/Clock.hpp"
 #include "bench/Process.hpp"
 #include "bench/Report.hpp"
+#include "bench/Subjects.hpp"
 #include "pairwelld/Names.hpp"
 #include "platform/NotificationCentre.hpp"
 #include "platform/linux/HearthInterface.hpp"
@@ -26,7 +27,6 @@ namespace {
 using namespace std::chrono_literals;
 using platform::linux_::BusClient;
 
-constexpr std::size_t switches = 200;
 constexpr int changes = 1000;
 
 // The cloud store of a device, as another process of it sees it.
@@ -53,6 +53,13 @@ void switchTo(bool state, BusClient& from, BusClient& to, BusClient& announcemen
   } while (call(to, clientInterface(), "KestrelAudioAccessoryLimitedLogging") != platform::List{state});
 }
 
+void reportRest(const std::string& name, pid_t pid) {
+  report(name + ", resident", residentMebibytes(pid), "MiB");
+  const long before = wakeUps(pid);
+  std::this_thread::sleep_for(60s);
+  report(name + ", wake-ups in 60 idle seconds", static_cast<double>(wakeUps(pid) - before), "");
+}
+
 }  // namespace
 
 Account::Account(const std::string& programs, const std::string& options)
@@ -61,17 +68,17 @@ Account::Account(const std::string& programs, const std::string& options)
   two.start();
 }
 
-void Account::measureSwitches(const std::string& what) {
+std::vector<double> Account::timeSwitches(std::size_t count) {
   const auto from = one.client(), to = two.client(), announcements = two.hearthdClient();
   watch(*announcements, pairwell::names::settingsChanged);
   std::vector<double> times;
-  for (std::size_t count = 0; count <= switches; ++count) {
+  for (std::size_t done = 0; done <= count; ++done) {
     const double start = now();
     switchTo(true, *from, *to, *announcements);
-    if (count > 0) times.push_back((now() - start) / 1000);  // at first the two may not be connected yet
+    if (done > 0) times.push_back((now() - start) / 1000);  // at first the two may not be connected yet
     switchTo(false, *from, *to, *announcements);
   }
-  report(what, percentiles(times), "ms");
+  return times;
 }
 
 // Each switch is followed by a number of its own, so that it shows which of them the other device has.
@@ -137,6 +144,28 @@ void Account::measureCatchingUp(const std::string& documents) {
   await("the other does not catch up",
         [&] { return there.store->dictionaryRepresentation().contains(key(changes - 1)); });
   report("catching up with 1000 changes, start included", (now() - start) / 1000, "ms");
+}
+
+void measureAccounts(const std::string& programs) {
+  const fakes::TemporaryFolder share;
+  Account account(programs, "--cloud dir:" + share.path + " --account bench");
+  Cluster cluster;
+  Account distant(programs, cluster.initOptions());
+  Table& switches = table("accounts", "On at one device to on at another", "ms");
+  for (int round = 0; round < rounds; ++round) {
+    switches.add("through a folder", percentiles(account.timeSwitches(100)));
+    switches.add("over NATS, three servers", percentiles(distant.timeSwitches(100)));
+  }
+  switches.watch("through a folder", "p50", 60);
+  switches.watch("through a folder", "p99", 120);
+  switches.watch("over NATS, three servers", "p50", 60);
+  switches.watch("over NATS, three servers", "p99", 120);
+  switches.print();
+  reportRest("cloudsyncd, a folder", account.member().job("cloudsyncd"));
+  reportRest("cloudsyncd, NATS", distant.member().job("cloudsyncd"));
+  distant.measureLossOfLeaders(cluster);
+  account.measureCatchingUp(share.path + "/bench/");
+  report("cloudsyncd with 1000 keys, resident", residentMebibytes(account.member().job("cloudsyncd")), "MiB");
 }
 
 }  // namespace bench

@@ -1,7 +1,9 @@
 // Two devices that share an account.
 #pragma once
 
+#include <cstddef>
 #include <string>
+#include <vector>
 
 #include "bench/Cluster.hpp"
 #include "bench/Device.hpp"
@@ -14,8 +16,8 @@ class Account {
   Account(const std::string& programs, const std::string& options);
 
   Device& member() { return one; }
-  // From "on" at one device to its announcement at the other.
-  void measureSwitches(const std::string& what);
+  // Milliseconds from "on" at one device to its announcement at the other.
+  std::vector<double> timeSwitches(std::size_t count);
   // One switches on and on, while servers that lead the account's stream are killed: how long the other is
   // behind, and that it ends with the same.
   void measureLossOfLeaders(Cluster& cluster);

@@ -1,7 +1,6 @@
 #include "bench/Device.hpp"
 
 #include <signal.h>
-#include <sys/wait.h>
 #include <unistd.h>
 
 #include <chrono>
@@ -12,7 +11,6 @@
 #include <stdexcept>
 #include <utility>
 
-#include "bench/Process.hpp"
 #include "platform/linux/BusServiceListener.hpp"
 #include "platform/linux/HearthInterface.hpp"
 
@@ -38,27 +36,23 @@ Device::Device(const std::string& programs, const std::string& options) {
 Device::~Device() { stop(); }
 
 void Device::start() {
-  pid = ::fork();
-  if (pid == 0) {
+  process.emplace([&] {
     if (!std::freopen((root.path + "/log").c_str(), "a", stderr)) ::_exit(126);
     const std::string program = root.path + "/bin/hearthd";
     ::execl(program.c_str(), "hearthd", "--root", root.path.c_str(), nullptr);
     ::_exit(127);
-  }
+  });
 }
 
 void Device::stop() {
-  if (pid <= 0) return;
-  ::kill(pid, SIGTERM);
-  ::waitpid(pid, nullptr, 0);
-  pid = -1;
+  if (process) process->end(SIGTERM);
 }
 
 pid_t Device::job(const std::string& program) const {
-  const std::string process = "/proc/" + std::to_string(pid);
+  const std::string id = std::to_string(hearthd());
   pid_t child = -1;
   await(program + " does not run", [&] {
-    std::ifstream children(process + "/task/" + std::to_string(pid) + "/children");
+    std::ifstream children("/proc/" + id + "/task/" + id + "/children");
     while (children >> child) {
       std::string name;
       std::getline(std::ifstream("/proc/" + std::to_string(child) + "/comm"), name);
@@ -67,6 +61,15 @@ pid_t Device::job(const std::string& program) const {
     return false;
   });
   return child;
+}
+
+Service Device::service() const {
+  return {_paths.serviceSocket(pairwell::names::service), "", clientInterface().path, clientInterface().name};
+}
+
+Service Device::hearthdService() const {
+  const auto& interface = platform::linux_::hearthInterface();
+  return {_paths.hearthdSocket(), "", interface.path, interface.name};
 }
 
 std::unique_ptr<BusClient> Device::connect(const std::string& socket) {

@@ -4,9 +4,12 @@
 #include <sys/types.h>
 
 #include <memory>
+#include <optional>
 #include <string>
 #include <string_view>
 
+#include "bench/Client.hpp"
+#include "bench/Process.hpp"
 #include "pairwelld/Names.hpp"
 #include "platform/linux/BusClient.hpp"
 #include "platform/linux/Paths.hpp"
@@ -25,10 +28,12 @@ class Device {
   void start();
   void stop();
 
-  pid_t hearthd() const { return pid; }
+  pid_t hearthd() const { return process->pid(); }
   // The process of a job, by the program's name; once it runs.
   pid_t job(const std::string& program) const;
   const platform::linux_::Paths& paths() const { return _paths; }
+  Service service() const;         // pairwelld's
+  Service hearthdService() const;  // hearthd's
   // Connected and authenticated, trying until it is served.
   std::unique_ptr<platform::linux_::BusClient> client() const {
     return connect(_paths.serviceSocket(pairwell::names::service));
@@ -42,7 +47,7 @@ class Device {
 
   const fakes::TemporaryFolder root;
   platform::linux_::Paths _paths;
-  pid_t pid = -1;
+  std::optional<Child> process;
 };
 
 // A call that fails ends the benchmark; `client` is one of pairwelld's, or of hearthd's.

@@ -1,20 +1,71 @@
-// What the measured things stand beside: the same work with nothing around it.
+// What the measured things stand beside: the same work with nothing around it, and what people would use.
 #pragma once
 
 #include <cstddef>
+#include <memory>
 #include <string>
 #include <vector>
 
+#include "bench/Client.hpp"
+#include "bench/Clock.hpp"
+#include "bench/Process.hpp"
+#include "tests/fakes/RealFiles.hpp"
+
+struct sd_bus;
+
 namespace bench {
 
-// Microseconds for each of `rounds` round trips of `bytes` bytes over a socket to another process, whose
-// reading thread hands each to a second thread that answers.
-std::vector<double> pingPongWithHop(std::size_t rounds, std::size_t bytes);
+// Answers messages of `bytes` bytes with a reply: on the thread that reads them, or on a second one.
+class BareServer {
+ public:
+  enum class Answers { inPlace, afterHop };
+  BareServer(Answers answers, std::size_t bytes);
+  const Service& service() const { return _service; }
+
+ private:
+  const fakes::TemporaryFolder folder;
+  const Service _service;
+  const Child process;
+};
+
+// The library's echo service, which clients connect to themselves.
+class DirectEcho {
+ public:
+  explicit DirectEcho(const std::string& programs);
+  const Service& service() const { return _service; }
+  pid_t pid() const { return process.pid(); }
+
+ private:
+  const fakes::TemporaryFolder folder;
+  const Service _service;
+  const Child process;
+};
+
+// A bus of its own, and the echo service behind it.
+class Bus {
+ public:
+  enum class Kind { daemon, broker };
+  Bus(Kind kind, const std::string& programs);
+  ~Bus();
+
+  const Service& echo() const { return _echo; }
+  std::string address() const { return "unix:path=" + _echo.socket; }
+  pid_t pid() const { return process.pid(); }
+
+ private:
+  Child startDaemon();
+  Child startBroker();
+
+  const fakes::TemporaryFolder folder;
+  const Service _echo;
+  sd_bus* controller = nullptr;  // the broker's
+  const Child process;
+  const Child service;
+};
 
 // Microseconds for each of `rounds` times the bare calls of one durable file: open, write, fsync, rename,
 // fsync of the folder, `writes` times over.
-std::vector<double> bareDurableWrites(const std::string& folder, std::size_t rounds, int writes);
-
-double now();  // microseconds, monotonic
+std::vector<double> bareDurableWrites(const std::string& folder, std::size_t rounds, int writes,
+                                      std::size_t bytes = 400);  // about what a store of three keys takes
 
 }  // namespace bench

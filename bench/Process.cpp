@@ -1,5 +1,10 @@
 #include "bench/Process.hpp"
 
+#include <fcntl.h>
+#include <sched.h>
+#include <signal.h>
+#include <sys/prctl.h>
+#include <sys/wait.h>
 #include <unistd.h>
 
 #include <filesystem>
@@ -14,7 +19,55 @@ namespace fs = std::filesystem;
 
 std::string folderOf(pid_t pid) { return "/proc/" + std::to_string(pid); }
 
+bool pinned = false;
+
+cpu_set_t everyCore() {
+  cpu_set_t cores;
+  CPU_ZERO(&cores);
+  for (int core = 0; core < CPU_SETSIZE; ++core) CPU_SET(core, &cores);
+  return cores;
+}
+
+void keepTo(int core) {
+  cpu_set_t cores;
+  CPU_ZERO(&cores);
+  CPU_SET(core, &cores);
+  if (::sched_setaffinity(0, sizeof cores, &cores) < 0) throw std::runtime_error("cannot pin to a core");
+}
+
 }  // namespace
+
+void pin(bool isPinned) {
+  pinned = isPinned;
+  if (pinned) return keepTo(0);
+  const cpu_set_t cores = everyCore();
+  ::sched_setaffinity(0, sizeof cores, &cores);
+}
+
+void become(const std::vector<std::string>& command) {
+  std::vector<char*> arguments;
+  for (const auto& each : command) arguments.push_back(const_cast<char*>(each.c_str()));
+  arguments.push_back(nullptr);
+  ::dup2(::open("/dev/null", O_WRONLY | O_CLOEXEC), STDERR_FILENO);
+  ::execvp(arguments[0], arguments.data());
+  ::_exit(127);
+}
+
+Child::Child(const std::function<void()>& body) : process(::fork()) {
+  if (process < 0) throw std::runtime_error("fork");
+  if (process > 0) return;
+  ::prctl(PR_SET_PDEATHSIG, SIGKILL);
+  if (pinned) keepTo(1);
+  body();
+  ::_exit(0);
+}
+
+void Child::end(int signal) {
+  const pid_t pid = std::exchange(process, -1);
+  if (pid <= 0) return;
+  ::kill(pid, signal);
+  ::waitpid(pid, nullptr, 0);
+}
 
 std::string thisProgram() { return fs::read_symlink("/proc/self/exe"); }
 

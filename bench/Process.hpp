@@ -5,9 +5,12 @@
 
 #include <chrono>
 #include <cstddef>
+#include <functional>
 #include <stdexcept>
 #include <string>
 #include <thread>
+#include <utility>
+#include <vector>
 
 namespace bench {
 
@@ -21,6 +24,28 @@ void await(const std::string& what, Condition condition,
     std::this_thread::sleep_for(std::chrono::microseconds(200));
   }
 }
+
+// From now on this process keeps to one core, and what it starts to another; or all to any.
+void pin(bool isPinned);
+
+// Makes this process the program, found as a shell does, with its standard error at /dev/null.
+[[noreturn]] void become(const std::vector<std::string>& command);
+
+// A process that is gone with its owner.
+class Child {
+ public:
+  // Runs `body` in it, then ends.
+  explicit Child(const std::function<void()>& body);
+  explicit Child(const std::vector<std::string>& command) : Child([&] { become(command); }) {}
+  ~Child() { end(); }
+  Child(Child&& other) noexcept : process(std::exchange(other.process, -1)) {}
+
+  pid_t pid() const { return process; }
+  void end(int signal = 9);
+
+ private:
+  pid_t process;
+};
 
 std::string thisProgram();
 // A field of /proc/PID/status; of a thread, `task` is "/task/TID".

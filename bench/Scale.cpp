@@ -1,4 +1,4 @@
-// Measures what accounts and devices cost a NATS cluster. Usage: pairwell_scale PROGRAMS OUTPUT.json
+// Measures what accounts and devices cost a NATS cluster. Usage: pairwell_scale PROGRAMS FOLDER
 #include <sys/stat.h>
 
 #include <atomic>
@@ -229,7 +229,7 @@ void measureSharedStream(const std::string& document) {
   reportServers(cluster, "1 stream of " + std::to_string(mostAccounts) + " accounts");
 }
 
-void run(const std::string& programs, const std::string& output) {
+void run(const std::string& programs, const std::string& folder) {
   std::string document;
   {
     const Cluster cluster;
@@ -239,7 +239,7 @@ void run(const std::string& programs, const std::string& output) {
   measureDevices(document);
   measureSharedStream(document);
   measureAccounts(document);
-  writeReport(output);
+  writeReport(folder, "scale");
 }
 
 }  // namespace
@@ -247,7 +247,7 @@ void run(const std::string& programs, const std::string& output) {
 
 int main(int count, char** arguments) {
   if (count != 3) {
-    std::fprintf(stderr, "usage: pairwell_scale PROGRAMS OUTPUT.json\n");
+    std::fprintf(stderr, "usage: pairwell_scale PROGRAMS FOLDER\n");
     return 2;
   }
   std::setvbuf(stdout, nullptr, _IOLBF, 0);

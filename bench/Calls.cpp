@@ -1,0 +1,219 @@
+// Clients that call: how long they wait, how many calls are served, what a connection costs first, and posts.
+#include <sys/epoll.h>
+
+#include <functional>
+#include <memory>
+#include <stdexcept>
+#include <tuple>
+#include <vector>
+
+#include "bench/Client.hpp"
+#include "bench/Clock.hpp"
+#include "bench/Peers.hpp"
+#include "bench/Process.hpp"
+#include "bench/Subjects.hpp"
+#include "platform/linux/HearthInterface.hpp"
+
+namespace bench {
+namespace {
+
+const std::string status = "status", name = "given name", bare = "bare socket",
+                  bareHop = "bare socket, with a hop", direct = "library's echo service, direct",
+                  behindDaemon = "echo behind dbus-daemon", behindBroker = "echo behind dbus-broker";
+
+// Who is called, and with what.
+struct Target {
+  std::string row;
+  Service service;
+  std::string message;
+};
+
+// A device and all its peers, at rest until they are called.
+struct Field {
+  explicit Field(const std::string& programs)
+      : device(programs),
+        daemon(Bus::Kind::daemon, programs),
+        broker(Bus::Kind::broker, programs),
+        echo(programs) {
+    device.start();
+    device.client();
+    const Service own = device.service();
+    targets = {{status, own, callMessage(own, "GetDistributedLoggingStatus")},
+               {name, own, callMessage(own, "GetCurrentUserGivenName")}};
+    const std::size_t bytes = targets.front().message.size();
+    inPlace = std::make_unique<BareServer>(BareServer::Answers::inPlace, bytes);
+    afterHop = std::make_unique<BareServer>(BareServer::Answers::afterHop, bytes);
+    const std::string request(bytes, 'x');
+    targets.push_back({bare, inPlace->service(), request});
+    targets.push_back({bareHop, afterHop->service(), request});
+    addEcho(direct, echo.service());
+    addEcho(behindDaemon, daemon.echo());
+    addEcho(behindBroker, broker.echo());
+  }
+  void addEcho(const std::string& row, const Service& service) {
+    targets.push_back({row, service, callMessage(service, "Echo")});
+  }
+
+  Device device;
+  Bus daemon, broker;
+  DirectEcho echo;
+  std::unique_ptr<BareServer> inPlace, afterHop;
+  std::vector<Target> targets;
+};
+
+std::vector<double> times(std::size_t count, const std::function<void()>& work) {
+  for (std::size_t warmUp = 0; warmUp < count / 10; ++warmUp) work();
+  std::vector<double> all;
+  for (std::size_t done = 0; done < count; ++done) {
+    const double start = now();
+    work();
+    all.push_back(now() - start);
+  }
+  return all;
+}
+
+// Clients that are waited for together.
+struct Crowd {
+  Crowd(const Service& service, std::size_t size) : loop(::epoll_create1(EPOLL_CLOEXEC)) {
+    for (std::size_t count = 0; count < size; ++count) {
+      clients.push_back(std::make_unique<Client>(service));
+      epoll_event event{EPOLLIN, {}};
+      event.data.ptr = clients.back().get();
+      ::epoll_ctl(loop.get(), EPOLL_CTL_ADD, clients.back()->descriptor(), &event);
+    }
+  }
+  // Until one can be read; then `read` is called for each that can.
+  template <class Read>
+  void wait(Read read) const {
+    epoll_event events[64];
+    const int ready = ::epoll_wait(loop.get(), events, 64, 5000);
+    if (ready <= 0) throw std::runtime_error("nothing comes");
+    for (int index = 0; index < ready; ++index) read(*static_cast<Client*>(events[index].data.ptr));
+  }
+
+  const platform::linux_::UniqueDescriptor loop;
+  std::vector<std::unique_ptr<Client>> clients;
+};
+
+// Each of so many clients sends its next call when it has the answer.
+double callsPerSecond(const Target& target, std::size_t clients) {
+  constexpr double warmUp = 100'000, span = 500'000;
+  const Crowd crowd(target.service, clients);
+  for (const auto& client : crowd.clients) client->send(target.message);
+  const double begin = now() + warmUp;
+  std::size_t answered = 0;
+  double moment = now();
+  while (moment < begin + span) {
+    crowd.wait([&](Client& client) {
+      if (client.receive(Client::Kind::reply) == 0) return;
+      if (moment >= begin) ++answered;
+      client.send(target.message);
+    });
+    moment = now();
+  }
+  return static_cast<double>(answered) / (moment - begin) * 1e6;
+}
+
+// How posts travel: what a subscriber sends first, and what the poster sends.
+struct Channel {
+  std::string row;
+  Service service;
+  std::string subscription, post;
+};
+
+// Until each of `subscribers` has it.
+std::vector<double> timePosts(const Channel& channel, std::size_t subscribers) {
+  Crowd crowd(channel.service, subscribers);
+  for (const auto& client : crowd.clients) client->call(channel.subscription);
+  const Client poster(channel.service);
+  return times(20'000 / (subscribers + 10), [&] {
+    poster.send(channel.post);
+    for (std::size_t heard = 0; heard < subscribers;)
+      crowd.wait([&](Client& client) { heard += client.receive(Client::Kind::signal); });
+  });
+}
+
+}  // namespace
+
+void measureReads(const std::string& programs) {
+  Field field(programs);
+  Table& reads = table(named("reads"), titled("One call by one client"), "µs");
+  for (int round = 0; round < rounds; ++round) {
+    for (const Target& target : field.targets) {
+      Client client(target.service);
+      reads.add(target.row, percentiles(times(5'000, [&] { client.call(target.message); })));
+    }
+  }
+  for (const auto& [row, peer, aim] : {std::tuple(status, behindBroker, 0.8),
+                                       {status, bareHop, 2.0},
+                                       {name, behindBroker, 0.5},
+                                       {name, bare, 0.0},
+                                       {name, direct, 0.0}})
+    reads.compare(row, "p50", peer, aim);
+  reads.compare(status, "p99", behindBroker);
+  reads.compare(name, "p99", behindBroker);
+  reads.print();
+}
+
+void measureRates(const std::string& programs) {
+  Field field(programs);
+  Table& rates = table(named("rates"), titled("Calls a second, by clients"), "1/s", Better::more);
+  for (int round = 0; round < rounds; ++round) {
+    for (const std::size_t clients : {1, 8, 64, 512}) {
+      for (const Target& target : field.targets)
+        rates.add(target.row, std::to_string(clients), callsPerSecond(target, clients));
+    }
+  }
+  rates.compare(status, "8", behindBroker, 1.3);
+  rates.compare(status, "64", behindBroker, 1.7);
+  rates.compare(name, "8", behindBroker, 2);
+  rates.compare(name, "64", behindBroker, 2);
+  for (const auto& row : {status, name}) rates.compare(row, "512", behindBroker);
+  rates.print();
+}
+
+void measureConnects(const std::string& programs) {
+  Field field(programs);
+  Table& connects = table(named("connects"), titled("Connect and first answer"), "µs");
+  for (int round = 0; round < rounds; ++round) {
+    for (const Target& target : field.targets)
+      connects.add(target.row, percentiles(times(500, [&] { Client(target.service).call(target.message); })));
+  }
+  connects.compare(status, "p50", behindDaemon, 1);
+  connects.compare(status, "p50", behindBroker, 1);
+  connects.print();
+}
+
+void measurePosts(const std::string& programs) {
+  Device device(programs);
+  device.start();
+  device.client();
+  const Bus daemon(Bus::Kind::daemon, programs), broker(Bus::Kind::broker, programs);
+  const Service hearth = device.hearthdService();
+  std::string post = callMessage(hearth, "Post", {"bench"});
+  post[2] |= 1;  // asks for no answer, as a signal gets none
+  std::vector<Channel> channels{{"hearthd", hearth, callMessage(hearth, "Watch", {"bench"}), post}};
+  for (const auto& [row, bus] : {std::pair("dbus-daemon", &daemon), {"dbus-broker", &broker}}) {
+    const Service there{bus->echo().socket, "org.freedesktop.DBus", "/org/freedesktop/DBus",
+                        "org.freedesktop.DBus"};
+    channels.push_back({row, there, callMessage(there, "AddMatch", {"type='signal',interface='x.Echo'"}),
+                        signalMessage(bus->echo(), "Changed")});
+  }
+  Table& posts =
+      table(named("posts"), titled("A post until every subscriber has it, p50 by subscribers"), "µs");
+  const auto sizes = {1, 8, 64, 512};
+  for (int round = 0; round < rounds; ++round) {
+    for (const int subscribers : sizes) {
+      for (const Channel& channel : channels)
+        posts.add(channel.row, std::to_string(subscribers),
+                  percentiles(timePosts(channel, static_cast<std::size_t>(subscribers))).p50);
+    }
+  }
+  for (const int subscribers : sizes) {
+    for (const char* bus : {"dbus-daemon", "dbus-broker"})
+      posts.compare("hearthd", std::to_string(subscribers), bus, 1);
+  }
+  posts.print();
+}
+
+}  // namespace bench

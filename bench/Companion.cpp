@@ -1,0 +1,50 @@
+#include "bench/Companion.hpp"
+
+#include <fcntl.h>
+#include <unistd.h>
+
+#include <stdexcept>
+
+namespace bench {
+namespace {
+
+const int* made(int* ends) {
+  if (::pipe2(ends, O_CLOEXEC) < 0) throw std::runtime_error("pipe");
+  return ends;
+}
+
+}  // namespace
+
+Companion::Companion(const std::function<void()>& body)
+    : process([&, input = made(toward)[0], output = made(back)[1]] {
+        ::dup2(input, STDIN_FILENO);
+        ::dup2(output, STDOUT_FILENO);
+        ::close(toward[1]);
+        body();
+      }),
+      orders(::fdopen(toward[1], "w")),
+      moments(::fdopen(back[0], "r")) {
+  ::close(toward[0]);
+  ::close(back[1]);
+  moment();
+}
+
+Companion::Companion(const std::vector<std::string>& command) : Companion([&] { become(command); }) {}
+
+void Companion::goOn() {
+  std::fputc('\n', orders.get());
+  std::fflush(orders.get());
+}
+
+double Companion::moment() {
+  double said = 0;
+  if (std::fscanf(moments.get(), "%lf", &said) != 1) throw std::runtime_error("a companion says nothing");
+  return said;
+}
+
+void Companion::say(double moment) {
+  std::printf("%.3f\n", moment);
+  std::fflush(stdout);
+}
+
+}  // namespace bench
