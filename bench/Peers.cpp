@@ -97,6 +97,7 @@ int listenAt(const std::string& path) {
 }
 
 constexpr char daemonConfiguration[] = R"(<busconfig><type>session</type><auth>EXTERNAL</auth>
+<standard_session_servicedirs/>
 <policy context="default"><allow send_destination="*"/><allow receive_sender="*"/><allow own="*"/></policy>
 <limit name="max_completed_connections">4096</limit><limit name="max_connections_per_user">4096</limit>
 <limit name="max_match_rules_per_connection">4096</limit>)";
