@@ -45,6 +45,7 @@ class BusServer::State : public BusSessionHost, public std::enable_shared_from_t
   }
 
   void dispatch() {
+    const auto self = shared_from_this();  // who is told of the end of draining may end the server
     const auto turn = takeTurn();
     const State* const outer = std::exchange(dispatching, this);
     settleChanged();
@@ -82,6 +83,7 @@ class BusServer::State : public BusSessionHost, public std::enable_shared_from_t
   }
 
   void drain(std::function<void()> drained) {
+    const auto self = shared_from_this();
     const auto turn = takeTurn();
     stopListening();
     whenDrained = std::move(drained);
@@ -120,8 +122,8 @@ class BusServer::State : public BusSessionHost, public std::enable_shared_from_t
  private:
   struct Entry {
     std::shared_ptr<BusSession> session;
-    std::uint32_t events = 0;  // what epoll watches for
-    std::optional<BusSession::TimePoint> deadline;
+    std::uint32_t events = 0;                       // what epoll watches for
+    std::optional<BusSession::TimePoint> deadline;  // as set; one that has passed ends the session
     bool isUnsettled() const {
       return session->hasEnded() || session->wantedEvents() != events || session->deadline() != deadline;
     }
@@ -160,7 +162,7 @@ class BusServer::State : public BusSessionHost, public std::enable_shared_from_t
   bool answerAtOnce(std::uint64_t number, std::uint64_t call, BusReply& reply) {
     if (dispatching == this) return false;
     const std::unique_lock turn(turns, std::try_to_lock);
-    if (!turn) return false;
+    if (!turn || hasHandedOver()) return false;  // answers keep their order
     const auto found = sessions.find(number);
     if (found == sessions.end()) return true;
     BusSession& session = *found->second.session;
@@ -180,6 +182,11 @@ class BusServer::State : public BusSessionHost, public std::enable_shared_from_t
       handedOver.push_back(std::move(work));
     }
     if (first) eventfd_write(wakeUp.get(), 1);
+  }
+
+  bool hasHandedOver() {
+    const std::lock_guard lock(mutex);
+    return !handedOver.empty();
   }
 
   void runHandedOver() {

@@ -34,7 +34,7 @@ void BusSession::Unreference::operator()(sd_bus_message* message) const { sd_bus
 BusSession::BusSession(BusSessionHost& host_, std::uint64_t number_, UniqueDescriptor socket_,
                        PeerIdentity peer)
     : number(number_),
-      host(host_),
+      host(&host_),
       _peer(std::move(peer)),
       ownSocket(std::move(socket_)),
       descriptor(ownSocket.get()) {}
@@ -46,12 +46,12 @@ void BusSession::admit(std::shared_ptr<BusHandler> handler_,
   handler = std::move(handler_);
   phase = Phase::handshake;
   if (patience) end = std::chrono::steady_clock::now() + *patience;
-  shaking.emplace(_peer.uid, host.service().identifier);
+  shaking.emplace(_peer.uid, host->service().identifier);
 }
 
 void BusSession::refuse() {
   phase = Phase::refused;
-  end = std::chrono::steady_clock::now() + host.service().patience.refusal;
+  end = std::chrono::steady_clock::now() + host->service().patience.refusal;
   // Closing at once, or with input unread, would reach the client as a broken pipe.
   if (!sendAll(descriptor, busRefusal) || ::shutdown(descriptor, SHUT_WR) < 0) phase = Phase::ended;
 }
@@ -128,7 +128,10 @@ void BusSession::handleInput() {
   input.erase(0, used);
   if (input.empty()) input.shrink_to_fit();  // thousands may be idle
   handling = false;
-  if (phase == Phase::running) reconsiderDeadline(used > 0);
+  if (phase == Phase::running) {
+    sendSignals();  // a message that was handled may have taken the unread output with it
+    reconsiderDeadline(used > 0);
+  }
   if (inputEnded && isDrained()) close();
 }
 
@@ -150,6 +153,12 @@ std::size_t BusSession::shakeHands() {
   return input.size() - rest.size();
 }
 
+// Of `bytes` into the pipe; how many it took.
+std::size_t BusSession::pass(std::string_view bytes) const {
+  const ssize_t count = ::write(feed.get(), bytes.data(), bytes.size());
+  return count < 0 ? 0 : static_cast<std::size_t>(count);
+}
+
 // Makes the library's bus. It insists on a handshake of its own: it gets one through the pipe, and its answer
 // is thrown away. Only then the client's socket takes the place of the output.
 bool BusSession::beginMessages() {
@@ -157,38 +166,44 @@ bool BusSession::beginMessages() {
   if (::pipe2(ends, O_CLOEXEC | O_NONBLOCK) < 0) return false;
   UniqueDescriptor inner(ends[0]);
   feed.reset(ends[1]);
+  // A message, and no more of what a user's pipes may take together. Beyond that they are given less.
+  ::fcntl(feed.get(), F_SETPIPE_SZ, static_cast<int>(limits::messageBytes));
   if (::socketpair(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC | SOCK_NONBLOCK, 0, answer) < 0) return false;
   UniqueDescriptor output(answer[0]);
   const UniqueDescriptor thrownAway(answer[1]);
   const int outputNumber = output.get();
-  if (!pass(std::string_view("\0AUTH ANONYMOUS\r\nBEGIN\r\n", 24))) return false;
-  int result = host.service().open(*this, std::move(inner), std::move(output), bus);
+  constexpr std::string_view handshake("\0AUTH ANONYMOUS\r\nBEGIN\r\n", 24);
+  if (pass(handshake) < handshake.size()) return false;
+  int result = host->service().open(*this, std::move(inner), std::move(output), bus);
   while (result > 0) result = sd_bus_process(bus, nullptr);
   if (result < 0 || sd_bus_is_ready(bus) <= 0) return false;
 
   const int before = descriptor;
   if (::dup3(descriptor, outputNumber, O_CLOEXEC) < 0) return false;
   descriptor = outputNumber;
-  host.socketMoved(*this, before);
+  host->socketMoved(*this, before);
   ownSocket.reset();
   sendSignals();
   return true;
 }
 
-// To the library. The pipe is empty, and holds four times the largest message.
-bool BusSession::pass(std::string_view bytes) {
-  return ::write(feed.get(), bytes.data(), bytes.size()) == static_cast<ssize_t>(bytes.size());
-}
-
 bool BusSession::handleMessage(std::string_view message) {
-  if (!pass(message)) {
-    fail("a message cannot be passed on");
-    return false;
-  }
   const std::size_t before = dispatched;
-  int result = 1;
-  while (result > 0 && dispatched == before) result = sd_bus_process(bus, nullptr);
-  if (result < 0) {
+  int result = 0;
+  // In parts if need be: of a user with many pipes each is small.
+  while (result >= 0 && !message.empty() && dispatched == before) {
+    const std::size_t passed = pass(message);
+    if (passed == 0) {
+      fail("a message cannot be passed on");
+      return false;
+    }
+    message.remove_prefix(passed);
+    do {
+      result = sd_bus_process(bus, nullptr);
+    } while (result > 0 && dispatched == before);
+  }
+  // Of a client that has gone the library closes the socket: its number may be another client's next.
+  if (result < 0 || sd_bus_is_ready(bus) <= 0) {
     fail("a message is refused");
   } else if (dispatched == before) {
     fail("a message is malformed");  // the library drops such a one, and would wait for the next
@@ -198,7 +213,7 @@ bool BusSession::handleMessage(std::string_view message) {
 
 int BusSession::call(sd_bus_message* message) {
   if (phase != Phase::running) return 1;
-  const auto& operations = host.service().interface.operations;
+  const auto& operations = host->service().interface.operations;
   const std::string_view member = sd_bus_message_get_member(message);
   std::size_t operation = 0;  // the library has found name and types to fit
   while (operations.at(operation).name != member) ++operation;
@@ -206,7 +221,7 @@ int BusSession::call(sd_bus_message* message) {
   if (!arguments) return -arguments.error().value();
   const std::uint64_t identifier = ++lastCall;
   unanswered.emplace(identifier, Call{operation, Message(sd_bus_message_ref(message))});
-  handler->call(operation, std::move(*arguments), host.completion(number, identifier));
+  handler->call(operation, std::move(*arguments), host->completion(number, identifier));
   return 1;
 }
 
@@ -230,7 +245,7 @@ BusSession::Message BusSession::makeAnswer(const Call& call, const BusReply& rep
   }
   if (sd_bus_message_new_method_return(call.message.get(), &answer) < 0) return nullptr;
   Message owned(answer);
-  const BusOperation& operation = host.service().interface.operations[call.operation];
+  const BusOperation& operation = host->service().interface.operations[call.operation];
   if (const auto appended = appendValues(answer, operation.results, std::get<List>(reply)); !appended) {
     log().error("%s: the answer does not fit: %s", operation.name, appended.error().message());
     return nullptr;
@@ -244,7 +259,8 @@ void BusSession::stopReading() {
 }
 
 void BusSession::emit(std::size_t signal, List arguments, const std::string& mergeKey) {
-  const auto turn = host.takeTurn();
+  if (!host) return;
+  const auto turn = host->takeTurn();
   if (phase == Phase::ended || phase == Phase::refused) return;
   const auto earlier = std::find_if(signals.begin(), signals.end(), [&](const Signal& candidate) {
     return candidate.signal == signal && candidate.mergeKey == mergeKey;
@@ -255,14 +271,14 @@ void BusSession::emit(std::size_t signal, List arguments, const std::string& mer
     earlier->arguments = std::move(arguments);
   }
   if (phase == Phase::running) sendSignals();
-  host.changed(*this);
+  host->changed(*this);
 }
 
 // While output is unread, signals wait here, where they merge.
 void BusSession::sendSignals() {
   std::size_t sent = 0;
   for (; sent < signals.size() && unsent() == 0 && phase == Phase::running; ++sent) {
-    const BusInterface& interface = host.service().interface;
+    const BusInterface& interface = host->service().interface;
     const BusSignal& description = interface.signals.at(signals[sent].signal);
     sd_bus_message* message = nullptr;
     if (sd_bus_message_new_signal(bus, &message, interface.path.c_str(), interface.name.c_str(),
@@ -309,13 +325,14 @@ void BusSession::reconsiderDeadline(bool moved) {
   if (!isHeldUp()) {
     end.reset();
   } else if (!end || moved) {
-    end = std::chrono::steady_clock::now() + host.service().patience.stall;
+    end = std::chrono::steady_clock::now() + host->service().patience.stall;
   }
 }
 
 void BusSession::close() {
-  const auto turn = host.takeTurn();
-  if (std::exchange(phase, Phase::ended) != Phase::ended) host.changed(*this);
+  if (!host) return;
+  const auto turn = host->takeTurn();
+  if (std::exchange(phase, Phase::ended) != Phase::ended) host->changed(*this);
 }
 
 void BusSession::fail(const char* reason) {
@@ -324,6 +341,7 @@ void BusSession::fail(const char* reason) {
 }
 
 void BusSession::finish() {
+  host = nullptr;
   unanswered.clear();  // messages refer to the bus
   bus = sd_bus_close_unref(bus);
   ownSocket.reset();

@@ -60,7 +60,7 @@ class BusSession : public BusConnection {
   void processEnded();
   void deadlinePassed();
   void complete(std::uint64_t call, BusReply reply);
-  // Whether an answer would lead to nothing that the server's thread has to do.
+  // Whether an answer would lead to nothing but itself, and a change of what is watched for.
   bool canBeAnsweredElsewhere() const {
     return phase == Phase::running && input.empty() && !inputEnded && !readingStopped && unsent() == 0;
   }
@@ -101,7 +101,7 @@ class BusSession : public BusConnection {
   void handleInput();
   std::size_t shakeHands();
   bool beginMessages();
-  bool pass(std::string_view bytes);
+  std::size_t pass(std::string_view bytes) const;
   bool handleMessage(std::string_view message);
   Message makeAnswer(const Call& call, const BusReply& reply) const;
   void send(Message message);
@@ -113,7 +113,7 @@ class BusSession : public BusConnection {
   void reconsiderDeadline(bool moved);
   void fail(const char* reason);
 
-  BusSessionHost& host;
+  BusSessionHost* host;  // null after the end
   PeerIdentity _peer;
   std::shared_ptr<BusHandler> handler;
   Phase phase = Phase::undecided;

@@ -132,10 +132,10 @@ Dictionary Entitlements::of(const PeerIdentity& peer) {
   Dictionary entitlements;
   for (EntitlementGrant& grant : readFiles(files, paths)) {
     if (grant.problem.empty() && !isFor(grant, peer)) continue;
-    checkExecutable(grant);  // of those alone that count for this peer: it takes as long as all the rest
+    checkExecutable(grant);  // of those alone that may count: it takes as long as all the rest
     if (!grant.problem.empty()) {
       sayOnce(grant);
-    } else {
+    } else if (isFor(grant, peer)) {  // once more: it must be the file that has just been looked at
       for (const auto& [name, value] : grant.entitlements) entitlements.insert_or_assign(name, value);
     }
   }
