@@ -55,6 +55,7 @@ void switchTo(bool state, BusClient& from, BusClient& to, BusClient& announcemen
 
 void reportRest(const std::string& name, pid_t pid) {
   report(name + ", resident", residentMebibytes(pid), "MiB");
+  std::this_thread::sleep_for(2s);  // the last switch goes its way
   const long before = wakeUps(pid);
   std::this_thread::sleep_for(60s);
   report(name + ", wake-ups in 60 idle seconds", static_cast<double>(wakeUps(pid) - before), "");

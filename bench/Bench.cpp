@@ -1,13 +1,22 @@
 // Measures a whole device beside its peers, in one run.
 // Usage: pairwell_bench PROGRAMS FOLDER [SUBJECT…]   (all by default)
 //        pairwell_bench --compare BEFORE.json AFTER.json
+#include <linux/magic.h>
 #include <sys/resource.h>
+#include <sys/statfs.h>
+#include <sys/utsname.h>
 
 #include <algorithm>
+#include <cstdint>
 #include <cstdio>
+#include <cstdlib>
 #include <cstring>
 #include <exception>
+#include <filesystem>
+#include <iterator>
+#include <stdexcept>
 #include <string>
+#include <thread>
 #include <vector>
 
 #include "bench/Clock.hpp"
@@ -28,14 +37,32 @@ constexpr Subject subjects[] = {{"reads", measureReads, true},        {"rates", 
                                 {"starts", measureStarts, false},     {"rest", measureRest, false},
                                 {"growth", measureGrowth, false},     {"accounts", measureAccounts, false}};
 
-bool isPinned = false;
-
 void measure(const Subject& subject, const std::string& programs, bool pinned, double begin) {
   std::printf("\n%s%s, after %.0f s\n", subject.name, pinned ? ", pinned" : "", (now() - begin) / 1e6);
   std::fflush(stdout);
-  pin(isPinned = pinned);
+  pin(pinned);
   subject.measure(programs);
-  pin(isPinned = false);
+  pin(false);
+}
+
+void setConditions() {
+  utsname system{};
+  ::uname(&system);
+  setCondition("kernel", std::string(system.release));
+  setCondition("cores", static_cast<std::int64_t>(std::thread::hardware_concurrency()));
+  double load = 0;
+  ::getloadavg(&load, 1);
+  setCondition("load before", load);
+  struct statfs files {};
+  const std::string folder = std::filesystem::temp_directory_path();
+  ::statfs(folder.c_str(), &files);
+  setCondition("files in memory", files.f_type == TMPFS_MAGIC);  // then nothing waits for a disk
+  setCondition("log", "default level, a line a read or switch, to a file there");
+}
+
+bool isSubject(const std::string& name) {
+  return std::any_of(std::begin(subjects), std::end(subjects),
+                     [&](const Subject& subject) { return subject.name == name; });
 }
 
 // A thousand clients, of more than one service.
@@ -47,26 +74,30 @@ void allowDescriptors() {
 }
 
 void run(const std::string& programs, const std::string& folder, const std::vector<std::string>& wanted) {
+  for (const auto& name : wanted) {
+    if (!isSubject(name)) throw std::runtime_error(name + " is nothing that can be measured");
+  }
   allowDescriptors();
+  setConditions();
   const double begin = now();
   for (const Subject& subject : subjects) {
     if (!wanted.empty() && std::find(wanted.begin(), wanted.end(), subject.name) == wanted.end()) continue;
     measure(subject, programs, false, begin);
     if (subject.isPinnedToo) measure(subject, programs, true, begin);
+    writeReport(folder, wanted.empty() ? "bench" : "some");
   }
-  writeReport(folder, "bench");
 }
 
 }  // namespace
 
-std::string named(const std::string& name) { return name + (isPinned ? "-pinned" : ""); }
-std::string titled(const std::string& title) { return title + (isPinned ? ", pinned" : ""); }
+std::string named(const std::string& name) { return name + (isPinned() ? "-pinned" : ""); }
+std::string titled(const std::string& title) { return title + (isPinned() ? ", pinned" : ""); }
 
 }  // namespace bench
 
 int main(int count, char** arguments) {
-  const bool compares = count == 4 && std::strcmp(arguments[1], "--compare") == 0;
-  if (count < 3) {
+  const bool compares = count > 1 && std::strcmp(arguments[1], "--compare") == 0;
+  if (compares ? count != 4 : count < 3) {
     std::fprintf(stderr,
                  "usage: pairwell_bench PROGRAMS FOLDER [SUBJECT…] | --compare BEFORE.json AFTER.json\n");
     return 2;

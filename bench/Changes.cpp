@@ -2,7 +2,8 @@
 #include <sys/inotify.h>
 #include <unistd.h>
 
-#include <cstdlib>
+#include <cstdint>
+#include <cstdio>
 #include <fstream>
 #include <memory>
 #include <string>
@@ -19,24 +20,18 @@
 namespace bench {
 namespace {
 
-constexpr std::size_t changes = 100;
+constexpr std::size_t changes = 200;
 constexpr char key[] = "value";
 
 // A switch counts as done when its announcement arrives: by then both stores and the alarm are durable.
-std::vector<double> timeSwitches(const Device& device) {
+Figure timeSwitches(const Device& device) {
   Client client(device.service()), watcher(device.hearthdService());
   watcher.call(
       callMessage(device.hearthdService(), "Watch", {std::string(pairwell::names::settingsChanged)}));
-  std::vector<double> times;
-  for (std::size_t count = 0; count < changes; ++count) {
-    const auto call =
-        callMessage(device.service(), "SetKestrelAudioAccessoryLimitedLogging", {count % 2 == 0});
-    const double start = now();
-    client.call(call);
+  return percentiles(times(changes, [&](std::size_t count) {
+    client.call(callMessage(device.service(), "SetKestrelAudioAccessoryLimitedLogging", {count % 2 == 0}));
     while (watcher.receive(Client::Kind::signal) == 0) continue;
-    times.push_back(now() - start);
-  }
-  return times;
+  }));
 }
 
 struct Observer : platform::KeyObserver {
@@ -63,14 +58,21 @@ void watchFolder(const std::string& folder) {
   while (::read(watch, events, sizeof events) > 0) Companion::say(now());
 }
 
+void renameFile(const std::string& folder) {
+  const std::string made = folder + "/new";
+  std::ofstream(made) << "x";
+  std::rename(made.c_str(), (folder + "/value").c_str());
+}
+
 template <class Change>
-std::vector<double> timeChanges(Companion& listener, Change change) {
+Figure timeChanges(Companion& listener, Change change) {
   std::vector<double> times;
   for (std::size_t count = 0; count < changes; ++count) {
-    const double start = change(count);
+    const double start = now();
+    change();
     times.push_back(listener.moment() - start);
   }
-  return times;
+  return percentiles(times);
 }
 
 }  // namespace
@@ -84,7 +86,7 @@ void measureSwitches(const std::string& programs) {
   for (int round = 0; round < rounds; ++round) {
     // Root flag, cloud flag, end time, alarm.
     switches.add(bare, percentiles(bareDurableWrites(device.paths().var, changes, 4)));
-    switches.add(ours, percentiles(timeSwitches(device)));
+    switches.add(ours, timeSwitches(device));
   }
   switches.compare(ours, "p50", bare, 1.3);
   switches.compare(ours, "p99", bare);
@@ -94,45 +96,26 @@ void measureSwitches(const std::string& programs) {
 namespace {
 
 void measureChanges(const std::string& programs, Table& heard) {
-  const fakes::TemporaryFolder stored, bare, settings;
-  ::setenv("XDG_CONFIG_HOME", settings.path.c_str(), 1);
-  ::setenv("XDG_RUNTIME_DIR", settings.path.c_str(), 1);
-  const Bus bus(Bus::Kind::daemon, programs);
-  ::setenv("DBUS_SESSION_BUS_ADDRESS", bus.address().c_str(), 1);
-  Companion dconfListener({programs + "/pairwell_dconf", "watch"});
-  Companion dconfWriter({programs + "/pairwell_dconf", "write", "1"});
-  const std::string path = stored.path + "/store.json";
+  const fakes::TemporaryFolder stored, bare;
+  Dconf dconf(programs, 1);
+  const std::string path = stored.path + "/store.json", ours = "user preferences",
+                    peer = "dconf, not durable";
   Companion observer([&] { observeStore(path); });
   Companion watcher([&] { watchFolder(bare.path); });
   platform::linux_::LinuxFileSystem files{nullptr};
   const auto store = platform::linux_::FileUserPreferences::create(files, nullptr, path);
-  const std::string ours = "a store's observer", dconf = "dconf";
+  std::int64_t value = 0;
   for (int round = 0; round < rounds; ++round) {
-    heard.add(ours, percentiles(timeChanges(observer, [&](std::size_t count) {
-                const double start = now();
-                store->setValue(static_cast<std::int64_t>(count) + round * 1000, key);
-                return start;
-              })));
-    heard.add("bare inotify, not durable", percentiles(timeChanges(watcher, [&](std::size_t) {
-                std::ofstream(bare.path + "/new") << "x";
-                const double start = now();
-                std::rename((bare.path + "/new").c_str(), (bare.path + "/value").c_str());
-                return start;
-              })));
-    heard.add("bare inotify behind a durable write", percentiles(timeChanges(watcher, [&](std::size_t) {
-                const double start = now();
-                bareDurableWrites(bare.path, 1, 1);
-                return start;
-              })));
-    heard.add(dconf, percentiles(timeChanges(dconfListener, [&](std::size_t) {
-                dconfWriter.goOn();
-                const double start = dconfWriter.moment();
-                dconfWriter.moment();
-                return start;
-              })));
+    heard.add(ours, timeChanges(observer, [&] { store->setValue(++value, key); }));
+    heard.add("bare inotify, not durable", timeChanges(watcher, [&] { renameFile(bare.path); }));
+    heard.add("bare inotify and durable write",
+              timeChanges(watcher, [&] { bareDurableWrites(bare.path, 1, 1); }));
+    std::vector<double> waits;
+    for (std::size_t count = 0; count < changes; ++count) waits.push_back(dconf.write().heard);
+    heard.add(peer, percentiles(waits));
   }
-  heard.compare(ours, "p50", dconf, 0.5);
-  heard.compare(ours, "p99", dconf);
+  heard.compare(ours, "p50", peer, 0.5);
+  heard.compare(ours, "p99", peer);
   heard.print();
 }
 
@@ -140,11 +123,10 @@ void measureChanges(const std::string& programs, Table& heard) {
 
 // On the disk what lasts waits for it, and the peer's does not last; in memory all do the same.
 void measureChanges(const std::string& programs) {
-  const std::string title = "A change by another process until the subscriber hears";
+  const std::string title = "A change by another process until a store's observer hears of it";
   measureChanges(programs, table("changes", title, "µs"));
-  ::setenv("TMPDIR", "/dev/shm", 1);
+  const Variable folder("TMPDIR", "/dev/shm");
   measureChanges(programs, table("changes-memory", title + ", files in memory", "µs"));
-  ::unsetenv("TMPDIR");
 }
 
 }  // namespace bench

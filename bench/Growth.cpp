@@ -1,4 +1,5 @@
 // What the same work costs as there is more of everything else.
+#include <cstdint>
 #include <filesystem>
 #include <fstream>
 #include <memory>
@@ -8,13 +9,13 @@
 #include "bench/Account.hpp"
 #include "bench/Client.hpp"
 #include "bench/Clock.hpp"
-#include "bench/Companion.hpp"
 #include "bench/Peers.hpp"
 #include "bench/Subjects.hpp"
 #include "cloudsyncd/core/Document.hpp"
-#include "hearthd/AlarmFile.hpp"
+#include "hearthd/core/Alarms.hpp"
 #include "platform/EventStreams.hpp"
 #include "platform/linux/FileUserPreferences.hpp"
+#include "platform/linux/Json.hpp"
 #include "platform/linux/LinuxFileSystem.hpp"
 
 namespace bench {
@@ -25,15 +26,7 @@ using platform::linux_::LinuxFileSystem;
 
 constexpr int sizes[] = {10, 100, 1000, 10'000};
 
-std::vector<double> times(std::size_t count, const auto& work) {
-  std::vector<double> all;
-  for (std::size_t done = 0; done < count; ++done) {
-    const double start = now();
-    work(done);
-    all.push_back(now() - start);
-  }
-  return all;
-}
+double median(const std::vector<double>& times) { return percentiles(times).p50; }
 
 // Other connections are there, and idle.
 void growConnections(const std::string& programs) {
@@ -41,26 +34,32 @@ void growConnections(const std::string& programs) {
   device.start();
   device.client();
   const Bus daemon(Bus::Kind::daemon, programs), broker(Bus::Kind::broker, programs);
-  Table& reads = table("growth-connections", "A call beside idle connections, p50 by connections", "µs");
+  const std::string ours = "status", behindBroker = "echo behind dbus-broker";
   struct Row {
-    const char* name;
+    std::string name;
     Service service;
     const char* operation;
+    std::vector<std::unique_ptr<Client>> idle = {};
   };
-  for (const Row& row : {Row{"status", device.service(), "GetDistributedLoggingStatus"},
-                         {"echo behind dbus-daemon", daemon.echo(), "Echo"},
-                         {"echo behind dbus-broker", broker.echo(), "Echo"}}) {
-    const std::string message = callMessage(row.service, row.operation);
-    std::vector<std::unique_ptr<Client>> idle;
-    for (const std::size_t size : {1, 10, 100, 1000}) {
-      while (idle.size() + 1 < size) idle.push_back(std::make_unique<Client>(row.service));
-      Client client(row.service);
-      for (int round = 0; round < rounds; ++round)
-        reads.add(row.name, std::to_string(size),
-                  percentiles(times(3'000, [&](std::size_t) { client.call(message); })).p50);
+  std::vector<Row> all;
+  all.push_back({ours, device.service(), "GetDistributedLoggingStatus"});
+  all.push_back({"echo behind dbus-daemon", daemon.echo(), "Echo"});
+  all.push_back({behindBroker, broker.echo(), "Echo"});
+  Table& reads = table("growth-connections", "A call beside idle connections, p50 by connections", "µs");
+  for (const std::size_t size : {1, 10, 100, 1000}) {
+    for (Row& row : all) {
+      while (row.idle.size() + 1 < size) row.idle.push_back(std::make_unique<Client>(row.service));
     }
+    for (int round = 0; round < rounds; ++round) {
+      for (const Row& row : all) {
+        const std::string message = callMessage(row.service, row.operation);
+        Client client(row.service);
+        reads.add(row.name, std::to_string(size),
+                  median(times(3'000, [&](std::size_t) { client.call(message); })));
+      }
+    }
+    reads.compare(ours, std::to_string(size), behindBroker);
   }
-  for (const char* size : {"1", "1000"}) reads.compare("status", size, "echo behind dbus-broker");
   reads.print();
 }
 
@@ -77,75 +76,56 @@ void fill(LinuxFileSystem& files, const std::string& path, int keys) {
 }
 
 void growStores(const std::string& programs) {
-  const fakes::TemporaryFolder folder, settings;
-  ::setenv("XDG_CONFIG_HOME", settings.path.c_str(), 1);
-  ::setenv("XDG_RUNTIME_DIR", settings.path.c_str(), 1);
-  const Bus bus(Bus::Kind::daemon, programs);
-  ::setenv("DBUS_SESSION_BUS_ADDRESS", bus.address().c_str(), 1);
+  const fakes::TemporaryFolder folder;
   LinuxFileSystem files{nullptr};
-  Table& writes = table("growth-writes", "A durable write to a store, p50 by keys", "µs");
+  const std::string ours = "user preferences", bare = "bare calls of a file of that size";
+  Table& writes = table("growth-writes", "A write to a store, p50 by keys", "µs");
   Table& reads = table("growth-reads", "A read of a store, p50 by keys", "µs");
   for (const int size : sizes) {
-    const std::string path = folder.path + "/" + std::to_string(size) + ".json",
-                      column = std::to_string(size);
+    const std::string column = std::to_string(size), path = folder.path + "/" + column + ".json";
     fill(files, path, size);
     const auto store = platform::linux_::FileUserPreferences::create(files, nullptr, path);
-    Companion dconf({programs + "/pairwell_dconf", "write", column});
+    Dconf dconf(programs, size);
+    std::int64_t value = 0;
     for (int round = 0; round < rounds; ++round) {
-      writes.add("user preferences", column, percentiles(times(40, [&](std::size_t count) {
-                                               store->setValue(static_cast<std::int64_t>(count) + round * 100,
-                                                               "key0");
-                                             })).p50);
-      writes.add("bare calls of a file of that size", column,
-                 percentiles(bareDurableWrites(folder.path, 40, 1, fs::file_size(path))).p50);
+      writes.add(ours, column, median(times(40, [&](std::size_t) { store->setValue(++value, "key0"); })));
+      writes.add(bare, column, median(bareDurableWrites(folder.path, 40, 1, fs::file_size(path))));
       std::vector<double> waits;
-      for (int count = 0; count < 40; ++count) {
-        dconf.goOn();
-        const double start = dconf.moment();
-        waits.push_back(dconf.moment() - start);
-      }
-      writes.add("dconf", column, percentiles(waits).p50);
-      reads.add("user preferences", column,
-                percentiles(times(2'000, [&](std::size_t) { store->doubleForKey("key5"); })).p50);
+      for (int count = 0; count < 40; ++count) waits.push_back(dconf.write().returned);
+      writes.add("dconf, not durable", column, median(waits));
+      reads.add(ours, column, median(times(2'000, [&](std::size_t) { store->doubleForKey("key5"); })));
     }
-  }
-  for (const int size : sizes) {
-    writes.compare("user preferences", std::to_string(size), "dconf");
-    reads.watch("user preferences", std::to_string(size));
+    writes.compare(ours, column, bare);
+    reads.watch(ours, column);
   }
   writes.print();
   reads.print();
 }
 
 void growAlarms(const std::string& programs) {
+  const std::string stream(platform::EventStreams::alarms), bare = "bare calls of a file of that size";
+  constexpr std::int64_t future = 4'000'000'000'000'000'000;
   Table& alarms = table("growth-alarms", "One alarm more, durably, p50 by alarms", "µs");
-  LinuxFileSystem files{nullptr};
   for (const int size : sizes) {
     Device device(programs);
     hearth::Alarms stored;
-    const platform::Date future{4'000'000'000'000'000'000};
     for (int number = 0; number < size; ++number)
-      stored.set({"com.kestrel.pairwelld", std::string(platform::EventStreams::alarms),
-                  "bench" + std::to_string(number)},
-                 future);
-    const std::string path = device.paths().alarms();
-    if (!hearth::AlarmFile(files, path).save(stored)) throw std::runtime_error("alarms cannot be stored");
+      stored.set({"com.kestrel.pairwelld", stream, "bench" + std::to_string(number)}, {future});
+    const std::string path = device.paths().alarms(), column = std::to_string(size);
+    fs::create_directories(fs::path(path).parent_path());
+    std::ofstream(path) << *platform::linux_::printJson(stored.toValue(),
+                                                        platform::linux_::JsonStyle::indented);
     device.start();
     device.client();
     Client client(device.hearthdService());
-    const std::string column = std::to_string(size);
+    std::int64_t date = future;
     for (int round = 0; round < rounds; ++round) {
-      alarms.add("hearthd", column,
-                 percentiles(times(40, [&](std::size_t count) {
-                   client.call(callMessage(device.hearthdService(), "SetEvent",
-                                           {std::string(platform::EventStreams::alarms), "bench0",
-                                            static_cast<std::int64_t>(future.nanoseconds - 1 -
-                                                                      static_cast<std::int64_t>(count))}));
-                 })).p50);
-      alarms.add("bare calls of a file of that size", column,
-                 percentiles(bareDurableWrites(device.paths().var, 40, 1, fs::file_size(path))).p50);
+      alarms.add("hearthd", column, median(times(40, [&](std::size_t) {
+                   client.call(callMessage(device.hearthdService(), "SetEvent", {stream, "bench0", --date}));
+                 })));
+      alarms.add(bare, column, median(bareDurableWrites(device.paths().var, 40, 1, fs::file_size(path))));
     }
-    alarms.compare("hearthd", column, "bare calls of a file of that size");
+    alarms.compare("hearthd", column, bare);
   }
   alarms.print();
 }
@@ -153,7 +133,7 @@ void growAlarms(const std::string& programs) {
 // The others' documents are there, as if they had published once.
 void growAccount(const std::string& programs) {
   const fakes::TemporaryFolder share;
-  Table& switches = table("growth-devices", "On at one device to on at another, by devices", "ms");
+  Table& switches = table("growth-devices", "On at one device to on at another, p50 by devices", "ms");
   Account account(programs, "--cloud dir:" + share.path + " --account bench");
   account.timeSwitches(20);
   std::string problem;
@@ -171,9 +151,9 @@ void growAccount(const std::string& programs) {
       const auto text = cloudsync::encodeDocument({"bench", name, "bench", entries});
       std::ofstream(share.path + "/bench/" + name + ".json") << *text;
     }
-    account.timeSwitches(20);  // both have read them
+    account.timeSwitches(20);
     for (int round = 0; round < rounds; ++round)
-      switches.add("through a folder", std::to_string(size), percentiles(account.timeSwitches(40)).p50);
+      switches.add("through a folder", std::to_string(size), median(account.timeSwitches(40)));
     switches.watch("through a folder", std::to_string(size));
   }
   switches.print();

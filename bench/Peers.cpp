@@ -31,10 +31,12 @@ Service echoAt(const std::string& socket, const std::string& destination) {
 // What waits for the second thread.
 class Hop {
  public:
-  Hop(void (*answer_)(int)) : answer(answer_), worker([this] { run(); }) {}
+  explicit Hop(void (*answer_)(int)) : answer(answer_), worker([this] { run(); }) {}
   void hand(int descriptor) {
-    const std::lock_guard lock(mutex);
-    waiting.push_back(descriptor);
+    {
+      const std::lock_guard lock(mutex);
+      waiting.push_back(descriptor);
+    }
     arrived.notify_one();
   }
 
@@ -201,6 +203,20 @@ Child Bus::startBroker() {
   sd_bus_message_unref(call);
   ::close(listener);
   return started;
+}
+
+Dconf::Dconf(const std::string& programs, int keys)
+    : settings("XDG_CONFIG_HOME", folder.path),
+      runtime("XDG_RUNTIME_DIR", folder.path),
+      bus(Bus::Kind::daemon, programs),
+      address("DBUS_SESSION_BUS_ADDRESS", bus.address()),
+      watcher({programs + "/pairwell_dconf", "watch"}),
+      writer({programs + "/pairwell_dconf", "write", std::to_string(keys)}) {}
+
+Dconf::Times Dconf::write() {
+  writer.goOn();
+  const double start = writer.moment(), returned = writer.moment();
+  return {returned - start, watcher.moment() - start};
 }
 
 std::vector<double> bareDurableWrites(const std::string& folder, std::size_t rounds, int writes,

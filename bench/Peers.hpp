@@ -8,6 +8,7 @@
 
 #include "bench/Client.hpp"
 #include "bench/Clock.hpp"
+#include "bench/Companion.hpp"
 #include "bench/Process.hpp"
 #include "tests/fakes/RealFiles.hpp"
 
@@ -61,6 +62,25 @@ class Bus {
   sd_bus* controller = nullptr;  // the broker's
   const Child process;
   const Child service;
+};
+
+// A settings service that desktops use, on a bus of its own; its writes do not wait for the disk.
+class Dconf {
+ public:
+  Dconf(const std::string& programs, int keys);
+
+  // Microseconds from a write's begin until it returns, and until another process has heard of it.
+  struct Times {
+    double returned, heard;
+  };
+  Times write();
+
+ private:
+  const fakes::TemporaryFolder folder;
+  const Variable settings, runtime;
+  const Bus bus;
+  const Variable address;
+  Companion watcher, writer;
 };
 
 // Microseconds for each of `rounds` times the bare calls of one durable file: open, write, fsync, rename,

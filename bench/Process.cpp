@@ -7,6 +7,7 @@
 #include <sys/wait.h>
 #include <unistd.h>
 
+#include <cstdlib>
 #include <filesystem>
 #include <fstream>
 #include <iterator>
@@ -21,13 +22,6 @@ std::string folderOf(pid_t pid) { return "/proc/" + std::to_string(pid); }
 
 bool pinned = false;
 
-cpu_set_t everyCore() {
-  cpu_set_t cores;
-  CPU_ZERO(&cores);
-  for (int core = 0; core < CPU_SETSIZE; ++core) CPU_SET(core, &cores);
-  return cores;
-}
-
 void keepTo(int core) {
   cpu_set_t cores;
   CPU_ZERO(&cores);
@@ -37,12 +31,17 @@ void keepTo(int core) {
 
 }  // namespace
 
-void pin(bool isPinned) {
-  pinned = isPinned;
-  if (pinned) return keepTo(0);
-  const cpu_set_t cores = everyCore();
-  ::sched_setaffinity(0, sizeof cores, &cores);
+void pin(bool wanted) {
+  static const cpu_set_t atFirst = [] {
+    cpu_set_t cores;
+    ::sched_getaffinity(0, sizeof cores, &cores);
+    return cores;
+  }();
+  pinned = wanted;
+  pinned ? keepTo(0) : static_cast<void>(::sched_setaffinity(0, sizeof atFirst, &atFirst));
 }
+
+bool isPinned() { return pinned; }
 
 void become(const std::vector<std::string>& command) {
   std::vector<char*> arguments;
@@ -68,6 +67,13 @@ void Child::end(int signal) {
   ::kill(pid, signal);
   ::waitpid(pid, nullptr, 0);
 }
+
+Variable::Variable(const char* name_, const std::string& value)
+    : name(name_), before(std::getenv(name) ? std::optional<std::string>(std::getenv(name)) : std::nullopt) {
+  ::setenv(name, value.c_str(), 1);
+}
+
+Variable::~Variable() { before ? ::setenv(name, before->c_str(), 1) : ::unsetenv(name); }
 
 std::string thisProgram() { return fs::read_symlink("/proc/self/exe"); }
 

@@ -6,6 +6,7 @@
 #include <chrono>
 #include <cstddef>
 #include <functional>
+#include <optional>
 #include <stdexcept>
 #include <string>
 #include <thread>
@@ -26,7 +27,8 @@ void await(const std::string& what, Condition condition,
 }
 
 // From now on this process keeps to one core, and what it starts to another; or all to any.
-void pin(bool isPinned);
+void pin(bool wanted);
+bool isPinned();
 
 // Makes this process the program, found as a shell does, with its standard error at /dev/null.
 [[noreturn]] void become(const std::vector<std::string>& command);
@@ -45,6 +47,19 @@ class Child {
 
  private:
   pid_t process;
+};
+
+// A variable of the environment, until its owner is gone.
+class Variable {
+ public:
+  Variable(const char* name, const std::string& value);
+  ~Variable();
+  Variable(const Variable&) = delete;
+  Variable& operator=(const Variable&) = delete;
+
+ private:
+  const char* const name;
+  const std::optional<std::string> before;
 };
 
 std::string thisProgram();

@@ -3,6 +3,7 @@
 #include <algorithm>
 #include <cstdio>
 #include <fstream>
+#include <functional>
 #include <iterator>
 #include <memory>
 #include <sstream>
@@ -18,7 +19,7 @@ using platform::Dictionary;
 using platform::List;
 using platform::Value;
 
-Dictionary loose;
+Dictionary loose, conditions;
 std::vector<std::pair<std::string, std::unique_ptr<Table>>> tables;
 
 struct Spread {
@@ -29,10 +30,9 @@ Spread spread(std::vector<double> rounds) {
   return {rounds.at(rounds.size() / 2), rounds.front(), rounds.back()};
 }
 
-// Three digits that say something.
 std::string shown(double figure) {
   char text[32];
-  const int decimals = figure < 0.995 ? 2 : figure < 9.95 ? 2 : figure < 99.5 ? 1 : 0;
+  const int decimals = figure < 9.95 ? 2 : figure < 99.5 ? 1 : 0;
   std::snprintf(text, sizeof text, "%.*f", decimals, figure);
   return text;
 }
@@ -79,7 +79,8 @@ std::vector<double> roundsOf(const Dictionary& comparison) {
 
 Figure percentiles(std::vector<double> times) {
   std::sort(times.begin(), times.end());
-  return {times.at(times.size() / 2), times.at(times.size() * 99 / 100)};
+  const std::size_t rank = (times.size() * 99 + 99) / 100;
+  return {times.at(times.size() / 2), times.at(rank - 1)};
 }
 
 void report(const std::string& what, Figure figure, const char* unit) {
@@ -116,11 +117,12 @@ void Table::add(const std::string& row, Figure figure) {
   add(row, "p99", figure.p99);
 }
 
-void Table::compare(const std::string& row, const std::string& column, const std::string& peer, double aim) {
+void Table::compare(const std::string& row, const std::string& column, const std::string& peer,
+                    std::optional<double> aim) {
   watched.push_back({row, column, peer, aim});
 }
 
-void Table::watch(const std::string& row, const std::string& column, double aim) {
+void Table::watch(const std::string& row, const std::string& column, std::optional<double> aim) {
   watched.push_back({row, column, "", aim});
 }
 
@@ -161,10 +163,11 @@ void Table::print() const {
   for (const Comparison& comparison : watched) {
     const Rounds rounds = compared(comparison);
     const double median = spread(rounds).median;
-    const bool isMet = better == Better::less ? median <= comparison.aim : median >= comparison.aim;
+    const auto& aim = comparison.aim;
+    const bool isMet = better == Better::less ? median <= aim : median >= aim;
     text += "\n| " + label(comparison) + " | " + shown(rounds) + " | ";
-    if (comparison.aim > 0) text += (better == Better::less ? "≤ " : "≥ ") + shown(comparison.aim);
-    text += std::string(" | ") + (comparison.aim > 0 ? isMet ? "met" : "**missed**" : "") + " |";
+    if (aim) text += (better == Better::less ? "≤ " : "≥ ") + shown(*aim);
+    text += std::string(" | ") + (aim ? isMet ? "met" : "**missed**" : "") + " |";
   }
   std::printf("%s\n", text.c_str());
   std::fflush(stdout);
@@ -191,36 +194,41 @@ Dictionary Table::comparisons() const {
 
 std::string Table::drawing() const {
   const bool isCurve = std::all_of(columns.begin(), columns.end(), isNumber);
+  const auto quoted = [](const std::string& text) { return "\"" + text + "\""; };
+  bool isPositive = true;  // a scale of powers has no place for 0
+  for (const auto& row : rows)
+    for (const auto& column : columns)
+      isPositive = isPositive && (!cell(row, column) || spread(*cell(row, column)).median > 0);
   std::ostringstream text;
-  text << "set terminal svg size 760,420 font 'sans-serif,12' background '#ffffff'\nset title '" << title
-       << "'\nset ylabel '" << unit << "'\nset logscale y\nset grid ytics lc rgb '#dddddd'\nset border 3\n"
-       << "set key outside bottom center horizontal\n$data << END\n";
-  const auto quoted = [](const std::string& name) { return "\"" + name + "\""; };
-  const auto& down = isCurve ? columns : rows;
-  const auto& across = isCurve ? rows : columns;
-  for (const auto& line : down) {
-    text << quoted(line);
-    for (const auto& name : across) {
-      const Rounds* rounds = isCurve ? cell(name, line) : cell(line, name);
-      text << ' ' << (rounds ? std::to_string(std::max(spread(*rounds).median, 0.01)) : "NaN");
-    }
-    text << '\n';
-  }
-  text << "END\n";
+  text << "set terminal svg size 760,420 font 'sans-serif,12' background '#ffffff'\nset title "
+       << quoted(title) << "\nset ylabel " << quoted(unit)
+       << (isPositive ? "\nset logscale y" : "\nset yrange [0:1<*]")
+       << "\nset grid ytics lc rgb '#dddddd'\nset border 3\n"
+          "set key outside bottom center horizontal\n";
   if (isCurve) {
     text << "set logscale x\nset xtics nomirror (";
     for (const auto& column : columns) text << (&column == &columns.front() ? "" : ", ") << column;
     text << ")\n";
   } else {
-    text << "set style data histograms\nset style fill solid 0.8\nset xtics nomirror rotate by -20\n"
-            "set yrange [*:*]\n";
+    text << "set style data histograms\nset style fill solid 0.8\nset xtics nomirror rotate by -20\n";
   }
-  text << "plot ";
+  text << "$data << END\n";
+  const auto& down = isCurve ? columns : rows;
+  const auto& across = isCurve ? rows : columns;
+  for (const auto& line : down) {
+    text << (isCurve ? line : quoted(line));
+    for (const auto& name : across) {
+      const Rounds* rounds = isCurve ? cell(name, line) : cell(line, name);
+      text << ' ' << (rounds ? std::to_string(spread(*rounds).median) : "NaN");
+    }
+    text << '\n';
+  }
+  text << "END\nplot ";
   for (std::size_t index = 0; index < across.size(); ++index) {
     const std::string column = std::to_string(index + 2);
     text << (index ? ", " : "") << "$data using ";
     text << (isCurve ? "1:" + column + " with linespoints lw 2 pt 7 ps 0.6" : column + ":xtic(1)");
-    text << " title '" << across[index] << "'";
+    text << " title " << quoted(across[index]);
   }
   text << '\n';
   return text.str();
@@ -234,6 +242,11 @@ Table& table(const std::string& name, const std::string& title, const std::strin
   return *tables.back().second;
 }
 
+void setCondition(const std::string& name, const Value& value) {
+  std::printf("%s: %s\n", name.c_str(), platform::describe(value).c_str());
+  conditions.insert_or_assign(name, value);
+}
+
 void writeReport(const std::string& folder, const std::string& name) {
   Dictionary all, comparisons;
   for (const auto& [known, made] : tables) {
@@ -241,7 +254,7 @@ void writeReport(const std::string& folder, const std::string& name) {
     comparisons.merge(made->comparisons());
     writeText(folder + "/" + known + ".gp", made->drawing());
   }
-  Dictionary whole{{"figures", loose}};
+  Dictionary whole{{"conditions", conditions}, {"figures", loose}};
   if (!all.empty()) whole.insert({{"tables", std::move(all)}, {"compared", std::move(comparisons)}});
   const auto text = platform::linux_::printJson(whole, platform::linux_::JsonStyle::indented);
   if (!text) throw std::runtime_error("a figure is no number");
@@ -250,7 +263,7 @@ void writeReport(const std::string& folder, const std::string& name) {
 
 void compareReports(const std::string& before, const std::string& after) {
   const Dictionary old = comparisonsIn(before), now = comparisonsIn(after);
-  int worse = 0, alike = 0;
+  std::size_t worse = 0, alike = 0;
   for (const auto& [label, value] : now) {
     const auto* found = platform::find<Dictionary>(old, label);
     if (!found) continue;
@@ -263,7 +276,8 @@ void compareReports(const std::string& before, const std::string& after) {
     if (isWorse)
       std::printf("worse: %s: %s, was %s\n", label.c_str(), shown(later).c_str(), shown(earlier).c_str());
   }
-  std::printf("%d worse than the noise, %d not\n", worse, alike);
+  std::printf("%zu worse than the noise, %zu not, %zu of %zu and %zu not compared\n", worse, alike,
+              std::max(old.size(), now.size()) - worse - alike, old.size(), now.size());
 }
 
 }  // namespace bench

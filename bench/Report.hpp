@@ -2,6 +2,7 @@
 #pragma once
 
 #include <map>
+#include <optional>
 #include <string>
 #include <vector>
 
@@ -31,11 +32,11 @@ class Table {
   // One round's figure.
   void add(const std::string& row, const std::string& column, double figure);
   void add(const std::string& row, Figure figure);
-  // `aim` is the most that ours may be times the peer's, or the least where more is better; with 0 it is only
-  // watched.
-  void compare(const std::string& row, const std::string& column, const std::string& peer, double aim = 0);
-  // The aim is ours alone.
-  void watch(const std::string& row, const std::string& column, double aim = 0);
+  // `aim` is the most that ours may be times the peer's, or the least where more is better.
+  void compare(const std::string& row, const std::string& column, const std::string& peer,
+               std::optional<double> aim = std::nullopt);
+  // The same of ours alone.
+  void watch(const std::string& row, const std::string& column, std::optional<double> aim = std::nullopt);
   // As Markdown: of each cell the median of its rounds, its least and its most; then what is compared.
   void print() const;
 
@@ -48,7 +49,7 @@ class Table {
  private:
   struct Comparison {
     std::string row, column, peer;  // without a peer it is ours alone
-    double aim;
+    std::optional<double> aim;
   };
   using Rounds = std::vector<double>;
 
@@ -67,6 +68,8 @@ class Table {
 Table& table(const std::string& name, const std::string& title, const std::string& unit,
              Better better = Better::less);
 
+// What the figures were measured under.
+void setCondition(const std::string& name, const platform::Value& value);
 // Everything so far: FOLDER/NAME.json, and a .gp of each table.
 void writeReport(const std::string& folder, const std::string& name);
 // Prints what became worse from one file to the other by more than either's rounds differ among themselves.
