@@ -26,15 +26,9 @@ struct Target {
   std::string message;
 };
 
-// A device and all its peers, at rest until they are called.
-struct Field {
-  explicit Field(const std::string& programs)
-      : device(programs),
-        daemon(Bus::Kind::daemon, programs),
-        broker(Bus::Kind::broker, programs),
-        echo(programs) {
-    device.start();
-    device.client();
+// All that is called.
+struct Field : Neighbours {
+  explicit Field(const std::string& programs) : Neighbours(programs), echo(programs) {
     const Service own = device.service();
     targets = {{status, own, callMessage(own, "GetDistributedLoggingStatus")},
                {name, own, callMessage(own, "GetCurrentUserGivenName")}};
@@ -52,8 +46,6 @@ struct Field {
     targets.push_back({row, service, callMessage(service, "Echo")});
   }
 
-  Device device;
-  Bus daemon, broker;
   DirectEcho echo;
   std::unique_ptr<BareServer> inPlace, afterHop;
   std::vector<Target> targets;
@@ -178,15 +170,12 @@ void measureConnects(const std::string& programs) {
 }
 
 void measurePosts(const std::string& programs) {
-  Device device(programs);
-  device.start();
-  device.client();
-  const Bus daemon(Bus::Kind::daemon, programs), broker(Bus::Kind::broker, programs);
-  const Service hearth = device.hearthdService();
+  const Neighbours all(programs);
+  const Service hearth = all.device.hearthdService();
   std::string post = callMessage(hearth, "Post", {"bench"});
   post[2] |= 1;  // asks for no answer, as a signal gets none
   std::vector<Channel> channels{{"hearthd", hearth, callMessage(hearth, "Watch", {"bench"}), post}};
-  for (const auto& [row, bus] : {std::pair("dbus-daemon", &daemon), {"dbus-broker", &broker}}) {
+  for (const auto& [row, bus] : {std::pair("dbus-daemon", &all.daemon), {"dbus-broker", &all.broker}}) {
     const Service there{bus->echo().socket, "org.freedesktop.DBus", "/org/freedesktop/DBus",
                         "org.freedesktop.DBus"};
     channels.push_back({row, there, callMessage(there, "AddMatch", {"type='signal',interface='x.Echo'"}),

@@ -35,7 +35,7 @@ Figure timeSwitches(const Device& device) {
 }
 
 struct Observer : platform::KeyObserver {
-  void observeValue(const std::optional<std::string>&, const void*) override { Companion::say(now()); }
+  void observeValue(const std::optional<std::string>&, const void*) override { say(now()); }
 };
 
 // Says when its observer is called.
@@ -45,7 +45,7 @@ void observeStore(const std::string& path) {
   const auto store = platform::linux_::FileUserPreferences::create(files, &loop, path);
   const auto observer = std::make_shared<Observer>();
   store->addObserver(observer, key);
-  Companion::say(0);
+  say(0);
   loop.run();
 }
 
@@ -53,9 +53,9 @@ void observeStore(const std::string& path) {
 void watchFolder(const std::string& folder) {
   const int watch = ::inotify_init1(IN_CLOEXEC);
   ::inotify_add_watch(watch, folder.c_str(), IN_MOVED_TO);
-  Companion::say(0);
+  say(0);
   char events[4096];
-  while (::read(watch, events, sizeof events) > 0) Companion::say(now());
+  while (::read(watch, events, sizeof events) > 0) say(now());
 }
 
 void renameFile(const std::string& folder) {

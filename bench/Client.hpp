@@ -46,4 +46,7 @@ class Client {
   std::string pending;
 };
 
+// Connects and calls until an answer comes.
+void awaitAnswer(const Service& service, const std::string& operation);
+
 }  // namespace bench

@@ -2,6 +2,7 @@
 
 #include <chrono>
 #include <cstddef>
+#include <cstdio>
 #include <vector>
 
 namespace bench {
@@ -10,6 +11,12 @@ namespace bench {
 inline double now() {
   return std::chrono::duration<double, std::micro>(std::chrono::steady_clock::now().time_since_epoch())
       .count();
+}
+
+// A moment as a line, for another process.
+inline void say(double moment) {
+  std::printf("%.3f\n", moment);
+  std::fflush(stdout);
 }
 
 // Microseconds of each of so many times of `work`, which gets the number of times before; a tenth more come

@@ -42,9 +42,4 @@ double Companion::moment() {
   return said;
 }
 
-void Companion::say(double moment) {
-  std::printf("%.3f\n", moment);
-  std::fflush(stdout);
-}
-
 }  // namespace bench

@@ -11,7 +11,7 @@
 
 namespace bench {
 
-// Moments are now()'s, a line each, on standard output; bytes come on standard input.
+// Moments are now()'s, and come by say() on standard output; bytes come on standard input.
 class Companion {
  public:
   // The first thing that it says, when it is ready, is a moment of no meaning.
@@ -20,9 +20,6 @@ class Companion {
 
   void goOn();
   double moment();
-
-  // In the process.
-  static void say(double moment);
 
  private:
   struct Close {

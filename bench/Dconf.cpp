@@ -11,17 +11,14 @@
 
 namespace {
 
+using bench::say;
+
 constexpr char key[] = "/bench/value";
 
 void insist(gboolean done, const char* what) {
   if (done) return;
   std::fprintf(stderr, "pairwell_dconf: cannot %s\n", what);
   std::exit(1);
-}
-
-void say(double moment) {
-  std::printf("%.3f\n", moment);
-  std::fflush(stdout);
 }
 
 void write(DConfClient* client, int keys) {

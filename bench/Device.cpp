@@ -1,10 +1,8 @@
 #include "bench/Device.hpp"
 
 #include <signal.h>
-#include <unistd.h>
 
 #include <chrono>
-#include <cstdio>
 #include <cstdlib>
 #include <filesystem>
 #include <fstream>
@@ -36,12 +34,7 @@ Device::Device(const std::string& programs, const std::string& options) {
 Device::~Device() { stop(); }
 
 void Device::start() {
-  process.emplace([&] {
-    if (!std::freopen((root.path + "/log").c_str(), "a", stderr)) ::_exit(126);
-    const std::string program = root.path + "/bin/hearthd";
-    ::execl(program.c_str(), "hearthd", "--root", root.path.c_str(), nullptr);
-    ::_exit(127);
-  });
+  process.emplace([&] { become({root.path + "/bin/hearthd", "--root", root.path}, root.path + "/log"); });
 }
 
 void Device::stop() {

@@ -30,10 +30,7 @@ double median(const std::vector<double>& times) { return percentiles(times).p50;
 
 // Other connections are there, and idle.
 void growConnections(const std::string& programs) {
-  Device device(programs);
-  device.start();
-  device.client();
-  const Bus daemon(Bus::Kind::daemon, programs), broker(Bus::Kind::broker, programs);
+  const Neighbours neighbours(programs);
   const std::string ours = "status", behindBroker = "echo behind dbus-broker";
   struct Row {
     std::string name;
@@ -42,9 +39,9 @@ void growConnections(const std::string& programs) {
     std::vector<std::unique_ptr<Client>> idle = {};
   };
   std::vector<Row> all;
-  all.push_back({ours, device.service(), "GetDistributedLoggingStatus"});
-  all.push_back({"echo behind dbus-daemon", daemon.echo(), "Echo"});
-  all.push_back({behindBroker, broker.echo(), "Echo"});
+  all.push_back({ours, neighbours.device.service(), "GetDistributedLoggingStatus"});
+  all.push_back({"echo behind dbus-daemon", neighbours.daemon.echo(), "Echo"});
+  all.push_back({behindBroker, neighbours.broker.echo(), "Echo"});
   Table& reads = table("growth-connections", "A call beside idle connections, p50 by connections", "µs");
   for (const std::size_t size : {1, 10, 100, 1000}) {
     for (Row& row : all) {

@@ -153,18 +153,7 @@ Bus::Bus(Kind kind, const std::string& programs)
     : _echo(echoAt(folder.path + "/socket", "x.echo")),
       process(kind == Kind::daemon ? startDaemon() : startBroker()),
       service({programs + "/pairwell_echo", address()}) {
-  const std::string call = callMessage(_echo, "Echo");
-  await(
-      "the echo service does not come to its bus",
-      [&] {
-        try {
-          Client(_echo).call(call);
-          return true;
-        } catch (const std::exception&) {
-          return false;  // not yet
-        }
-      },
-      std::chrono::seconds(10));
+  awaitAnswer(_echo, "Echo");
 }
 
 Bus::~Bus() { sd_bus_close_unref(controller); }
@@ -203,6 +192,12 @@ Child Bus::startBroker() {
   sd_bus_message_unref(call);
   ::close(listener);
   return started;
+}
+
+Neighbours::Neighbours(const std::string& programs)
+    : device(programs), daemon(Bus::Kind::daemon, programs), broker(Bus::Kind::broker, programs) {
+  device.start();
+  awaitAnswer(device.service(), "GetCurrentUserGivenName");
 }
 
 Dconf::Dconf(const std::string& programs, int keys)

@@ -9,6 +9,7 @@
 #include "bench/Client.hpp"
 #include "bench/Clock.hpp"
 #include "bench/Companion.hpp"
+#include "bench/Device.hpp"
 #include "bench/Process.hpp"
 #include "tests/fakes/RealFiles.hpp"
 
@@ -62,6 +63,14 @@ class Bus {
   sd_bus* controller = nullptr;  // the broker's
   const Child process;
   const Child service;
+};
+
+// A device that serves, and the buses beside it, at rest until they are called.
+struct Neighbours {
+  explicit Neighbours(const std::string& programs);
+
+  Device device;
+  Bus daemon, broker;
 };
 
 // A settings service that desktops use, on a bus of its own; its writes do not wait for the disk.

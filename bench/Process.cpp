@@ -43,11 +43,11 @@ void pin(bool wanted) {
 
 bool isPinned() { return pinned; }
 
-void become(const std::vector<std::string>& command) {
+void become(const std::vector<std::string>& command, const std::string& log) {
   std::vector<char*> arguments;
   for (const auto& each : command) arguments.push_back(const_cast<char*>(each.c_str()));
   arguments.push_back(nullptr);
-  ::dup2(::open("/dev/null", O_WRONLY | O_CLOEXEC), STDERR_FILENO);
+  ::dup2(::open(log.c_str(), O_WRONLY | O_CREAT | O_APPEND | O_CLOEXEC, 0600), STDERR_FILENO);
   ::execvp(arguments[0], arguments.data());
   ::_exit(127);
 }

@@ -30,8 +30,8 @@ void await(const std::string& what, Condition condition,
 void pin(bool wanted);
 bool isPinned();
 
-// Makes this process the program, found as a shell does, with its standard error at /dev/null.
-[[noreturn]] void become(const std::vector<std::string>& command);
+// Makes this process the program, found as a shell does; `log` is where its standard error goes.
+[[noreturn]] void become(const std::vector<std::string>& command, const std::string& log = "/dev/null");
 
 // A process that is gone with its owner.
 class Child {

@@ -23,16 +23,7 @@ constexpr auto idleTime = 60s;
 // Milliseconds; `start` is followed by calls to what it started until one is answered.
 double timeStart(const std::function<Service()>& start, const std::string& operation) {
   const double begin = now();
-  const Service service = start();
-  const std::string message = callMessage(service, operation);
-  await("no answer at " + service.socket, [&] {
-    try {
-      Client(service).call(message);
-      return true;
-    } catch (const std::exception&) {
-      return false;  // not yet
-    }
-  });
+  awaitAnswer(start(), operation);
   return (now() - begin) / 1000;
 }
 
@@ -86,10 +77,7 @@ void measureStarts(const std::string& programs) {
 }
 
 void measureRest(const std::string& programs) {
-  Device device(programs);
-  device.start();
-  device.client();
-  const Bus daemon(Bus::Kind::daemon, programs), broker(Bus::Kind::broker, programs);
+  const Neighbours all(programs);
   const DirectEcho echo(programs);
   struct Row {
     std::string name;
@@ -97,26 +85,27 @@ void measureRest(const std::string& programs) {
     Service service;
     const char* call;
   };
-  const std::vector<Row> all{
+  const Device& device = all.device;
+  const std::vector<Row> rows{
       {"pairwelld", device.job("pairwelld"), device.service(), "GetDistributedLoggingStatus"},
       {"hearthd", device.hearthd(), device.hearthdService(), "ListJobs"},
       {"sd-bus echo service", echo.pid(), echo.service(), "Echo"},
-      {"dbus-broker, without the echo service", broker.pid(), broker.echo(), "Echo"},
-      {"dbus-daemon", daemon.pid(), daemon.echo(), "Echo"}};
+      {"dbus-broker, without the echo service", all.broker.pid(), all.broker.echo(), "Echo"},
+      {"dbus-daemon", all.daemon.pid(), all.daemon.echo(), "Echo"}};
   Table& memory = table("memory", "Resident memory", "MiB");
   Table& connections = table("connections", "Memory of a connection", "KiB");
   Table& wakes = table("wakeups", "Wake-ups in 60 idle seconds", "");
-  for (const Row& row : all) Client(row.service).call(callMessage(row.service, row.call));
+  for (const Row& row : rows) Client(row.service).call(callMessage(row.service, row.call));
   std::this_thread::sleep_for(1s);  // the clients have just left
   std::vector<long> before;
-  for (const Row& row : all) before.push_back(wakeUps(row.pid));
+  for (const Row& row : rows) before.push_back(wakeUps(row.pid));
   std::this_thread::sleep_for(idleTime);
-  for (std::size_t index = 0; index < all.size(); ++index) {
-    const Row& row = all[index];
+  for (std::size_t index = 0; index < rows.size(); ++index) {
+    const Row& row = rows[index];
     wakes.add(row.name, "wake-ups", static_cast<double>(wakeUps(row.pid) - before[index]));
     memory.add(row.name, "idle", residentMebibytes(row.pid));
   }
-  for (const Row& row : all)
+  for (const Row& row : rows)
     connections.add(
         row.name, "KiB",
         connectionKibibytes(row.pid, row.service, callMessage(row.service, row.call), memory, row.name));

@@ -17,6 +17,7 @@
 #include "platform/linux/BusServiceListener.hpp"
 #include "platform/linux/HearthInterface.hpp"
 #include "platform/linux/HearthLink.hpp"
+#include "tests/fakes/BusMessage.hpp"
 #include "tests/fakes/RealFiles.hpp"
 #include "tests/pairwelld/World.hpp"
 
@@ -27,7 +28,7 @@ namespace {
 
 enum class Whom { refused, admitted, authenticated, root, stranger, job, hearthd, count };
 
-const std::string clientsHandshake("\0AUTH EXTERNAL\r\nDATA\r\nBEGIN\r\n", 29);
+const std::string clientsHandshake(fakes::handshakeAhead);
 const std::string hearthsHandshake = "DATA\r\nOK 0123456789abcdef0123456789abcdef\r\nERROR\r\n";
 
 struct World : pairwell::World {

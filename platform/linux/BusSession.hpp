@@ -39,9 +39,8 @@ class BusSessionHost {
 // The server's thread, but for an answer: that may be sent by the thread that has it.
 //
 // The library reads from a pipe, into which the session writes one whole message of an allowed size at a
-// time; it answers on the client's socket itself. So what the library holds is bounded, a
-// message that it drops as malformed is noticed, and nothing of a client is parsed before its handshake is
-// done.
+// time; it answers on the client's socket itself. So what the library holds is bounded, a message that it
+// drops as malformed is noticed, and nothing of a client is parsed before its handshake is done.
 class BusSession : public BusConnection {
  public:
   using TimePoint = std::chrono::steady_clock::time_point;

@@ -5,31 +5,22 @@
 #include <gtest/gtest.h>
 #include <poll.h>
 
-#include <algorithm>
 #include <bit>
 #include <cerrno>
 
 #include "platform/linux/BusServer.hpp"
+#include "tests/fakes/BusMessage.hpp"
 #include "tests/fakes/RealFiles.hpp"
 
 namespace platform::linux_ {
 
 using fakes::deadline;
 using fakes::eventually;
+using fakes::handshakeAhead;
+using fakes::number;
 using fakes::TemporaryFolder;
+using fakes::text;
 inline constexpr std::chrono::hours never{1};
-// A client's whole handshake, as libraries send it ahead.
-inline constexpr std::string_view handshakeAhead{"\0AUTH EXTERNAL\r\nDATA\r\nBEGIN\r\n", 29};
-
-// As they stand in messages.
-inline std::string number(std::uint32_t value, std::endian order = std::endian::native) {
-  std::string bytes(reinterpret_cast<const char*>(&value), sizeof value);
-  if (order != std::endian::native) std::reverse(bytes.begin(), bytes.end());
-  return bytes;
-}
-inline std::string text(const std::string& value, std::endian order = std::endian::native) {
-  return number(static_cast<std::uint32_t>(value.size()), order) + value + '\0';
-}
 inline std::string answerTo(std::uint32_t serial) { return std::string("\5\1u\0", 4) + number(serial); }
 
 // What a call is of: an object's interface, and the types of its arguments; and how its numbers stand.
@@ -41,23 +32,14 @@ struct Callee {
 // by hand: libraries refuse to make bad ones.
 inline std::string callMessage(const std::string& member, const std::string& argument,
                                std::uint32_t serial = 1, const Callee& callee = {}) {
-  const auto align = [](std::string& bytes) { bytes.resize((bytes.size() + 7) / 8 * 8); };
   std::string fields;
-  const auto add = [&](char code, char type, const std::string& value) {
-    align(fields);
-    fields += std::string{code, 1, type, 0} + value;
-  };
-  add(1, 'o', text(callee.path, callee.order));
-  add(2, 's', text(callee.interface, callee.order));
-  add(3, 's', text(member, callee.order));
-  add(8, 'g', static_cast<char>(callee.signature.size()) + callee.signature + '\0');
+  fakes::addField(fields, 1, 'o', text(callee.path, callee.order));
+  fakes::addField(fields, 2, 's', text(callee.interface, callee.order));
+  fakes::addField(fields, 3, 's', text(member, callee.order));
+  fakes::addField(fields, 8, 'g', fakes::signature(callee.signature));
   const std::size_t arguments = callee.signature.size();
   const std::string body = arguments == 0 ? "" : arguments > 1 ? argument : text(argument, callee.order);
-  std::string message{callee.order == std::endian::big ? 'B' : 'l', 1, 0, 1};
-  message += number(static_cast<std::uint32_t>(body.size()), callee.order) + number(serial, callee.order) +
-             number(static_cast<std::uint32_t>(fields.size()), callee.order) + fields;
-  align(message);
-  return message + body;
+  return fakes::busMessage(1, fields, body, serial, callee.order);
 }
 
 // A client's end. `meanwhile` runs while it waits, which fails the test at the deadline.
