@@ -63,9 +63,9 @@ class Reader : public nlohmann::json_sax<Json> {
   }
   bool end_array() override { return close(); }
   bool key(string_t& name) override {
-    if (std::get<Dictionary>(levels.back().container.storage).contains(name)) {
-      return fail("the key \"" + name + "\" twice");
-    }
+    const auto& dictionary = std::get<Dictionary>(levels.back().container.storage);
+    const bool isBehindAll = dictionary.empty() || dictionary.rbegin()->first < name;  // as they are printed
+    if (!isBehindAll && dictionary.contains(name)) return fail("the key \"" + name + "\" twice");
     levels.back().key = std::move(name);
     return true;
   }
@@ -106,7 +106,8 @@ class Reader : public nlohmann::json_sax<Json> {
     if (auto* list = std::get_if<List>(&level.container.storage)) {
       list->push_back(std::move(value));
     } else {
-      std::get<Dictionary>(level.container.storage).emplace(std::move(level.key), std::move(value));
+      auto& dictionary = std::get<Dictionary>(level.container.storage);
+      dictionary.emplace_hint(dictionary.end(), std::move(level.key), std::move(value));
     }
     return true;
   }
@@ -171,9 +172,10 @@ struct Writer {
     return json;
   }
   Json operator()(const Dictionary& dictionary) const {
-    Json json = Json::object();
-    for (const auto& [key, element] : dictionary) json[key] = toJson(element, depth + 1);
-    return json;
+    Json::object_t object;
+    for (const auto& [key, element] : dictionary)
+      object.emplace_hint(object.end(), key, toJson(element, depth + 1));
+    return object;
   }
 };
 
