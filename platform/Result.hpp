@@ -47,6 +47,9 @@ class [[nodiscard]] Result<void> {
   Result() = default;
   Result(std::error_code error) : failure(error) {}
   Result(Outcome outcome) : Result(make_error_code(outcome)) {}
+  // Of one who only wants to know whether it worked.
+  template <class T>
+  Result(const Result<T>& other) : failure(other ? std::error_code() : other.error()) {}
 
   bool has_value() const { return !failure; }
   explicit operator bool() const { return has_value(); }

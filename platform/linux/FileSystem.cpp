@@ -3,16 +3,17 @@
 namespace platform::linux_ {
 namespace {
 
-Result<void> writeNew(FileSystem& files, const std::string& path, std::string_view bytes) {
+Result<FileIdentity> writeNew(FileSystem& files, const std::string& path, std::string_view bytes) {
   auto file = files.create(path);
   if (!file && file.error() == std::errc::file_exists) {
     // Left by a writer that was cut off: the caller's lock says that nobody writes it now.
-    if (const auto removed = files.remove(path); !removed) return removed;
+    if (const auto removed = files.remove(path); !removed) return removed.error();
     file = files.create(path);
   }
   if (!file) return file.error();
-  if (const auto written = (*file)->writeAll(bytes); !written) return written;
-  return (*file)->sync();
+  if (const auto written = (*file)->writeAll(bytes); !written) return written.error();
+  if (const auto synced = (*file)->sync(); !synced) return synced.error();
+  return (*file)->identity();
 }
 
 }  // namespace
@@ -51,15 +52,16 @@ Result<std::string> moveAside(FileSystem& files, const std::string& path) {
   }
 }
 
-Result<void> replaceFile(FileSystem& files, const std::string& path, std::string_view bytes) {
+Result<FileIdentity> replaceFile(FileSystem& files, const std::string& path, std::string_view bytes) {
   const std::string temporary = path + ".new";
-  auto result = writeNew(files, temporary, bytes);
-  if (result) result = files.rename(temporary, path);
-  if (!result) {
+  const auto written = writeNew(files, temporary, bytes);
+  const auto renamed = written ? files.rename(temporary, path) : Result<void>(written.error());
+  if (!renamed) {
     static_cast<void>(files.remove(temporary));  // the first failure is the one to tell
-    return result;
+    return renamed.error();
   }
-  return files.syncFolder(folderOf(path));
+  if (const auto synced = files.syncFolder(folderOf(path)); !synced) return synced.error();
+  return written;
 }
 
 }  // namespace platform::linux_

@@ -15,6 +15,16 @@ const Logger& log() {
 
 bool isMissing(std::error_code error) { return error == std::errc::no_such_file_or_directory; }
 
+// A `problem` is damage; an error without one says that the file cannot be read.
+Result<SettingsFile::Document> readDocument(File& file, std::string& problem) {
+  const auto text = file.readAll(SettingsFile::sizeLimit);
+  if (!text && text.error() == Outcome::tooLarge)
+    problem = "larger than " + std::to_string(SettingsFile::sizeLimit) + " bytes";
+  auto decoded = text ? decodeSettings(*text, problem) : Result<Dictionary>(text.error());
+  if (!decoded) return decoded.error();
+  return std::make_shared<const Dictionary>(std::move(*decoded));
+}
+
 }  // namespace
 
 std::shared_ptr<SettingsFile> SettingsFile::create(FileSystem& files, std::string path) {
@@ -71,16 +81,16 @@ Result<void> SettingsFile::load() {
   if (!file) return file.error();
   const auto identity = (*file)->identity();
   if (!identity) return identity.error();
-  const auto text = (*file)->readAll(sizeLimit);
-  if (!text && text.error() != Outcome::tooLarge) return text.error();
-  std::string problem = "larger than " + std::to_string(sizeLimit) + " bytes";
-  auto decoded = text ? decodeSettings(*text, problem) : Result<Dictionary>(text.error());
+  std::string problem;
+  const bool isOwn = own.document && *identity == own.identity;
+  const auto loaded = isOwn ? own.document : readDocument(**file, problem);
+  if (!loaded && problem.empty()) return loaded.error();
   held = std::move(*file);
   heldIdentity = *identity;
   damageStays = false;
-  damage = decoded ? "" : problem;
-  if (decoded) {
-    document = std::make_shared<const Dictionary>(std::move(*decoded));
+  damage = problem;
+  if (loaded) {
+    document = *loaded;
     lastGoodInForce = false;
   }
   return {};
@@ -138,31 +148,37 @@ Result<void> SettingsFile::update(const std::function<bool(Dictionary& document)
   Dictionary next = *before;
   const bool differs = change(next);
   if (!differs) next = *before;
-  const auto written = differs || again ? write(next) : Result<void>();
-  finishWrite(*before, next, written.has_value());
+  const auto written = differs || again ? write(next) : Written();
+  finishWrite(*before, next, written);
   return written;
 }
 
-Result<void> SettingsFile::write(const Dictionary& next) {
+Result<SettingsFile::Written> SettingsFile::write(const Dictionary& next) {
   const auto text = encodeSettings(next);
   if (!text) return text.error();
   // What could not be read back is not written: keys, say, that are one after invalid UTF-8 has been
   // replaced.
   std::string problem;
   if (text->size() > sizeLimit) return Outcome::tooLarge;
-  if (const auto back = decodeSettings(*text, problem); !back) return back.error();
-  return replaceFile(files, path, *text);
+  auto back = decodeSettings(*text, problem);
+  if (!back) return back.error();
+  const auto identity = replaceFile(files, path, *text);
+  if (!identity) return identity.error();
+  return Written{std::make_shared<const Dictionary>(std::move(*back)), *identity};
 }
 
-void SettingsFile::finishWrite(const Dictionary& before, const Dictionary& next, bool written) {
+void SettingsFile::finishWrite(const Dictionary& before, const Dictionary& next,
+                               const Result<Written>& written) {
   bool outsideChange;
   {
     std::lock_guard lock(mutex);
     writing = false;
     unsynced = !written;
+    if (written) own = *written;
     const auto fresh = refresh();  // a failure is the next reader's to meet
+    own = {};
     if (!fresh && written) document = std::make_shared<const Dictionary>(next);
-    outsideChange = reported && recordOwnChange(before, next, written);
+    outsideChange = reported && recordOwnChange(before, next, written.has_value());
   }
   if (outsideChange) lookLater();
 }
@@ -232,12 +248,14 @@ void SettingsFile::tryToWatch() {
 
 // Compares instead of trusting events: they merge, overflow, and come for own writes, too.
 void SettingsFile::look() {
+  // The file may hold an own change that is not recorded yet. Its writer looks for others' when it is.
+  const auto isEarly = [&] { return writing || !reported; };
+  if (std::lock_guard lock(mutex); isEarly()) return;
   static_cast<void>(contents());
   Document before, after;
   {
     std::lock_guard lock(mutex);
-    // The file may hold an own change that is not recorded yet. Its writer looks for others' when it is.
-    if (writing || !reported) return;
+    if (isEarly()) return;
     before = std::exchange(reported, document);
     after = document;
   }

@@ -52,8 +52,13 @@ class SettingsFile : public std::enable_shared_from_this<SettingsFile> {
  private:
   SettingsFile(FileSystem& files, std::string path);
   Result<std::unique_ptr<FileLock>> lockForWriting();
-  Result<void> write(const Dictionary& next);
-  void finishWrite(const Dictionary& before, const Dictionary& next, bool written);
+  // What a write has left at the path, if nobody else has replaced it since.
+  struct Written {
+    Document document;
+    FileIdentity identity;
+  };
+  Result<Written> write(const Dictionary& next);
+  void finishWrite(const Dictionary& before, const Dictionary& next, const Result<Written>& written);
   void clearDamage();
   void look();
   void lookLater();
@@ -77,6 +82,7 @@ class SettingsFile : public std::enable_shared_from_this<SettingsFile> {
   std::unique_ptr<File>
       held;  // the file that `document`, or `damage`, came from; its inode is not reused meanwhile
   FileIdentity heldIdentity;
+  Written own;                   // need not be read again
   std::string damage;            // what is wrong with the held file
   bool damageStays = false;      // it could not be moved
   bool lastGoodInForce = false;  // the file is missing because it was damaged

@@ -107,6 +107,9 @@ TEST_F(SettingsFileTest, NeighboursWriteIsReadThoughItsEventsAreHeldBack) {
     ASSERT_TRUE(files.remove(path) && files.syncFolder("/var/settings"));
     EXPECT_EQ(stored(*ours), Dictionary{}) << "a missing file is an empty one";
   }
+  files.onFolderSync = [&] { files.put(path, R"({"values": {"key": 99}})"); };
+  ASSERT_TRUE(ours->setValue("key", 5));
+  EXPECT_EQ(stored(*ours), (Dictionary{{"key", 99}})) << "by who asks for no lock, right behind ours";
 }
 
 // Cuts a write at every call that it makes; then its process ends, or loses its power, or tries again.
