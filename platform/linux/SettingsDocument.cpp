@@ -18,7 +18,7 @@ const std::string valuesEntry = "values";
 // CRC-32 as zlib's: it finds every single flipped bit and every burst of up to 32, which is what a bad disk
 // does. Nobody who means harm and can write the file would be held up by a stronger one. It is taken of the
 // contents as they print on one line with sorted keys, so that a person may lay the file out anew.
-constexpr auto checksumSteps = [] {
+constexpr std::array<std::uint32_t, 256> stepsOfChecksum() {
   std::array<std::uint32_t, 256> steps{};
   for (std::uint32_t byte = 0; byte < steps.size(); ++byte) {
     std::uint32_t sum = byte;
@@ -26,12 +26,13 @@ constexpr auto checksumSteps = [] {
     steps[byte] = sum;
   }
   return steps;
-}();
+}
 
 std::string checksumOf(std::string_view canonical) {
+  static constexpr auto steps = stepsOfChecksum();
   std::uint32_t sum = 0xFFFFFFFF;
   for (const char character : canonical)
-    sum = (sum >> 8) ^ checksumSteps[(sum ^ static_cast<unsigned char>(character)) & 0xFF];
+    sum = (sum >> 8) ^ steps[(sum ^ static_cast<unsigned char>(character)) & 0xFF];
   char text[9];
   std::snprintf(text, sizeof text, "%08x", static_cast<unsigned>(~sum));
   return text;
