@@ -76,6 +76,8 @@ std::string replyMessage() {
 
 Client::Client(const Service& service) : socket(fakes::socketAt(service.socket, ::connect)) {
   if (!socket) throw std::runtime_error("nobody at " + service.socket);
+  constexpr timeval patience{60, 0};
+  ::setsockopt(socket.get(), SOL_SOCKET, SO_RCVTIMEO, &patience, sizeof patience);
   if (service.isBare) return;
   send(std::string(fakes::handshakeAhead));
   std::string answers;
@@ -99,7 +101,7 @@ void Client::send(const std::string& message) const {
 std::size_t Client::receive(Kind kind) {
   char buffer[16 * 1024];
   const ssize_t got = ::recv(socket.get(), buffer, sizeof buffer, 0);
-  if (got <= 0) throw std::runtime_error("a connection has ended");
+  if (got <= 0) throw std::runtime_error(got == 0 ? "a connection has ended" : "no answer for a minute");
   pending.append(buffer, static_cast<std::size_t>(got));
   std::size_t found = 0, used = 0;
   while (const std::size_t size = sizeOfFirst(std::string_view(pending).substr(used))) {
@@ -118,12 +120,14 @@ void Client::call(const std::string& message) {
 
 void awaitAnswer(const Service& service, const std::string& operation) {
   const std::string message = callMessage(service, operation);
-  await("no answer at " + service.socket, [&] {
+  std::string problem = "no answer at " + service.socket;
+  await(problem, [&] {
     try {
       Client(service).call(message);
       return true;
-    } catch (const std::exception&) {
-      return false;  // not yet
+    } catch (const std::exception& error) {
+      problem = error.what();  // not yet
+      return false;
     }
   });
 }

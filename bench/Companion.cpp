@@ -1,6 +1,7 @@
 #include "bench/Companion.hpp"
 
 #include <fcntl.h>
+#include <poll.h>
 #include <unistd.h>
 
 #include <stdexcept>
@@ -24,6 +25,7 @@ Companion::Companion(const std::function<void()>& body)
       }),
       orders(::fdopen(toward[1], "w")),
       moments(::fdopen(back[0], "r")) {
+  std::setvbuf(moments.get(), nullptr, _IONBF, 0);  // moment() waits for what is in the pipe
   ::close(toward[0]);
   ::close(back[1]);
   moment();
@@ -37,9 +39,11 @@ void Companion::goOn() {
 }
 
 double Companion::moment() {
-  double said = 0;
-  if (std::fscanf(moments.get(), "%lf", &said) != 1) throw std::runtime_error("a companion says nothing");
-  return said;
+  pollfd there{::fileno(moments.get()), POLLIN, 0};
+  if (::poll(&there, 1, 60'000) <= 0) throw std::runtime_error("a companion says nothing for a minute");
+  char line[64];
+  if (!std::fgets(line, sizeof line, moments.get())) throw std::runtime_error("a companion has ended");
+  return std::stod(line);
 }
 
 }  // namespace bench

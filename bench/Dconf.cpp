@@ -53,7 +53,7 @@ int main(int count, char** arguments) {
   DConfClient* client = dconf_client_new();
   const std::string action = count > 1 ? arguments[1] : "";
   if (action == "write" && count == 3) {
-    write(client, std::atoi(arguments[2]));
+    write(client, std::stoi(arguments[2]));
   } else if (action == "watch" && count == 2) {
     watch(client);
   } else {

@@ -7,7 +7,10 @@
 #include <sys/wait.h>
 #include <unistd.h>
 
+#include <cerrno>
+#include <cstdio>
 #include <cstdlib>
+#include <cstring>
 #include <filesystem>
 #include <fstream>
 #include <iterator>
@@ -45,10 +48,13 @@ bool isPinned() { return pinned; }
 
 void become(const std::vector<std::string>& command, const std::string& log) {
   std::vector<char*> arguments;
+  arguments.reserve(command.size() + 1);
   for (const auto& each : command) arguments.push_back(const_cast<char*>(each.c_str()));
   arguments.push_back(nullptr);
+  const int complaints = ::fcntl(STDERR_FILENO, F_DUPFD_CLOEXEC, 0);
   ::dup2(::open(log.c_str(), O_WRONLY | O_CREAT | O_APPEND | O_CLOEXEC, 0600), STDERR_FILENO);
   ::execvp(arguments[0], arguments.data());
+  ::dprintf(complaints, "%s: %s\n", arguments[0], std::strerror(errno));
   ::_exit(127);
 }
 
@@ -56,8 +62,10 @@ Child::Child(const std::function<void()>& body) : process(::fork()) {
   if (process < 0) throw std::runtime_error("fork");
   if (process > 0) return;
   ::prctl(PR_SET_PDEATHSIG, SIGKILL);
-  if (pinned) keepTo(1);
-  body();
+  [&]() noexcept {  // what fails here must not take away what is the parent's
+    if (pinned) keepTo(1);
+    body();
+  }();
   ::_exit(0);
 }
 

@@ -15,7 +15,7 @@
 
 namespace bench {
 
-// `what` is the complaint if it takes too long.
+// `what` is the complaint if it takes too long, as it is by then.
 template <class Condition>
 void await(const std::string& what, Condition condition,
            std::chrono::seconds limit = std::chrono::seconds(60)) {
