@@ -57,7 +57,7 @@ void setConditions() {
   const std::string folder = std::filesystem::temp_directory_path();
   ::statfs(folder.c_str(), &files);
   setCondition("files in memory", files.f_type == TMPFS_MAGIC);  // then nothing waits for a disk
-  setCondition("log", "default level, a line a read or switch, to a file there");
+  setCondition("log", "default level, to a file there");
 }
 
 bool isSubject(const std::string& name) {
@@ -78,6 +78,7 @@ void run(const std::string& programs, const std::string& folder, const std::vect
     if (!isSubject(name)) throw std::runtime_error(name + " is nothing that can be measured");
   }
   allowDescriptors();
+  ::unsetenv("HEARTH_LOG_LEVEL");
   setConditions();
   const double begin = now();
   for (const Subject& subject : subjects) {
@@ -89,9 +90,6 @@ void run(const std::string& programs, const std::string& folder, const std::vect
 }
 
 }  // namespace
-
-std::string named(const std::string& name) { return name + (isPinned() ? "-pinned" : ""); }
-std::string titled(const std::string& title) { return title + (isPinned() ? ", pinned" : ""); }
 
 }  // namespace bench
 

@@ -1,6 +1,8 @@
 // Clients that call: how long they wait, how many calls are served, what a connection costs first, and posts.
 #include <sys/epoll.h>
 
+#include <algorithm>
+#include <map>
 #include <memory>
 #include <stdexcept>
 #include <vector>
@@ -15,8 +17,8 @@
 namespace bench {
 namespace {
 
-const std::string status = "status", name = "given name", bare = "bare socket",
-                  bareHop = "bare socket, with a hop", direct = "sd-bus echo service",
+const std::string status = "status", withoutLog = "status, without the log's line", name = "given name",
+                  bare = "bare socket", bareHop = "bare socket, with a hop", direct = "sd-bus echo service",
                   behindDaemon = "echo behind dbus-daemon", behindBroker = "echo behind dbus-broker";
 
 // Who is called, and with what.
@@ -28,10 +30,14 @@ struct Target {
 
 // All that is called.
 struct Field : Neighbours {
-  explicit Field(const std::string& programs) : Neighbours(programs), echo(programs) {
+  explicit Field(const std::string& programs) : Neighbours(programs), silent(programs), echo(programs) {
+    const Variable level("HEARTH_LOG_LEVEL", "error");
+    silent.start();
+    awaitAnswer(silent.service(), "GetCurrentUserGivenName");
     const Service own = device.service();
     targets = {{status, own, callMessage(own, "GetDistributedLoggingStatus")},
                {name, own, callMessage(own, "GetCurrentUserGivenName")}};
+    targets.push_back({withoutLog, silent.service(), targets.front().message});
     const std::size_t bytes = targets.front().message.size();
     inPlace = std::make_unique<BareServer>(BareServer::Answers::inPlace, bytes);
     afterHop = std::make_unique<BareServer>(BareServer::Answers::afterHop, bytes);
@@ -46,6 +52,10 @@ struct Field : Neighbours {
     targets.push_back({row, service, callMessage(service, "Echo")});
   }
 
+  // In each round another one follows the last of the round before.
+  void rotate() { std::rotate(targets.begin(), targets.begin() + 1, targets.end()); }
+
+  Device silent;
   DirectEcho echo;
   std::unique_ptr<BareServer> inPlace, afterHop;
   std::vector<Target> targets;
@@ -116,17 +126,17 @@ std::vector<double> timePosts(const Channel& channel, std::size_t subscribers) {
 
 void measureReads(const std::string& programs) {
   Field field(programs);
-  Table& reads = table(named("reads"), titled("One call by one client"), "µs");
+  Table& reads = table("reads", "One call by one client", "µs");
   for (int round = 0; round < rounds; ++round) {
     for (const Target& target : field.targets) {
       Client client(target.service);
       reads.add(target.row, percentiles(times(5'000, [&](std::size_t) { client.call(target.message); })));
     }
+    field.rotate();
   }
   reads.compare(status, "p50", behindBroker, 0.8);
   reads.compare(status, "p50", bareHop, 2);
   reads.compare(name, "p50", behindBroker, 0.5);
-  reads.compare(name, "p50", bare);
   reads.compare(name, "p50", direct);
   reads.compare(status, "p99", behindBroker);
   reads.compare(name, "p99", behindBroker);
@@ -135,25 +145,39 @@ void measureReads(const std::string& programs) {
 
 void measureRates(const std::string& programs) {
   Field field(programs);
-  Table& rates = table(named("rates"), titled("Calls a second, by clients"), "1/s", Better::more);
+  Table& rates = table("rates", "Calls a second, by clients", "1/s", Better::more);
+  Table& kept =
+      table("rates-kept", "Calls a second of 512 clients, as a part of those of 64", "", Better::more);
   for (int round = 0; round < rounds; ++round) {
+    std::map<std::string, double> before;
     for (const std::size_t clients : {1, 8, 64, 512}) {
-      for (const Target& target : field.targets)
-        rates.add(target.row, std::to_string(clients), callsPerSecond(target, clients));
+      for (const Target& target : field.targets) {
+        const double rate = callsPerSecond(target, clients);
+        rates.add(target.row, std::to_string(clients), rate);
+        if (clients == 512) kept.add(target.row, "part", rate / before.at(target.row));
+        before[target.row] = rate;
+      }
     }
+    field.rotate();
   }
   rates.compare(status, "8", behindBroker, 1.3);
   rates.compare(status, "64", behindBroker, 1.7);
   rates.compare(name, "8", behindBroker, 2);
   rates.compare(name, "64", behindBroker, 2);
-  for (const auto& row : {status, name}) rates.compare(row, "512", behindBroker);
+  rates.compare(withoutLog, "64", behindBroker);
+  for (const auto& row : {status, name}) {
+    rates.compare(row, "512", behindBroker);
+    kept.watch(row, "part", 1);
+    kept.compare(row, "part", behindBroker);
+  }
   rates.print();
+  kept.print();
 }
 
 // On a bus the first answer is the one to Hello, in Client's constructor.
 void measureConnects(const std::string& programs) {
   Field field(programs);
-  Table& connects = table(named("connects"), titled("Connect and first answer"), "µs");
+  Table& connects = table("connects", "Connect and first answer", "µs");
   for (int round = 0; round < rounds; ++round) {
     for (const Target& target : field.targets) {
       const bool isBus = !target.service.destination.empty();
@@ -163,6 +187,7 @@ void measureConnects(const std::string& programs) {
                      if (!isBus) client.call(target.message);
                    })));
     }
+    field.rotate();
   }
   for (const char* bus : {"dbus-daemon", "dbus-broker"}) connects.compare(status, "p50", bus, 1);
   connects.compare(status, "p50", direct);
@@ -181,8 +206,7 @@ void measurePosts(const std::string& programs) {
     channels.push_back({row, there, callMessage(there, "AddMatch", {"type='signal',interface='x.Echo'"}),
                         signalMessage(bus->echo(), "Changed")});
   }
-  Table& posts =
-      table(named("posts"), titled("A post until every subscriber has it, p50 by subscribers"), "µs");
+  Table& posts = table("posts", "A post until every subscriber has it, p50 by subscribers", "µs");
   const auto sizes = {1, 8, 64, 512};
   for (int round = 0; round < rounds; ++round) {
     for (const int subscribers : sizes) {

@@ -1,8 +1,10 @@
 // What the same work costs as there is more of everything else.
 #include <cstdint>
+#include <deque>
 #include <filesystem>
 #include <fstream>
 #include <memory>
+#include <stdexcept>
 #include <string>
 #include <vector>
 
@@ -26,8 +28,6 @@ using platform::linux_::LinuxFileSystem;
 
 constexpr int sizes[] = {10, 100, 1000, 10'000};
 
-double median(const std::vector<double>& times) { return percentiles(times).p50; }
-
 // Other connections are there, and idle.
 void growConnections(const std::string& programs) {
   const Neighbours neighbours(programs);
@@ -36,27 +36,24 @@ void growConnections(const std::string& programs) {
     std::string name;
     Service service;
     const char* operation;
-    std::vector<std::unique_ptr<Client>> idle = {};
   };
-  std::vector<Row> all;
-  all.push_back({ours, neighbours.device.service(), "GetDistributedLoggingStatus"});
-  all.push_back({"echo behind dbus-daemon", neighbours.daemon.echo(), "Echo"});
-  all.push_back({behindBroker, neighbours.broker.echo(), "Echo"});
+  const Row all[] = {{ours, neighbours.device.service(), "GetDistributedLoggingStatus"},
+                     {"echo behind dbus-daemon", neighbours.daemon.echo(), "Echo"},
+                     {behindBroker, neighbours.broker.echo(), "Echo"}};
   Table& reads = table("growth-connections", "A call beside idle connections, p50 by connections", "µs");
-  for (const std::size_t size : {1, 10, 100, 1000}) {
-    for (Row& row : all) {
-      while (row.idle.size() + 1 < size) row.idle.push_back(std::make_unique<Client>(row.service));
-    }
-    for (int round = 0; round < rounds; ++round) {
+  for (int round = 0; round < rounds; ++round) {
+    for (const std::size_t size : {1, 10, 100, 1000}) {
       for (const Row& row : all) {
+        std::vector<std::unique_ptr<Client>> idle;
+        while (idle.size() + 1 < size) idle.push_back(std::make_unique<Client>(row.service));
         const std::string message = callMessage(row.service, row.operation);
         Client client(row.service);
-        reads.add(row.name, std::to_string(size),
-                  median(times(3'000, [&](std::size_t) { client.call(message); })));
+        const auto waits = times(3'000, [&](std::size_t) { client.call(message); });
+        reads.add(row.name, std::to_string(size), percentiles(waits).p50);
       }
     }
-    reads.compare(ours, std::to_string(size), behindBroker);
   }
+  for (const char* size : {"1", "10", "100", "1000"}) reads.compare(ours, size, behindBroker);
   reads.print();
 }
 
@@ -72,58 +69,89 @@ void fill(LinuxFileSystem& files, const std::string& path, int keys) {
   if (!filled) throw std::runtime_error("a store cannot be filled: " + filled.error().message());
 }
 
+// Of both, the same number of keys.
+struct Stores {
+  Stores(const std::string& programs, LinuxFileSystem& files, const std::string& folder, int keys)
+      : column(std::to_string(keys)), path(folder + "/" + column + ".json"), dconf(programs, keys) {
+    fill(files, path, keys);
+    own = platform::linux_::FileUserPreferences::create(files, nullptr, path);
+  }
+  const std::string column, path;
+  Dconf dconf;
+  std::shared_ptr<platform::linux_::FileUserPreferences> own;
+};
+
 void growStores(const std::string& programs) {
+  constexpr std::size_t writesOfARound = 20;
   const fakes::TemporaryFolder folder;
   LinuxFileSystem files{nullptr};
-  const std::string ours = "user preferences", bare = "bare calls of a file of that size";
+  const std::string ours = "user preferences", bare = "bare calls of a file of that size",
+                    peer = "dconf, not durable";
   Table& writes = table("growth-writes", "A write to a store, p50 by keys", "µs");
   Table& reads = table("growth-reads", "A read of a store, p50 by keys", "µs");
-  for (const int size : sizes) {
-    const std::string column = std::to_string(size), path = folder.path + "/" + column + ".json";
-    fill(files, path, size);
-    const auto store = platform::linux_::FileUserPreferences::create(files, nullptr, path);
-    Dconf dconf(programs, size);
-    std::int64_t value = 0;
-    for (int round = 0; round < rounds; ++round) {
-      writes.add(ours, column, median(times(40, [&](std::size_t) { store->setValue(++value, "key0"); })));
-      writes.add(bare, column, median(bareDurableWrites(folder.path, 40, 1, fs::file_size(path))));
+  std::deque<Stores> all;
+  for (const int size : sizes) all.emplace_back(programs, files, folder.path, size);
+  std::int64_t value = 0;
+  for (int round = 0; round < rounds; ++round) {
+    for (Stores& stores : all) {
+      const auto add = [&](Table& table, const std::string& row, const std::vector<double>& waits) {
+        table.add(row, stores.column, percentiles(waits).p50);
+      };
+      add(writes, ours, times(writesOfARound, [&](std::size_t) { stores.own->setValue(++value, "key0"); }));
+      add(writes, bare, bareDurableWrites(folder.path, writesOfARound, 1, fs::file_size(stores.path)));
       std::vector<double> waits;
-      for (int count = 0; count < 40; ++count) waits.push_back(dconf.write().returned);
-      writes.add("dconf, not durable", column, median(waits));
-      reads.add(ours, column, median(times(2'000, [&](std::size_t) { store->doubleForKey("key5"); })));
+      while (waits.size() < writesOfARound) waits.push_back(stores.dconf.write().returned);
+      add(writes, peer, waits);
+      add(reads, ours, times(2'000, [&](std::size_t) { stores.own->doubleForKey("key5"); }));
     }
-    writes.compare(ours, column, bare);
-    reads.watch(ours, column);
+  }
+  for (const Stores& stores : all) {
+    writes.compare(ours, stores.column, bare);
+    writes.compare(ours, stores.column, peer);
+    reads.watch(ours, stores.column);
   }
   writes.print();
   reads.print();
 }
 
-void growAlarms(const std::string& programs) {
-  const std::string stream(platform::EventStreams::alarms), bare = "bare calls of a file of that size";
-  constexpr std::int64_t future = 4'000'000'000'000'000'000;
-  Table& alarms = table("growth-alarms", "One alarm more, durably, p50 by alarms", "µs");
-  for (const int size : sizes) {
-    Device device(programs);
+// A device whose alarms are there before it starts.
+struct Alarmed {
+  Alarmed(const std::string& programs, int alarms) : column(std::to_string(alarms)), device(programs) {
     hearth::Alarms stored;
-    for (int number = 0; number < size; ++number)
+    for (int number = 0; number < alarms; ++number)
       stored.set({"com.kestrel.pairwelld", stream, "bench" + std::to_string(number)}, {future});
-    const std::string path = device.paths().alarms(), column = std::to_string(size);
-    fs::create_directories(fs::path(path).parent_path());
-    std::ofstream(path) << *platform::linux_::printJson(stored.toValue(),
-                                                        platform::linux_::JsonStyle::indented);
+    fs::create_directories(fs::path(device.paths().alarms()).parent_path());
+    std::ofstream(device.paths().alarms())
+        << *platform::linux_::printJson(stored.toValue(), platform::linux_::JsonStyle::indented);
     device.start();
     device.client();
-    Client client(device.hearthdService());
-    std::int64_t date = future;
-    for (int round = 0; round < rounds; ++round) {
-      alarms.add("hearthd", column, median(times(40, [&](std::size_t) {
-                   client.call(callMessage(device.hearthdService(), "SetEvent", {stream, "bench0", --date}));
-                 })));
-      alarms.add(bare, column, median(bareDurableWrites(device.paths().var, 40, 1, fs::file_size(path))));
-    }
-    alarms.compare("hearthd", column, bare);
   }
+  static constexpr std::int64_t future = 4'000'000'000'000'000'000;
+  static inline const std::string stream{platform::EventStreams::alarms};
+  const std::string column;
+  Device device;
+};
+
+void growAlarms(const std::string& programs) {
+  const std::string ours = "hearthd", bare = "bare calls of a file of that size";
+  Table& alarms = table("growth-alarms", "An alarm set to another date, p50 by alarms", "µs");
+  std::deque<Alarmed> all;
+  for (const int size : sizes) all.emplace_back(programs, size);
+  std::int64_t date = Alarmed::future;
+  for (int round = 0; round < rounds; ++round) {
+    for (Alarmed& alarmed : all) {
+      const Service service = alarmed.device.hearthdService();
+      Client client(service);
+      const auto waits = times(40, [&](std::size_t) {
+        client.call(callMessage(service, "SetEvent", {Alarmed::stream, "bench0", --date}));
+      });
+      alarms.add(ours, alarmed.column, percentiles(waits).p50);
+      const auto size = fs::file_size(alarmed.device.paths().alarms());
+      alarms.add(bare, alarmed.column,
+                 percentiles(bareDurableWrites(alarmed.device.paths().var, 40, 1, size)).p50);
+    }
+  }
+  for (const Alarmed& alarmed : all) alarms.compare(ours, alarmed.column, bare);
   alarms.print();
 }
 
@@ -141,6 +169,7 @@ void growAccount(const std::string& programs) {
                                   std::chrono::system_clock::now().time_since_epoch(), problem);
     if (document) entries = document->entries;
   }
+  if (entries.empty()) throw std::runtime_error("no device has published: " + problem);
   int devices = 2;
   for (const int size : {2, 10, 100, 1000}) {
     for (; devices < size; ++devices) {
@@ -150,7 +179,7 @@ void growAccount(const std::string& programs) {
     }
     account.timeSwitches(20);
     for (int round = 0; round < rounds; ++round)
-      switches.add("through a folder", std::to_string(size), median(account.timeSwitches(40)));
+      switches.add("through a folder", std::to_string(size), percentiles(account.timeSwitches(40)).p50);
     switches.watch("through a folder", std::to_string(size));
   }
   switches.print();

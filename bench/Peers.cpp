@@ -158,10 +158,18 @@ Bus::Bus(Kind kind, const std::string& programs)
 
 Bus::~Bus() { sd_bus_close_unref(controller); }
 
+std::vector<std::string> Bus::environment() const {
+  return {"env", "XDG_CONFIG_HOME=" + folder.path, "XDG_RUNTIME_DIR=" + folder.path,
+          "DBUS_SESSION_BUS_ADDRESS=" + address()};
+}
+
 Child Bus::startDaemon() {
   const std::string path = folder.path + "/bus.conf";
   std::ofstream(path) << daemonConfiguration << "<listen>" << address() << "</listen></busconfig>\n";
-  Child started({"dbus-daemon", "--nofork", "--config-file=" + path});
+  std::vector<std::string> command = environment();
+  for (const auto& word : {std::string("dbus-daemon"), std::string("--nofork"), "--config-file=" + path})
+    command.push_back(word);
+  Child started(command);
   await("dbus-daemon does not start", [&] { return isServed(_echo.socket); });
   return started;
 }
@@ -201,12 +209,16 @@ Neighbours::Neighbours(const std::string& programs)
 }
 
 Dconf::Dconf(const std::string& programs, int keys)
-    : settings("XDG_CONFIG_HOME", folder.path),
-      runtime("XDG_RUNTIME_DIR", folder.path),
-      bus(Bus::Kind::daemon, programs),
-      address("DBUS_SESSION_BUS_ADDRESS", bus.address()),
-      watcher({programs + "/pairwell_dconf", "watch"}),
-      writer({programs + "/pairwell_dconf", "write", std::to_string(keys)}) {}
+    : bus(Bus::Kind::daemon, programs),
+      watcher(start(programs, {"watch"})),
+      writer(start(programs, {"write", std::to_string(keys)})) {}
+
+Companion Dconf::start(const std::string& programs, const std::vector<std::string>& arguments) const {
+  std::vector<std::string> command = bus.environment();
+  command.push_back(programs + "/pairwell_dconf");
+  command.insert(command.end(), arguments.begin(), arguments.end());
+  return Companion(command);
+}
 
 Dconf::Times Dconf::write() {
   writer.goOn();

@@ -52,6 +52,8 @@ class Bus {
 
   const Service& echo() const { return _echo; }
   std::string address() const { return "unix:path=" + _echo.socket; }
+  // What runs a program as one of the bus's desktop.
+  std::vector<std::string> environment() const;
   pid_t pid() const { return process.pid(); }
 
  private:
@@ -73,7 +75,8 @@ struct Neighbours {
   Bus daemon, broker;
 };
 
-// A settings service that desktops use, on a bus of its own; its writes do not wait for the disk.
+// A settings service that desktops use, on a bus of its own; its writes do not wait for the disk (no fsync in
+// a trace of its service).
 class Dconf {
  public:
   Dconf(const std::string& programs, int keys);
@@ -85,10 +88,9 @@ class Dconf {
   Times write();
 
  private:
-  const fakes::TemporaryFolder folder;
-  const Variable settings, runtime;
+  Companion start(const std::string& programs, const std::vector<std::string>& arguments) const;
+
   const Bus bus;
-  const Variable address;
   Companion watcher, writer;
 };
 

@@ -5,11 +5,13 @@
 #include <fstream>
 #include <functional>
 #include <iterator>
+#include <limits>
 #include <memory>
 #include <sstream>
 #include <stdexcept>
 #include <utility>
 
+#include "bench/Process.hpp"
 #include "platform/linux/Json.hpp"
 
 namespace bench {
@@ -103,10 +105,11 @@ void report(const std::string& what, const std::vector<double>& figures, const c
   loose.emplace(what, Dictionary{{"each", listOf(figures)}, {"unit", unit}});
 }
 
-Table::Table(std::string title_, std::string unit_, Better better_)
-    : title(std::move(title_)), unit(std::move(unit_)), better(better_) {}
+Table::Table(std::string name_, std::string title_, std::string unit_, Better better_)
+    : name(std::move(name_)), title(std::move(title_)), unit(std::move(unit_)), better(better_) {}
 
 void Table::add(const std::string& row, const std::string& column, double figure) {
+  std::fputc('.', stderr);  // for who waits
   remember(rows, row);
   remember(columns, column);
   cells[row][column].push_back(figure);
@@ -148,7 +151,7 @@ std::string Table::label(const Comparison& comparison) const {
 }
 
 void Table::print() const {
-  std::string text = "\n### " + title + ", " + unit + "\n\n|";
+  std::string text = "\n**" + title + "**" + (unit.empty() ? "" : ", in " + unit) + ":\n\n|";
   for (const auto& column : columns) text += " | " + column;
   text += " |\n|---|";
   for (std::size_t count = 0; count < columns.size(); ++count) text += "---|";
@@ -159,8 +162,10 @@ void Table::print() const {
       text += (rounds ? " " + shown(*rounds) : "") + " |";
     }
   }
-  if (!watched.empty()) text += "\n\n| compared | | aim | |\n|---|---|---|---|";
+  bool isFirst = true;
   for (const Comparison& comparison : watched) {
+    if (comparison.peer.empty() && !comparison.aim) continue;  // the table has it
+    if (std::exchange(isFirst, false)) text += "\n\n| compared | | aim | |\n|---|---|---|---|";
     const Rounds rounds = compared(comparison);
     const double median = spread(rounds).median;
     const auto& aim = comparison.aim;
@@ -169,7 +174,7 @@ void Table::print() const {
     if (aim) text += (better == Better::less ? "≤ " : "≥ ") + shown(*aim);
     text += std::string(" | ") + (aim ? isMet ? "met" : "**missed**" : "") + " |";
   }
-  std::printf("%s\n", text.c_str());
+  std::printf("%s\n\n![%s](performance/%s.svg)\n", text.c_str(), title.c_str(), name.c_str());
   std::fflush(stdout);
 }
 
@@ -195,14 +200,20 @@ Dictionary Table::comparisons() const {
 std::string Table::drawing() const {
   const bool isCurve = std::all_of(columns.begin(), columns.end(), isNumber);
   const auto quoted = [](const std::string& text) { return "\"" + text + "\""; };
-  bool isPositive = true;  // a scale of powers has no place for 0
-  for (const auto& row : rows)
-    for (const auto& column : columns)
-      isPositive = isPositive && (!cell(row, column) || spread(*cell(row, column)).median > 0);
+  double least = std::numeric_limits<double>::infinity(), most = 0;
+  for (const auto& row : rows) {
+    for (const auto& column : columns) {
+      if (!cell(row, column)) continue;
+      least = std::min(least, spread(*cell(row, column)).median);
+      most = std::max(most, spread(*cell(row, column)).median);
+    }
+  }
+  // A scale of powers has no place for 0, and bars on one have no length that says anything.
+  const bool isOfPowers = least > 0 && (isCurve || most / least > 100);
   std::ostringstream text;
   text << "set terminal svg size 760,420 font 'sans-serif,12' background '#ffffff'\nset title "
        << quoted(title) << "\nset ylabel " << quoted(unit)
-       << (isPositive ? "\nset logscale y" : "\nset yrange [0:1<*]")
+       << (isOfPowers ? "\nset logscale y" : "\nset yrange [0:1<*]")
        << "\nset grid ytics lc rgb '#dddddd'\nset border 3\n"
           "set key outside bottom center horizontal\n";
   if (isCurve) {
@@ -217,8 +228,8 @@ std::string Table::drawing() const {
   const auto& across = isCurve ? rows : columns;
   for (const auto& line : down) {
     text << (isCurve ? line : quoted(line));
-    for (const auto& name : across) {
-      const Rounds* rounds = isCurve ? cell(name, line) : cell(line, name);
+    for (const auto& each : across) {
+      const Rounds* rounds = isCurve ? cell(each, line) : cell(line, each);
       text << ' ' << (rounds ? std::to_string(spread(*rounds).median) : "NaN");
     }
     text << '\n';
@@ -235,10 +246,12 @@ std::string Table::drawing() const {
 }
 
 Table& table(const std::string& name, const std::string& title, const std::string& unit, Better better) {
+  const std::string own = name + (isPinned() ? "-pinned" : "");
   for (const auto& [known, made] : tables) {
-    if (known == name) return *made;
+    if (known == own) return *made;
   }
-  tables.emplace_back(name, std::make_unique<Table>(title, unit, better));
+  const std::string full = title + (isPinned() ? ", pinned" : "");
+  tables.emplace_back(own, std::make_unique<Table>(own, full, unit, better));
   return *tables.back().second;
 }
 
@@ -263,12 +276,15 @@ void writeReport(const std::string& folder, const std::string& name) {
 
 void compareReports(const std::string& before, const std::string& after) {
   const Dictionary old = comparisonsIn(before), now = comparisonsIn(after);
-  std::size_t worse = 0, alike = 0;
+  std::size_t worse = 0, alike = 0, others = 0;
   for (const auto& [label, value] : now) {
     const auto* found = platform::find<Dictionary>(old, label);
-    if (!found) continue;
-    const auto earlier = roundsOf(*found), later = roundsOf(*value.as<Dictionary>());
-    if (earlier.size() < 3 || later.size() < 3) continue;  // nothing is known of their noise
+    const auto earlier = found ? roundsOf(*found) : std::vector<double>();
+    const auto later = roundsOf(*value.as<Dictionary>());
+    if (earlier.size() < 3 || later.size() < 3) {  // nothing is known of their noise
+      ++others;
+      continue;
+    }
     const Spread was = spread(earlier), is = spread(later);
     const auto* lessIsBetter = platform::find<bool>(*found, "lessIsBetter");
     const bool isWorse = lessIsBetter && *lessIsBetter ? is.least > was.most : is.most < was.least;
@@ -276,8 +292,7 @@ void compareReports(const std::string& before, const std::string& after) {
     if (isWorse)
       std::printf("worse: %s: %s, was %s\n", label.c_str(), shown(later).c_str(), shown(earlier).c_str());
   }
-  std::printf("%zu worse than the noise, %zu not, %zu of %zu and %zu not compared\n", worse, alike,
-              std::max(old.size(), now.size()) - worse - alike, old.size(), now.size());
+  std::printf("%zu worse than the noise, %zu not; %zu without rounds in both files\n", worse, alike, others);
 }
 
 }  // namespace bench

@@ -27,7 +27,7 @@ enum class Better { less, more };
 // one of neighbours in time.
 class Table {
  public:
-  Table(std::string title, std::string unit, Better better);
+  Table(std::string name, std::string title, std::string unit, Better better);
 
   // One round's figure.
   void add(const std::string& row, const std::string& column, double figure);
@@ -37,7 +37,8 @@ class Table {
                std::optional<double> aim = std::nullopt);
   // The same of ours alone.
   void watch(const std::string& row, const std::string& column, std::optional<double> aim = std::nullopt);
-  // As Markdown: of each cell the median of its rounds, its least and its most; then what is compared.
+  // As Markdown: of each cell the median of its rounds, its least and its most; then what is compared with
+  // others or an aim, and the picture.
   void print() const;
 
   platform::Dictionary figures() const;
@@ -57,14 +58,14 @@ class Table {
   std::string label(const Comparison& comparison) const;
   const Rounds* cell(const std::string& row, const std::string& column) const;
 
-  const std::string title, unit;
+  const std::string name, title, unit;
   const Better better;
   std::vector<std::string> rows, columns;  // in the order of their first figures
   std::map<std::string, std::map<std::string, Rounds>> cells;
   std::vector<Comparison> watched;
 };
 
-// Made at the first call; `name` is its files'.
+// Made at the first call; `name` is its picture's. While everything is pinned, both say so.
 Table& table(const std::string& name, const std::string& title, const std::string& unit,
              Better better = Better::less);
 

@@ -3,6 +3,7 @@
 #include <functional>
 #include <memory>
 #include <optional>
+#include <stdexcept>
 #include <string>
 #include <thread>
 #include <utility>
@@ -98,11 +99,14 @@ void measureRest(const std::string& programs) {
   for (const Row& row : rows) Client(row.service).call(callMessage(row.service, row.call));
   std::this_thread::sleep_for(1s);  // the clients have just left
   std::vector<long> before;
+  before.reserve(rows.size());
   for (const Row& row : rows) before.push_back(wakeUps(row.pid));
   std::this_thread::sleep_for(idleTime);
   for (std::size_t index = 0; index < rows.size(); ++index) {
     const Row& row = rows[index];
-    wakes.add(row.name, "wake-ups", static_cast<double>(wakeUps(row.pid) - before[index]));
+    const long woken = wakeUps(row.pid) - before[index];
+    if (woken < 0) throw std::runtime_error(row.name + ": a thread has ended, and its wake-ups with it");
+    wakes.add(row.name, "wake-ups", static_cast<double>(woken));
     memory.add(row.name, "idle", residentMebibytes(row.pid));
   }
   for (const Row& row : rows)

@@ -23,8 +23,4 @@ void measureRest(const std::string& programs);
 void measureGrowth(const std::string& programs);
 void measureAccounts(const std::string& programs);
 
-// The name and the title of a table, which say so when everything is pinned.
-std::string named(const std::string& name);
-std::string titled(const std::string& title);
-
 }  // namespace bench
