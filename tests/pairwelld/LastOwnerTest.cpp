@@ -1,7 +1,6 @@
 // The last owner of an object goes inside a delivery to it.
 #include "pairwelld/TarnNotificationHelper.hpp"
 #include "pairwelld/notifications/TarnNotificationManager.hpp"
-#include "pairwelld/service/ConduitListener.hpp"
 #include "tests/pairwelld/World.hpp"
 
 namespace pairwell {
@@ -89,21 +88,6 @@ TEST_F(LastOwnerTest, OfAHelperOnEitherRoute) {
       platform.streams.deliver("com.kestrel.tidingsd.matching", {{"Name", "a"}});
     });
   }
-}
-
-TEST_F(LastOwnerTest, OfAConnectionAndSoOfItsListener) {
-  auto listener = ConduitListener::create();
-  listener->activate();
-  run();
-  auto client = offerClient(7);
-  const auto release = [&] {
-    platform.listeners[0]->clients.clear();
-    client->end();
-    const auto queue = std::exchange(listener, nullptr)->serialQueue;
-    queue->sync([] {});
-  };
-  expectGone(listener, release, "Enable Kestrel",
-             [&] { client->exportedObject->setKestrelAudioAccessoryLimitedLogging(true, [](auto) {}); });
 }
 
 }  // namespace

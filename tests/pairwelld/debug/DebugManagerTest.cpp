@@ -165,17 +165,6 @@ TEST_F(DebugManagerTest, AnyChangeLeadsToTheCloudFlag) {
   EXPECT_THAT(log(), testing::Contains("debugManager default: keyValueChanged source: user"));
 }
 
-TEST_F(DebugManagerTest, AFailedStoreHoldsUpNoStep) {
-  start();
-  platform.radix.failure = std::make_error_code(std::errc::io_error);
-  EXPECT_EQ(effectsOf(true).back(), fresh.back());
-  EXPECT_TRUE(isOn());
-  effectsOf(false);
-  platform.cloud->failing = true;
-  EXPECT_THAT(effectsOf(true), testing::IsSupersetOf({"alarm at 1345600000000000 ns", "alarm cleared"}));
-  EXPECT_FALSE(isOn()) << "the cloud still says off";
-}
-
 TEST_F(DebugManagerTest, ItsEndGivesBackTheSubscriptionAndLogsAnError) {
   manager = DebugManager::create(makeManager());
   // A handle that holds nobody, or the manager could not go.
