@@ -19,19 +19,24 @@ ThreadPool::~ThreadPool() {
 }
 
 void ThreadPool::async(Work item) {
-  std::lock_guard lock(mutex);
-  queue.push_back(std::move(item));
-  if (!waking) wakeOne();
+  bool notifies;
+  {
+    std::lock_guard lock(mutex);
+    queue.push_back(std::move(item));
+    notifies = startsOrWakes();
+  }
+  // Not under the lock: the woken worker would wait for it at once, and have to be woken again.
+  if (notifies) wake.notify_one();
 }
 
-void ThreadPool::wakeOne() {
-  if (idle > 0) {
-    waking = true;
-    wake.notify_one();
-  } else if (threads.size() < maximum && !stopping) {
+bool ThreadPool::startsOrWakes() {
+  if (waking || queue.empty()) return false;
+  if (idle > 0) return waking = true;
+  if (threads.size() < maximum && !stopping) {
     waking = true;
     threads.emplace_back([this] { work(); });
   }
+  return false;
 }
 
 bool ThreadPool::waitUntilIdle(std::chrono::steady_clock::time_point deadline) {
@@ -53,8 +58,9 @@ void ThreadPool::work() {
     if (queue.empty()) return;
     Work item = std::move(queue.front());
     queue.pop_front();
-    if (!queue.empty() && !waking) wakeOne();
+    const bool notifies = startsOrWakes();
     lock.unlock();
+    if (notifies) wake.notify_one();
     try {
       item();
     } catch (const std::exception& error) {

@@ -28,7 +28,9 @@ class ThreadPool : public WorkQueue {
   bool waitUntilIdle(std::chrono::steady_clock::time_point deadline);
 
  private:
-  void wakeOne();  // with `mutex` held
+  // With `mutex` held: starts a thread for what is queued, if need be; or whether one that waits has to be
+  // notified.
+  bool startsOrWakes();
   void work();
 
   const std::size_t maximum;
