@@ -128,6 +128,7 @@ void UnifiedLog::open() {
   struct stat status {};
   ::fstat(STDERR_FILENO, &status);
   kind = Kind::other;
+  if (S_ISREG(status.st_mode)) kind = Kind::file;
   if (S_ISSOCK(status.st_mode)) kind = Kind::socket;
   if (S_ISFIFO(status.st_mode)) {
     // Opened anew to be non-blocking for us alone: other processes share the inherited one, and may fill it
@@ -148,6 +149,9 @@ bool UnifiedLog::sendBytes(std::string_view bytes) {
     case Kind::journal:
     case Kind::pipe:
       sent = ::write(own.get(), bytes.data(), bytes.size());
+      break;
+    case Kind::file:
+      sent = ::write(STDERR_FILENO, bytes.data(), bytes.size());
       break;
     case Kind::socket:
       sent = ::send(STDERR_FILENO, bytes.data(), bytes.size(), MSG_DONTWAIT | MSG_NOSIGNAL);

@@ -27,7 +27,7 @@ class UnifiedLog : public LogSink {
              std::span<const LogArgument> arguments) override;
 
  private:
-  enum class Kind { unopened, journal, pipe, socket, other };
+  enum class Kind { unopened, journal, pipe, file, socket, other };
   void open();
   bool send(const LogChannel& channel, LogLevel level, const std::string& message);
   bool sendBytes(std::string_view bytes);
