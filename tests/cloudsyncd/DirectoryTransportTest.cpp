@@ -1,14 +1,8 @@
-// Devices that meet in a folder: in memory, where it fails at will, and in a real one.
+// Devices that meet in a folder in memory, which fails at will.
 #include "cloudsyncd/DirectoryTransport.hpp"
-
-#include <sys/stat.h>
-
-#include <deque>
 
 #include "cloudsyncd/Transports.hpp"
 #include "cloudsyncd/core/Document.hpp"
-#include "platform/linux/LinuxFileSystem.hpp"
-#include "tests/fakes/RealFiles.hpp"
 #include "tests/linux/files/World.hpp"
 
 namespace cloudsync {
@@ -39,13 +33,11 @@ struct Client : TransportClient {
   void tell(const std::string& text) {
     EXPECT_FALSE(isInCall) << text;
     told.push_back(text);
-    if (onTold) onTold();
   }
   std::vector<std::string> takeTold() { return std::exchange(told, {}); }
 
   std::vector<std::string> told;
   bool isInCall = false;
-  std::function<void()> onTold;
 };
 
 struct DirectoryTransportTest : platform::linux_::World {
@@ -270,76 +262,6 @@ TEST(TransportsTest, WrongAddressesAreToldApart) {
   }
   for (const char* account : {"..", ""})
     EXPECT_THAT(problemOf({"dir:/a", account}), StartsWith("an account"));
-}
-
-// The real thing: events, links and pipes. Each step is taken when the one before has shown.
-TEST(SharedFolderTest, TwoTransportsSeeEachOtherAndWhatBecomesOfTheFolder) {
-  namespace fs = std::filesystem;
-  const fakes::TemporaryFolder root;
-  const fs::path share = root.path + "/share", home = share / "home", linked = root.path + "/linked";
-  fs::create_directories(linked / "folder.json");
-  fs::create_directory(share);
-  fs::create_symlink(linked, home);
-  std::ofstream(root.path + "/secret") << "secret";
-  fs::create_symlink(root.path + "/secret", home / "link.json");
-  ASSERT_EQ(::mkfifo((home / "pipe.json").c_str(), 0600), 0);
-
-  platform::linux_::EventLoop loop;
-  platform::linux_::LinuxFileSystem files(&loop);
-  Steady now{seconds(1000)};
-  Client a, b;
-  std::vector<std::shared_ptr<Transport>> transports;
-  std::string problem;
-  for (Client* client : {&a, &b}) {
-    auto made =
-        makeTransport({"dir:" + share.string() + "/", "home"}, {files, loop, [&] { return now; }}, problem);
-    ASSERT_TRUE(made) << problem;
-    transports.push_back(*made);
-    transports.back()->start(*client);
-  }
-  const auto heard = [](Client& client, const std::string& text) {
-    const auto at = std::find(client.told.begin(), client.told.end(), text);
-    if (at == client.told.end()) return false;
-    client.told.erase(client.told.begin(), at + 1);
-    return true;
-  };
-  const auto bothHeard = [&](const std::string& text) {
-    return std::count(a.told.begin(), a.told.end(), text) && heard(b, text) && heard(a, text);
-  };
-  const auto reconnect = [&] {
-    now += seconds(1);
-    for (const auto& transport : transports) transport->timePassed(now);
-  };
-  const std::string gone = "disconnected: " + share.string() + ": No such file or directory";
-
-  using Step = std::pair<std::function<bool()>, std::function<void()>>;
-  const auto planted = ElementsAre("folder: it is no plain file", "link: it is no plain file",
-                                   "pipe: it is no plain file", "connected");
-  std::deque<Step> steps{
-      {[&] { return testing::Value(a.told, planted) && testing::Value(b.told, planted); },
-       [&] { transports[0]->publish("a", "1"); }},
-      {[&] { return heard(b, "a = 1"); }, [&] { transports[1]->publish("b", "2"); }},
-      {[&] { return heard(a, "b = 2"); }, [&] { fs::remove(home), fs::rename(linked, home); }},
-      {[&] { return bothHeard("b = 2"); }, [&] { fs::rename(home / "b.json", share / "b.json"); }},
-      {[&] { return bothHeard("b removed"); }, [&] { fs::remove_all(home); }},
-      {[&] { return bothHeard(gone); }, reconnect},
-      {[&] { return bothHeard("connected"); }, [&] { transports[1]->publish("b", "3"); }},
-      {[&] { return heard(a, "b = 3"); }, [&] { fs::rename(share, root.path + "/other"); }},
-      {[&] { return bothHeard(gone); }, [&] { loop.stop(); }}};
-  a.onTold = b.onTold = [&] {
-    // Not from within what it is told.
-    loop.async([&] {
-      while (!steps.empty() && steps.front().first()) {
-        const auto action = std::move(steps.front().second);
-        steps.pop_front();
-        action();
-      }
-    });
-  };
-  const auto guard = loop.callAfter(fakes::deadline, [&] { loop.stop(); });
-  loop.run();
-  EXPECT_THAT(steps, IsEmpty()) << testing::PrintToString(a.told) << testing::PrintToString(b.told);
-  EXPECT_TRUE(files.syncFolder("/proc")) << "where folders know no sync";
 }
 
 }  // namespace

@@ -1,4 +1,6 @@
 // Devices that meet in a shared folder.
+#include <sys/stat.h>
+
 #include "tests/system/Account.hpp"
 
 namespace processes {
@@ -55,6 +57,18 @@ TEST_F(CloudTest, FolderThatGoesAwayIsSaidAndComesBack) {
   fs::rename(elsewhere, share);
   EXPECT_TRUE(followsOn("two", "one"));
   EXPECT_TRUE(comesToSay("one", "waiting to go out  nothing"));
+  // That of the account alone: a link, then a folder in its place, then none.
+  fs::rename(share / "home", elsewhere);
+  fs::create_symlink(elsewhere, share / "home");
+  switchTo("two", "off");
+  EXPECT_TRUE(followsOff("one"));
+  fs::remove(share / "home");
+  fs::rename(elsewhere, share / "home");
+  switchTo("one", "on");
+  EXPECT_TRUE(followsOn("two", "one"));
+  fs::remove_all(share / "home");
+  switchTo("two", "off");
+  EXPECT_TRUE(followsOff("one"));
 }
 
 TEST_F(CloudTest, AnotherAccountIsTakenWholeOrNotAtAll) {
@@ -129,6 +143,10 @@ TEST_F(CloudTest, CopyOfADiskIsToldToTakeANewIdentity) {
 }
 
 TEST_F(CloudTest, StrangersDocumentsAreRefusedOnceAndForgotten) {
+  write("share/precious.json", "");
+  fs::create_directory(share / "home");
+  ASSERT_EQ(::mkfifo((share / "home/pipe.json").c_str(), 0600), 0);
+  fs::create_symlink(share / "precious.json", share / "home/link.json");
   for (const char* name : {"one", "two"}) start(name);
   const std::string problem = "the document of device stranger is refused: ";
   for (const char* text : {"{", "{", "{"}) {
@@ -140,7 +158,11 @@ TEST_F(CloudTest, StrangersDocumentsAreRefusedOnceAndForgotten) {
   }
   EXPECT_EQ(timesLogged(problem, "one"), 1u) << log("one");
   EXPECT_TRUE(comesToSay("one", "device             stranger, newest change never, refused: "));
-  write("share/precious.json", "");
+  for (const std::string planted : {"link", "pipe"}) {
+    EXPECT_TRUE(comesToSay("one", planted + ", newest change never, refused: it is no plain file"));
+    fs::remove(share / "home" / (planted + ".json"));
+    EXPECT_TRUE(eventually([&] { return cloud("one", "status").output.find(planted) == std::string::npos; }));
+  }
   EXPECT_EQ(cloud("one", "forget ../precious").status, 1);
   EXPECT_TRUE(fs::exists(share / "precious.json"));
   EXPECT_EQ(cloud("one", "forget stranger").status, 0);

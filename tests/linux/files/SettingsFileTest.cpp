@@ -167,6 +167,7 @@ TEST(SharedFilesTest, WritersInTwoProcessesAndTwoThreadsLoseNothing) {
   EXPECT_EQ(settingsValues(*SettingsFile::create(files, path)->contents()).size(), 75u);
   EXPECT_THAT(files.list(folder.path + "/var/settings").value(),
               ElementsAre("store.json", "store.json.lock"));
+  EXPECT_TRUE(files.syncFolder("/proc")) << "where folders know no sync";
 }
 
 }  // namespace
