@@ -118,4 +118,10 @@ struct FakeLogSink : LogSink {
   Effects& effects;
 };
 
+// Where a log is not what is looked at.
+struct SilentLog : LogSink {
+  bool enabled(const LogChannel&, LogLevel) override { return false; }
+  void write(const LogChannel&, LogLevel, std::string_view, std::span<const LogArgument>) override {}
+};
+
 }  // namespace fakes

@@ -67,12 +67,6 @@ struct Machine {
   std::shared_ptr<const Dictionary> decoded;
 };
 
-struct SilentLog : platform::LogSink {
-  bool enabled(const platform::LogChannel&, platform::LogLevel) override { return false; }
-  void write(const platform::LogChannel&, platform::LogLevel, std::string_view,
-             std::span<const platform::LogArgument>) override {}
-};
-
 // hearthd's alarms, as its link brings them to the one job.
 class Streams : public platform::EventStreams {
  public:
@@ -152,14 +146,14 @@ class Notifications : public fakes::FakeNamedNotifications {
   hearth::Broker& broker;
 };
 
-// What a process stands on. Nothing is logged: a log is not what is looked at here.
+// What a process stands on.
 class Process : public fakes::FakePlatform {
  public:
   platform::LogSink& logSink() override { return silent; }
   bool isIdle() { return pool->isEmpty() && loop.queue->isEmpty() && delivery->isEmpty(); }
 
  private:
-  SilentLog silent;
+  fakes::SilentLog silent;
 };
 
 // pairwelld's process.

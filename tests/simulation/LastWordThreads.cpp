@@ -19,12 +19,6 @@ void pause(int fromMicroseconds, int toMicroseconds) {
       std::uniform_int_distribution<int>(fromMicroseconds, toMicroseconds)(random)));
 }
 
-struct SilentLog : platform::LogSink {
-  bool enabled(const platform::LogChannel&, platform::LogLevel) override { return false; }
-  void write(const platform::LogChannel&, platform::LogLevel, std::string_view,
-             std::span<const platform::LogArgument>) override {}
-};
-
 // The main queue is one of the pool's; alarms are only counted.
 struct Hearth : platform::RunLoop, platform::EventStreams {
   void run() override {}
@@ -53,7 +47,7 @@ struct ThreadedPlatform : fakes::FakePlatform {
 
   Hearth hearth;
   platform::Queues threadedQueues{hearth.pool};
-  SilentLog silentLog;
+  fakes::SilentLog silentLog;
 };
 
 // How many of the pairs left something on, or did not come to rest.

@@ -110,6 +110,7 @@ TEST(CloudReplicaTest, ExpiryRanksRightAfterTheSwitchThatItEnds) {
   away.switchOn(9000);  // echoes
   home.now = Time(5002);
   home.write("flag", false);
+  EXPECT_EQ(home.stamp("flag").tick, 0) << "a person's, before the end";
   away.exchange(home);
   away.read("flag");
   EXPECT_TRUE(away.write("flagExpiration", std::nullopt));
