@@ -1,16 +1,11 @@
 #include "bench/Cluster.hpp"
 
-#include <fcntl.h>
-#include <signal.h>
-#include <sys/prctl.h>
 #include <sys/socket.h>
-#include <sys/wait.h>
 
 #include <algorithm>
 #include <fstream>
 #include <utility>
 
-#include "bench/Process.hpp"
 #include "platform/linux/Json.hpp"
 #include "platform/linux/UniqueDescriptor.hpp"
 
@@ -68,14 +63,9 @@ void forEach(const Dictionary& in, const char* list, Visit visit) {
 }  // namespace
 
 Cluster::Cluster(std::size_t accounts) {
-  for (Server& server : servers) server = {fakes::freePort(), fakes::freePort(), fakes::freePort()};
   configure(accounts);
   for (std::size_t number = 0; number < size; ++number) start(number);
   await("the servers do not find together", [&] { return isReady(); });
-}
-
-Cluster::~Cluster() {
-  for (std::size_t number = 0; number < size; ++number) kill(number);
 }
 
 void Cluster::configure(std::size_t accounts) {
@@ -98,7 +88,7 @@ void Cluster::configure(std::size_t accounts) {
 // All three have met, and have somebody who places streams.
 bool Cluster::isReady() const {
   for (std::size_t number = 0; number < size; ++number) {
-    if (::waitpid(process(number), nullptr, WNOHANG) != 0)
+    if (servers.at(number).process->hasEnded())
       throw std::runtime_error("a server did not start: " + lastLine(folder(number) + ".log"));
     const Dictionary seen = look(number, "jsz");
     const auto* meta = platform::find<Dictionary>(seen, "meta_cluster");
@@ -109,21 +99,15 @@ bool Cluster::isReady() const {
 }
 
 void Cluster::start(std::size_t number) {
-  const std::string conf = folder(number) + ".conf", log = folder(number) + ".log";
-  const pid_t pid = servers.at(number).pid = ::fork();
-  if (pid != 0) return;
-  ::prctl(PR_SET_PDEATHSIG, SIGKILL);
-  const int output = ::open(log.c_str(), O_WRONLY | O_CREAT | O_APPEND, 0600);
-  ::dup2(output, STDERR_FILENO);
-  ::execl(program, "nats-server", "-c", conf.c_str(), nullptr);
-  ::_exit(127);
+  const std::vector<std::string> command{program, "-c", folder(number) + ".conf"};
+  servers.at(number).process.emplace([&] { become(command, folder(number) + ".log"); });
 }
 
-void Cluster::kill(std::size_t number) {
-  const pid_t pid = std::exchange(servers.at(number).pid, -1);
-  if (pid <= 0) return;
-  ::kill(pid, SIGKILL);
-  ::waitpid(pid, nullptr, 0);
+void Cluster::kill(std::size_t number) { servers.at(number).process.reset(); }
+
+pid_t Cluster::process(std::size_t number) const {
+  const auto& process = servers.at(number).process;
+  return process ? process->pid() : -1;
 }
 
 std::string Cluster::folder(std::size_t number) const { return root.path + "/n" + std::to_string(number); }

@@ -10,6 +10,7 @@
 #include <string>
 #include <vector>
 
+#include "bench/Process.hpp"
 #include "platform/Value.hpp"
 #include "tests/fakes/RealFiles.hpp"
 
@@ -22,11 +23,9 @@ class Cluster {
 
   // With the engine's accounts a0, a1, …: each with a user of its name. Returns when streams can be made.
   explicit Cluster(std::size_t accounts = 1);
-  ~Cluster();  // ends the servers and removes their folders
-
   void start(std::size_t number);
-  void kill(std::size_t number);  // as a crash does
-  pid_t process(std::size_t number) const { return servers.at(number).pid; }
+  void kill(std::size_t number);                 // as a crash does
+  pid_t process(std::size_t number) const;       // -1 once it is killed
   std::string folder(std::size_t number) const;  // of its streams
 
   static std::string account(std::size_t number) { return "a" + std::to_string(number); }
@@ -45,8 +44,8 @@ class Cluster {
 
  private:
   struct Server {
-    int port, cluster, monitor;
-    pid_t pid = -1;
+    const int port = fakes::freePort(), cluster = fakes::freePort(), monitor = fakes::freePort();
+    std::optional<Child> process;
   };
   void configure(std::size_t accounts);
   bool isReady() const;

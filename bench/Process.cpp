@@ -69,6 +69,12 @@ Child::Child(const std::function<void()>& body) : process(::fork()) {
   ::_exit(0);
 }
 
+bool Child::hasEnded() const {
+  siginfo_t ended{};
+  return ::waitid(P_PID, static_cast<id_t>(process), &ended, WEXITED | WNOHANG | WNOWAIT) == 0 &&
+         ended.si_pid != 0;
+}
+
 void Child::end(int signal) {
   const pid_t pid = std::exchange(process, -1);
   if (pid <= 0) return;

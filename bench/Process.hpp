@@ -43,6 +43,7 @@ class Child {
   Child(Child&& other) noexcept : process(std::exchange(other.process, -1)) {}
 
   pid_t pid() const { return process; }
+  bool hasEnded() const;  // by itself
   void end(int signal = 9);
 
  private:
