@@ -50,6 +50,7 @@ struct AlarmsTest : testing::Test {
   // The job ends, and another run of it is there.
   void restart() {
     alarms.jobEnded("job");
+    EXPECT_THAT(due(), IsEmpty()) << "nobody to deliver to";
     alarms.handlerInstalled("job", stream, now);
   }
 
@@ -61,7 +62,9 @@ TEST_F(AlarmsTest, ComesOnceWhenDueAndAgainToTheNextRunUntilTaken) {
   alarms.set(key("a"), at(1010));
   EXPECT_EQ(wait(), INFINITY) << "nobody to deliver to";
   alarms.handlerInstalled("job", stream, now);
-  EXPECT_EQ(wait(), 10);
+  alarms.set(key("b"), at(1011));
+  EXPECT_EQ(wait(), 10) << "the earlier one";
+  alarms.clear(key("b"));
   now.wall = Time(500);
   EXPECT_EQ(wait(), 510) << "the clock has been set";
   now.wall = Time(1009.5);

@@ -141,6 +141,8 @@ TEST_F(EntitlementsTest, BelongToTheProgramOfTheUserThatTheyName) {
   EXPECT_EQ(granted(peer), R"(["name": "b.json"])");
   add("f.json", "nonsense");
   EXPECT_EQ(granted(peer), R"(["name": "b.json"])");
+  ::chmod(program.c_str(), 0777);
+  EXPECT_EQ(granted(peer), "[:]") << "others can change it";
 }
 
 }  // namespace

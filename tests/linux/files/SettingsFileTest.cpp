@@ -168,6 +168,7 @@ TEST(SharedFilesTest, WritersInTwoProcessesAndTwoThreadsLoseNothing) {
   EXPECT_THAT(files.list(folder.path + "/var/settings").value(),
               ElementsAre("store.json", "store.json.lock"));
   EXPECT_TRUE(files.syncFolder("/proc")) << "where folders know no sync";
+  EXPECT_FALSE(files.list(folder.path + "/none"));
 }
 
 }  // namespace
