@@ -79,7 +79,7 @@ TEST_F(CloudTest, AnotherAccountIsTakenWholeOrNotAtAll) {
   on("one", "hearthctl", "settings set cloud ours 1");
 
   const std::string before = contents(root / "one/etc/cloud.json");
-  const Outcome away = cloud("one", "use dir:/nowhere --account work");
+  const Outcome away = cloud("one", "use dir:" + (root / "nowhere").string() + " --account work");
   EXPECT_EQ(away.status, 1);
   EXPECT_THAT(away.errors, HasSubstr("/nowhere: No such file or directory"));
   for (const char* wrong : {"ftp:x --account work", "dir:relative --account work", "dir:/tmp --account .."})
