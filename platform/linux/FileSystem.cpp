@@ -1,19 +1,29 @@
 #include "platform/linux/FileSystem.hpp"
 
+#include <utility>
+
 namespace platform::linux_ {
 namespace {
 
-Result<FileIdentity> writeNew(FileSystem& files, const std::string& path, std::string_view bytes) {
+Result<void> writeNew(FileSystem& files, const std::string& path, std::string_view bytes) {
   auto file = files.create(path);
   if (!file && file.error() == std::errc::file_exists) {
     // Left by a writer that was cut off: the caller's lock says that nobody writes it now.
-    if (const auto removed = files.remove(path); !removed) return removed.error();
+    if (const auto removed = files.remove(path); !removed) return removed;
     file = files.create(path);
   }
   if (!file) return file.error();
-  if (const auto written = (*file)->writeAll(bytes); !written) return written.error();
-  if (const auto synced = (*file)->sync(); !synced) return synced.error();
-  return (*file)->identity();
+  if (const auto written = (*file)->writeAll(bytes); !written) return written;
+  return (*file)->sync();
+}
+
+// Opened anew: to let go of one that was written to is an event for whoever watches the folder.
+Result<HeldFile> hold(FileSystem& files, const std::string& path) {
+  auto file = files.openToRead(path);
+  if (!file) return file.error();
+  const auto identity = (*file)->identity();
+  if (!identity) return identity.error();
+  return HeldFile{std::move(*file), *identity};
 }
 
 }  // namespace
@@ -52,16 +62,17 @@ Result<std::string> moveAside(FileSystem& files, const std::string& path) {
   }
 }
 
-Result<FileIdentity> replaceFile(FileSystem& files, const std::string& path, std::string_view bytes) {
+Result<HeldFile> replaceFile(FileSystem& files, const std::string& path, std::string_view bytes) {
   const std::string temporary = path + ".new";
   const auto written = writeNew(files, temporary, bytes);
-  const auto renamed = written ? files.rename(temporary, path) : Result<void>(written.error());
+  auto made = written ? hold(files, temporary) : Result<HeldFile>(written.error());
+  const auto renamed = made ? files.rename(temporary, path) : Result<void>(made.error());
   if (!renamed) {
     static_cast<void>(files.remove(temporary));  // the first failure is the one to tell
     return renamed.error();
   }
   if (const auto synced = files.syncFolder(folderOf(path)); !synced) return synced.error();
-  return written;
+  return made;
 }
 
 }  // namespace platform::linux_

@@ -92,7 +92,13 @@ Result<std::string> moveAside(FileSystem& files, const std::string& path);
 
 // Replaces `path`, durably and in one step: temporary file beside it, sync, rename, sync of the folder. On
 // failure the old file is as it was and the temporary one is gone; where the last sync alone fails, the new
-// one is there. The identity of the new file.
-Result<FileIdentity> replaceFile(FileSystem& files, const std::string& path, std::string_view bytes);
+// one is there.
+//
+// The new file, held open, so that its identity stays its own.
+struct HeldFile {
+  std::unique_ptr<File> file;
+  FileIdentity identity;
+};
+Result<HeldFile> replaceFile(FileSystem& files, const std::string& path, std::string_view bytes);
 
 }  // namespace platform::linux_

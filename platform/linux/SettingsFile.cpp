@@ -66,10 +66,10 @@ SettingsFile::Document SettingsFile::contents() {
 
 Result<void> SettingsFile::refresh() {
   const auto current = files.identity(path);
-  if (current && held && *current == heldIdentity) return {};
+  if (current && held.file && *current == held.identity) return {};
   const auto loaded = current ? load() : Result<void>(current.error());
   if (loaded || !isMissing(loaded.error())) return loaded;
-  held.reset();
+  held = {};
   // Whoever moved it aside: this process has seen that it was damaged.
   if (!std::exchange(damage, "").empty()) lastGoodInForce = true;
   if (!lastGoodInForce && !document->empty()) document = std::make_shared<const Dictionary>();
@@ -82,18 +82,20 @@ Result<void> SettingsFile::load() {
   const auto identity = (*file)->identity();
   if (!identity) return identity.error();
   std::string problem;
-  const bool isOwn = own.document && *identity == own.identity;
-  const auto loaded = isOwn ? own.document : readDocument(**file, problem);
+  const auto loaded = readDocument(**file, problem);
   if (!loaded && problem.empty()) return loaded.error();
-  held = std::move(*file);
-  heldIdentity = *identity;
-  damageStays = false;
-  damage = problem;
-  if (loaded) {
-    document = *loaded;
-    lastGoodInForce = false;
-  }
+  hold({std::move(*file), *identity}, loaded ? *loaded : nullptr);
+  damage = loaded ? "" : problem;
   return {};
+}
+
+void SettingsFile::hold(HeldFile file, Document contents) {
+  held = std::move(file);
+  damage.clear();
+  damageStays = false;
+  if (!contents) return;
+  document = std::move(contents);
+  lastGoodInForce = false;
 }
 
 // Only under the file's lock, and after another look: between the two a writer may have put a good file
@@ -119,7 +121,7 @@ void SettingsFile::moveAside() {
   log().error("%s: %s; moved to %s. To use it, mend it, remove its checksum line, and move it back", path,
               damage, *moved);
   damage.clear();
-  held.reset();
+  held = {};
   lastGoodInForce = true;
 }
 
@@ -148,9 +150,10 @@ Result<void> SettingsFile::update(const std::function<bool(Dictionary& document)
   Dictionary next = *before;
   const bool differs = change(next);
   if (!differs) next = *before;
-  const auto written = differs || again ? write(next) : Written();
-  finishWrite(*before, next, written);
-  return written;
+  auto written = differs || again ? write(next) : Written{before, {}};
+  const Result<void> outcome = written;
+  finishWrite(before, next, std::move(written));
+  return outcome;
 }
 
 Result<SettingsFile::Written> SettingsFile::write(const Dictionary& next) {
@@ -162,25 +165,28 @@ Result<SettingsFile::Written> SettingsFile::write(const Dictionary& next) {
   if (text->size() > sizeLimit) return Outcome::tooLarge;
   auto back = decodeSettings(*text, problem);
   if (!back) return back.error();
-  const auto identity = replaceFile(files, path, *text);
-  if (!identity) return identity.error();
-  return Written{std::make_shared<const Dictionary>(std::move(*back)), *identity};
+  auto made = replaceFile(files, path, *text);
+  if (!made) return made.error();
+  return Written{std::make_shared<const Dictionary>(std::move(*back)), std::move(*made)};
 }
 
-void SettingsFile::finishWrite(const Dictionary& before, const Dictionary& next,
-                               const Result<Written>& written) {
-  bool outsideChange;
+void SettingsFile::finishWrite(const Document& before, const Dictionary& next, Result<Written> written) {
+  bool looks = false;
   {
     std::lock_guard lock(mutex);
     writing = false;
     unsynced = !written;
-    if (written) own = *written;
-    const auto fresh = refresh();  // a failure is the next reader's to meet
-    own = {};
-    if (!fresh && written) document = std::make_shared<const Dictionary>(next);
-    outsideChange = reported && recordOwnChange(before, next, written.has_value());
+    if (written && written->made.file) hold(std::move(written->made), written->document);
+    const auto fresh = refresh();  // somebody may have replaced it since
+    if (reported && written && reported == before && document == written->document) {
+      reported = document;  // as nearly always: there is nothing but the own change
+    } else if (reported) {
+      looks = recordOwnChange(*before, next, written.has_value());
+    }
+    // Nobody has looked meanwhile.
+    looks = looks || (reported && (!fresh || !damage.empty()));
   }
-  if (outsideChange) lookLater();
+  if (looks) lookLater();
 }
 
 void SettingsFile::lookLater() {
@@ -197,7 +203,9 @@ bool SettingsFile::recordOwnChange(const Dictionary& before, const Dictionary& n
     carryOver(before, next, known);
     reported = std::make_shared<const Dictionary>(std::move(known));
   }
-  return !sameValue(*reported, *document);
+  if (!sameValue(*reported, *document)) return true;
+  reported = document;
+  return false;
 }
 
 Result<void> SettingsFile::setValue(std::string_view key, const std::optional<Value>& value) {
@@ -249,17 +257,16 @@ void SettingsFile::tryToWatch() {
 // Compares instead of trusting events: they merge, overflow, and come for own writes, too.
 void SettingsFile::look() {
   // The file may hold an own change that is not recorded yet. Its writer looks for others' when it is.
-  const auto isEarly = [&] { return writing || !reported; };
-  if (std::lock_guard lock(mutex); isEarly()) return;
+  if (std::lock_guard lock(mutex); writing) return;
   static_cast<void>(contents());
   Document before, after;
   {
     std::lock_guard lock(mutex);
-    if (isEarly()) return;
+    if (writing || !reported) return;
     before = std::exchange(reported, document);
     after = document;
   }
-  if (!sameValue(*before, *after)) changed(*before, *after);
+  if (before != after && !sameValue(*before, *after)) changed(*before, *after);
 }
 
 }  // namespace platform::linux_

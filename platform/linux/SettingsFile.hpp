@@ -52,13 +52,12 @@ class SettingsFile : public std::enable_shared_from_this<SettingsFile> {
  private:
   SettingsFile(FileSystem& files, std::string path);
   Result<std::unique_ptr<FileLock>> lockForWriting();
-  // What a write has left at the path, if nobody else has replaced it since.
   struct Written {
     Document document;
-    FileIdentity identity;
+    HeldFile made;  // none where there was nothing to write
   };
   Result<Written> write(const Dictionary& next);
-  void finishWrite(const Dictionary& before, const Dictionary& next, const Result<Written>& written);
+  void finishWrite(const Document& before, const Dictionary& next, Result<Written> written);
   void clearDamage();
   void look();
   void lookLater();
@@ -67,6 +66,7 @@ class SettingsFile : public std::enable_shared_from_this<SettingsFile> {
   void recordFailure(const std::error_code& error);
   Result<void> refresh();
   Result<void> load();
+  void hold(HeldFile file, Document contents);
   void moveAside();
   bool recordOwnChange(const Dictionary& before, const Dictionary& next, bool written);
 
@@ -79,10 +79,7 @@ class SettingsFile : public std::enable_shared_from_this<SettingsFile> {
   std::mutex mutex;
   WorkQueue* delivery = nullptr;  // null without a wish to watch
   Document document;
-  std::unique_ptr<File>
-      held;  // the file that `document`, or `damage`, came from; its inode is not reused meanwhile
-  FileIdentity heldIdentity;
-  Written own;                   // need not be read again
+  HeldFile held;                 // that `document`, or `damage`, came from; its inode is not reused meanwhile
   std::string damage;            // what is wrong with the held file
   bool damageStays = false;      // it could not be moved
   bool lastGoodInForce = false;  // the file is missing because it was damaged

@@ -58,6 +58,19 @@ TEST_F(PreferencesTest, ForeignChangeFirstMetInAnOwnWriteIsReportedLaterAndOnce)
   deliver();
   EXPECT_THAT(observer->take(), IsEmpty());
   EXPECT_EQ(neighbour->doubleForKey("b"), 2.0);
+  files.onFolderSync = [&] {
+    files.put(path, R"({"values": {"a": 3, "b": 3}})");
+    files.unreadable.insert(path);
+    files.deliverEvents();
+  };
+  store->setValue(3, "b");
+  files.onFolderSync = nullptr;
+  device.runAll();
+  EXPECT_THAT(observer->take(), ElementsAre("b"));
+  files.unreadable.clear();
+  EXPECT_EQ(store->doubleForKey("a"), 3.0);
+  device.runAll();
+  EXPECT_THAT(observer->take(), ElementsAre("a")) << "its event came while it could not be read";
 }
 
 TEST_F(PreferencesTest, ObserverThatHasLeftIsNotCalled) {

@@ -110,6 +110,17 @@ TEST_F(SettingsFileTest, NeighboursWriteIsReadThoughItsEventsAreHeldBack) {
   files.onFolderSync = [&] { files.put(path, R"({"values": {"key": 99}})"); };
   ASSERT_TRUE(ours->setValue("key", 5));
   EXPECT_EQ(stored(*ours), (Dictionary{{"key", 99}})) << "by who asks for no lock, right behind ours";
+  files.onFolderSync = [&] {  // as long, and perhaps on our inode
+    std::string other = R"({"values": {"key": 7}})";
+    other.resize(files.bytes(path).size(), ' ');
+    ASSERT_TRUE(files.remove(path));
+    files.put(path, other);
+  };
+  ASSERT_TRUE(ours->setValue("key", 6));
+  EXPECT_EQ(stored(*ours), (Dictionary{{"key", 7}}));
+  files.onFolderSync = [&] { files.put(path, "?"); };
+  ASSERT_TRUE(ours->setValue("key", 8));
+  EXPECT_EQ(stored(*ours), (Dictionary{{"key", 8}})) << "what was acknowledged is in force";
 }
 
 // Cuts a write at every call that it makes; then its process ends, or loses its power, or tries again.
