@@ -15,9 +15,6 @@ namespace {
 const std::string checksumEntry = "checksum";
 const std::string valuesEntry = "values";
 
-// CRC-32 as zlib's: it finds every single flipped bit and every burst of up to 32, which is what a bad disk
-// does. Nobody who means harm and can write the file would be held up by a stronger one. It is taken of the
-// contents as they print on one line with sorted keys, so that a person may lay the file out anew.
 constexpr std::array<std::uint32_t, 256> stepsOfChecksum() {
   std::array<std::uint32_t, 256> steps{};
   for (std::uint32_t byte = 0; byte < steps.size(); ++byte) {
@@ -28,8 +25,12 @@ constexpr std::array<std::uint32_t, 256> stepsOfChecksum() {
   return steps;
 }
 
+// CRC-32 as zlib's: it finds every single flipped bit and every burst of up to 32, which is what a bad disk
+// does. Nobody who means harm and can write the file would be held up by a stronger one. It is taken of the
+// contents as they print on one line with sorted keys, so that a person may lay the file out anew.
 std::string checksumOf(std::string_view canonical) {
   static constexpr auto steps = stepsOfChecksum();
+  static_assert(steps[1] == 0x77073096 && steps[255] == 0x2D02EF8D, "zlib's; files that are there hold it");
   std::uint32_t sum = 0xFFFFFFFF;
   for (const char character : canonical)
     sum = (sum >> 8) ^ steps[(sum ^ static_cast<unsigned char>(character)) & 0xFF];

@@ -31,7 +31,10 @@ void ThreadPool::async(Work item) {
 
 bool ThreadPool::startsOrWakes() {
   if (waking || queue.empty()) return false;
-  if (idle > 0) return waking = true;
+  if (idle > 0) {
+    waking = true;
+    return true;
+  }
   if (threads.size() < maximum && !stopping) {
     waking = true;
     threads.emplace_back([this] { work(); });

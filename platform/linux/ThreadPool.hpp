@@ -19,7 +19,7 @@ namespace platform::linux_ {
 class ThreadPool : public WorkQueue {
  public:
   explicit ThreadPool(std::size_t threads);
-  // Runs what is queued, then ends the threads.
+  // Runs what is queued, then ends the threads. No async() may be under way, even if its work has run.
   ~ThreadPool() override;
 
   void async(Work work) override;

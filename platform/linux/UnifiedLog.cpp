@@ -150,7 +150,7 @@ bool UnifiedLog::sendBytes(std::string_view bytes) {
     case Kind::pipe:
       sent = ::write(own.get(), bytes.data(), bytes.size());
       break;
-    case Kind::file:
+    case Kind::file:  // it is always ready
       sent = ::write(STDERR_FILENO, bytes.data(), bytes.size());
       break;
     case Kind::socket:
@@ -166,7 +166,7 @@ bool UnifiedLog::sendBytes(std::string_view bytes) {
       break;
     }
   }
-  // A line of which a stream socket took a part would run into the next; it counts as written.
+  // A line of which a part was taken, by a stream socket or a full disk, runs into the next; it counts.
   return sent > 0;
 }
 
