@@ -101,7 +101,8 @@ void Client::send(const std::string& message) const {
 std::size_t Client::receive(Kind kind) {
   char buffer[16 * 1024];
   const ssize_t got = ::recv(socket.get(), buffer, sizeof buffer, 0);
-  if (got <= 0) throw std::runtime_error(got == 0 ? "a connection has ended" : "no answer for a minute");
+  if (got < 0 && errno == EAGAIN) throw std::runtime_error("no answer for a minute");
+  if (got <= 0) throw std::runtime_error("a connection has ended");
   pending.append(buffer, static_cast<std::size_t>(got));
   std::size_t found = 0, used = 0;
   while (const std::size_t size = sizeOfFirst(std::string_view(pending).substr(used))) {

@@ -6,6 +6,7 @@
 #include <memory>
 #include <stdexcept>
 #include <string>
+#include <thread>
 #include <vector>
 
 #include "bench/Account.hpp"
@@ -16,6 +17,7 @@
 #include "cloudsyncd/core/Document.hpp"
 #include "hearthd/core/Alarms.hpp"
 #include "platform/EventStreams.hpp"
+#include "platform/linux/EventLoop.hpp"
 #include "platform/linux/FileUserPreferences.hpp"
 #include "platform/linux/Json.hpp"
 #include "platform/linux/LinuxFileSystem.hpp"
@@ -50,6 +52,8 @@ void growConnections(const std::string& programs) {
         Client client(row.service);
         const auto waits = times(3'000, [&](std::size_t) { client.call(message); });
         reads.add(row.name, std::to_string(size), percentiles(waits).p50);
+        idle.clear();
+        client.call(message);  // behind their ends
       }
     }
   }
@@ -69,12 +73,21 @@ void fill(LinuxFileSystem& files, const std::string& path, int keys) {
   if (!filled) throw std::runtime_error("a store cannot be filled: " + filled.error().message());
 }
 
+// Serves the stores' watches.
+struct Loop : platform::linux_::EventLoop {
+  ~Loop() {
+    stop();
+    thread.join();
+  }
+  std::thread thread{[this] { run(); }};
+};
+
 // Of both, the same number of keys.
 struct Stores {
-  Stores(const std::string& programs, LinuxFileSystem& files, const std::string& folder, int keys)
+  Stores(const std::string& programs, Loop& loop, LinuxFileSystem& files, const std::string& folder, int keys)
       : column(std::to_string(keys)), path(folder + "/" + column + ".json"), dconf(programs, keys) {
     fill(files, path, keys);
-    own = platform::linux_::FileUserPreferences::create(files, nullptr, path);
+    own = platform::linux_::FileUserPreferences::create(files, &loop, path);
   }
   const std::string column, path;
   Dconf dconf;
@@ -84,13 +97,14 @@ struct Stores {
 void growStores(const std::string& programs) {
   constexpr std::size_t writesOfARound = 20;
   const fakes::TemporaryFolder folder;
-  LinuxFileSystem files{nullptr};
+  Loop loop;
+  LinuxFileSystem files{&loop};
   const std::string ours = "user preferences", bare = "bare calls of a file of that size",
                     peer = "dconf, not durable";
   Table& writes = table("growth-writes", "A write to a store, p50 by keys", "µs");
   Table& reads = table("growth-reads", "A read of a store, p50 by keys", "µs");
   std::deque<Stores> all;
-  for (const int size : sizes) all.emplace_back(programs, files, folder.path, size);
+  for (const int size : sizes) all.emplace_back(programs, loop, files, folder.path, size);
   std::int64_t value = 0;
   for (int round = 0; round < rounds; ++round) {
     for (Stores& stores : all) {

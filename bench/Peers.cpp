@@ -158,18 +158,16 @@ Bus::Bus(Kind kind, const std::string& programs)
 
 Bus::~Bus() { sd_bus_close_unref(controller); }
 
-std::vector<std::string> Bus::environment() const {
-  return {"env", "XDG_CONFIG_HOME=" + folder.path, "XDG_RUNTIME_DIR=" + folder.path,
-          "DBUS_SESSION_BUS_ADDRESS=" + address()};
-}
+Bus::Desktop::Desktop(const Bus& bus)
+    : settings("XDG_CONFIG_HOME", bus.folder.path),
+      runtime("XDG_RUNTIME_DIR", bus.folder.path),
+      address("DBUS_SESSION_BUS_ADDRESS", bus.address()) {}
 
 Child Bus::startDaemon() {
   const std::string path = folder.path + "/bus.conf";
   std::ofstream(path) << daemonConfiguration << "<listen>" << address() << "</listen></busconfig>\n";
-  std::vector<std::string> command = environment();
-  for (const auto& word : {std::string("dbus-daemon"), std::string("--nofork"), "--config-file=" + path})
-    command.push_back(word);
-  Child started(command);
+  const Desktop desktop(*this);
+  Child started({"dbus-daemon", "--nofork", "--config-file=" + path});
   await("dbus-daemon does not start", [&] { return isServed(_echo.socket); });
   return started;
 }
@@ -214,8 +212,8 @@ Dconf::Dconf(const std::string& programs, int keys)
       writer(start(programs, {"write", std::to_string(keys)})) {}
 
 Companion Dconf::start(const std::string& programs, const std::vector<std::string>& arguments) const {
-  std::vector<std::string> command = bus.environment();
-  command.push_back(programs + "/pairwell_dconf");
+  const Bus::Desktop desktop(bus);
+  std::vector<std::string> command{programs + "/pairwell_dconf"};
   command.insert(command.end(), arguments.begin(), arguments.end());
   return Companion(command);
 }

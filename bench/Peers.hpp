@@ -52,8 +52,11 @@ class Bus {
 
   const Service& echo() const { return _echo; }
   std::string address() const { return "unix:path=" + _echo.socket; }
-  // What runs a program as one of the bus's desktop.
-  std::vector<std::string> environment() const;
+  // While it is there, what is started is part of the bus's desktop.
+  struct Desktop {
+    explicit Desktop(const Bus& bus);
+    const Variable settings, runtime, address;
+  };
   pid_t pid() const { return process.pid(); }
 
  private:

@@ -292,6 +292,7 @@ void compareReports(const std::string& before, const std::string& after) {
     if (isWorse)
       std::printf("worse: %s: %s, was %s\n", label.c_str(), shown(later).c_str(), shown(earlier).c_str());
   }
+  for (const auto& entry : old) others += !now.contains(entry.first);
   std::printf("%zu worse than the noise, %zu not; %zu without rounds in both files\n", worse, alike, others);
 }
 

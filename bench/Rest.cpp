@@ -1,6 +1,8 @@
 // From exec to the first answer, and what everything takes at rest.
+#include <algorithm>
 #include <chrono>
 #include <functional>
+#include <iterator>
 #include <memory>
 #include <optional>
 #include <stdexcept>
@@ -98,14 +100,17 @@ void measureRest(const std::string& programs) {
   Table& wakes = table("wakeups", "Wake-ups in 60 idle seconds", "");
   for (const Row& row : rows) Client(row.service).call(callMessage(row.service, row.call));
   std::this_thread::sleep_for(1s);  // the clients have just left
-  std::vector<long> before;
-  before.reserve(rows.size());
-  for (const Row& row : rows) before.push_back(wakeUps(row.pid));
+  std::vector<long> before, threads;
+  std::transform(rows.begin(), rows.end(), std::back_inserter(before),
+                 [](const Row& row) { return wakeUps(row.pid); });
+  std::transform(rows.begin(), rows.end(), std::back_inserter(threads),
+                 [](const Row& row) { return statusNumber(row.pid, "Threads"); });
   std::this_thread::sleep_for(idleTime);
   for (std::size_t index = 0; index < rows.size(); ++index) {
     const Row& row = rows[index];
     const long woken = wakeUps(row.pid) - before[index];
-    if (woken < 0) throw std::runtime_error(row.name + ": a thread has ended, and its wake-ups with it");
+    if (statusNumber(row.pid, "Threads") != threads[index])
+      throw std::runtime_error(row.name + ": a thread has ended, and its wake-ups with it");
     wakes.add(row.name, "wake-ups", static_cast<double>(woken));
     memory.add(row.name, "idle", residentMebibytes(row.pid));
   }
