@@ -26,9 +26,6 @@ struct Device {
     const auto entry = CloudEntry::find(entries, key);
     lastKnown[key] = entry ? entry->value : std::nullopt;
   }
-  void readPair() {
-    for (const char* key : {"flag", "flagExpiration"}) read(key);
-  }
   void switchOn(double end) {
     write("flag", true);
     write("flagExpiration", end);
@@ -52,17 +49,28 @@ struct Device {
   std::map<std::string, std::optional<Value>> lastKnown;
 };
 
-TEST(CloudReplicaTest, AnEchoIsWhatEqualsTheValueThatWasLastReadOrWritten) {
-  Device device("d");
-  device.read("key");
-  EXPECT_FALSE(device.write("key", std::nullopt));
-  EXPECT_TRUE(device.write("key", false)) << "an absent entry equals only a removal";
-  device.now += Time(1);
-  EXPECT_FALSE(device.write("key", false)) << "what it wrote before";
-  EXPECT_TRUE(device.write("other", 1));
-  EXPECT_FALSE(device.write("key", false)) << "behind news of another key, too";
-  EXPECT_TRUE(device.write("key", 0)) << "not the same in the file";
-  EXPECT_TRUE(device.write("unread", std::nullopt)) << "nothing known";
+TEST(CloudReplicaTest, EchoKeepsItsPlaceEvenIfANewerEntryHasArrived) {
+  Device ours("ours"), theirs("theirs");
+  theirs.switchOn(5000);
+  ours.exchange(theirs);
+  for (const char* key : {"flag", "flagExpiration"}) ours.read(key);
+  theirs.now += Time(10);
+  theirs.switchOff();
+  ours.exchange(theirs);
+  ours.now += Time(20);
+  EXPECT_FALSE(ours.write("flag", true)) << "what it read before";
+  EXPECT_FALSE(ours.write("flagExpiration", 5000.0));
+  EXPECT_EQ(ours.values(), R"(["flag": false])");
+  EXPECT_TRUE(ours.write("other", 1));
+  EXPECT_FALSE(ours.write("flag", true)) << "behind news of another key, too";
+
+  ours.read("never");
+  EXPECT_FALSE(ours.write("never", std::nullopt));
+  EXPECT_TRUE(ours.write("never", false)) << "an absent entry equals only a removal";
+  ours.now += Time(1);
+  EXPECT_FALSE(ours.write("never", false)) << "what it wrote before";
+  EXPECT_TRUE(ours.write("never", 0)) << "not the same in the file";
+  EXPECT_TRUE(ours.write("unread", std::nullopt)) << "nothing known";
 }
 
 TEST(CloudReplicaTest, WhatIsWrittenTogetherSharesOneTimestamp) {
@@ -76,10 +84,13 @@ TEST(CloudReplicaTest, WhatIsWrittenTogetherSharesOneTimestamp) {
   device.now += Time(0.024);
   device.write("third", 1);
   EXPECT_EQ(device.stamp("third"), first) << "the quiet is that between two writes";
+  device.write("flag", false);
+  const CloudStamp second = device.stamp("flag");
+  EXPECT_GT(second, first) << "a second value";
   device.disk = Time(5);
   device.now += Time(0.026);
   device.write("third", 2);
-  EXPECT_GT(device.stamp("third"), first);
+  EXPECT_GT(device.stamp("third"), second);
   device.write("fourth", 2);
   EXPECT_EQ(device.stamp("fourth"), device.stamp("third")) << "a slow disk parts nothing";
 
@@ -88,34 +99,61 @@ TEST(CloudReplicaTest, WhatIsWrittenTogetherSharesOneTimestamp) {
   neighbour.now = Time(10);
   neighbour.write("flag", true);
   EXPECT_GT(neighbour.stamp("flag"), device.stamp("third")) << "though its clock is behind";
+  device.entries = neighbour.entries;
+  EXPECT_TRUE(device.write("flag", 7)) << "not lost on what has overtaken the burst";
+  EXPECT_EQ(device.values(), R"(["flag": 7, "fourth": 2, "third": 2])");
 }
 
 TEST(CloudReplicaTest, ExpiryRanksRightAfterTheSwitchThatItEnds) {
   Device away("away"), home("home");
   home.switchOn(5000);
   away.exchange(home);
+  home.now = Time(3000);
+  home.switchOff();
+  home.now += Time(60);
+  home.switchOn(9000);
+
   away.now = Time(4999.2);  // within the second
   away.switchOff();
   EXPECT_EQ(away.stamp("flag"), (CloudStamp{1'000'000'000, 1}));
   EXPECT_EQ(away.stamp("flagExpiration"), away.stamp("flag"));
-
-  // One long past does not keep a later removal of an end from being news.
-  home.now = Time(5000);
-  away.exchange(home);
-  home.readPair();
-  home.switchOn(9000);
-  away.exchange(home);
-  away.readPair();
-  away.now = Time(5001);
-  away.switchOn(9000);  // echoes
-  home.now = Time(5002);
-  home.write("flag", false);
-  EXPECT_EQ(home.stamp("flag").tick, 0) << "a person's, before the end";
-  away.exchange(home);
-  away.read("flag");
-  EXPECT_TRUE(away.write("flagExpiration", std::nullopt));
   away.write("other", 1);
-  EXPECT_GT(away.stamp("other").microseconds, 5'000'000'000) << "a burst of its own";
+  EXPECT_EQ(away.stamp("other").microseconds, 4'999'200'000) << "a burst of its own";
+  away.exchange(home);
+  EXPECT_EQ(cloudValues(away.entries).at("flagExpiration"), Value(9000.0)) << "the newest period stands";
+
+  // Begun anew between the two writes of an expiry.
+  away.now = Time(9000);
+  away.write("flag", false);
+  home.now = Time(9000);
+  home.switchOff();
+  home.switchOn(12000);
+  away.exchange(home);
+  EXPECT_FALSE(away.write("flagExpiration", std::nullopt));
+  EXPECT_EQ(away.values(), R"(["flag": true, "flagExpiration": 12000.0, "other": 1])");
+
+  // A person's "off" before the end is one with the stamp of now.
+  for (const char* key : {"flag", "flagExpiration"}) away.read(key);
+  away.switchOff();
+  EXPECT_EQ(away.stamp("flag").tick, 0);
+  home.exchange(away);
+  EXPECT_EQ(home.values(), R"(["flag": false, "other": 1])");
+
+  // An expiry long past does not keep a later removal of an end from being news.
+  home.switchOn(home.now.count());
+  home.switchOff();
+  away.now = home.now + Time(100);
+  away.exchange(home);
+  away.switchOn(20000);
+  home.exchange(away);
+  for (const char* key : {"flag", "flagExpiration"}) home.read(key);
+  home.now = away.now + Time(1);
+  home.switchOn(20000);  // echoes
+  away.now += Time(2);
+  away.write("flag", false);
+  mergeCloudEntries(away.entries, home.entries, home.now);
+  home.read("flag");
+  EXPECT_TRUE(home.write("flagExpiration", std::nullopt));
 }
 
 TEST(CloudReplicaTest, ASwitchThatIsOvertakenMidwayLosesBothItsKeys) {
@@ -133,7 +171,7 @@ TEST(CloudReplicaTest, AFollowerOfHalfASwitchOutranksNothingNewer) {
     Device cut("cut"), third("third"), home("home");
     if (!isOn) cut.switchOn(5000);
     third.exchange(cut);
-    third.readPair();
+    for (const char* key : {"flag", "flagExpiration"}) third.read(key);
     cut.now += Time(1);
     cut.write("flag", isOn);
     third.exchange(cut);
@@ -148,6 +186,43 @@ TEST(CloudReplicaTest, AFollowerOfHalfASwitchOutranksNothingNewer) {
   }
 }
 
+TEST(CloudReplicaTest, ASlowSwitchKeepsItsPairTogetherWhateverItsFollowersWrite) {
+  Device slow("slow"), follower("follower");
+  slow.write("flag", true);
+  follower.exchange(slow);
+  follower.write("flagExpiration", 9000.0);
+  slow.exchange(follower);
+  slow.write("flagExpiration", 5000.0);
+  follower.exchange(slow);
+  EXPECT_EQ(follower.values(), R"(["flag": true, "flagExpiration": 5000.0])");
+  EXPECT_EQ(follower.stamp("flagExpiration"), follower.stamp("flag"));
+
+  slow.now += Time(1);
+  slow.write("flag", false);
+  follower.exchange(slow);
+  follower.now = Time(5000);
+  follower.switchOff();  // its end, there
+  slow.exchange(follower);
+  slow.write("flagExpiration", std::nullopt);
+  EXPECT_EQ(slow.entries, follower.entries);
+}
+
+TEST(CloudReplicaTest, AnExpiryEndsNoSwitchOfTheSameMomentAndIsNoEcho) {
+  Device loser("a"), winner("b"), third("c");
+  third.now = Time(900);
+  third.write("flag", false);
+  loser.switchOn(2000);
+  winner.switchOn(9000);
+  third.exchange(loser);
+  loser.now = third.now = Time(3000);
+  EXPECT_TRUE(third.write("flag", false)) << "though it last wrote the same";
+  third.write("flagExpiration", std::nullopt);
+  loser.switchOff();
+  EXPECT_EQ(loser.entries, third.entries);
+  third.exchange(winner);
+  EXPECT_EQ(third.values(), R"(["flag": true, "flagExpiration": 9000.0])");
+}
+
 TEST(CloudReplicaTest, AClockThatIsYearsAheadIsOverruledAndNotFollowed) {
   Device ahead("ahead"), sane("sane");
   ahead.now = Time(1e8);
@@ -160,7 +235,7 @@ TEST(CloudReplicaTest, AClockThatIsYearsAheadIsOverruledAndNotFollowed) {
   EXPECT_EQ(sane.stamp("flagExpiration"), sane.stamp("flag"));
   ahead.exchange(sane);
   EXPECT_EQ(ahead.values(), R"(["flag": false, "other": 1])");
-  ahead.readPair();
+  for (const char* key : {"flag", "flagExpiration"}) ahead.read(key);
   ahead.now = sane.now = Time(2000);  // mended
   ahead.switchOn(5000);
   sane.exchange(ahead);
