@@ -17,21 +17,20 @@ Result<void> writeNew(FileSystem& files, const std::string& path, std::string_vi
   return (*file)->sync();
 }
 
-// Opened anew: to let go of one that was written to is an event for whoever watches the folder.
-Result<HeldFile> hold(FileSystem& files, const std::string& path) {
-  auto file = files.openToRead(path);
-  if (!file) return file.error();
-  const auto identity = (*file)->identity();
-  if (!identity) return identity.error();
-  return HeldFile{std::move(*file), *identity};
-}
-
 }  // namespace
 
 std::string folderOf(const std::string& path) {
   const auto slash = path.rfind('/');
   if (slash == std::string::npos) return ".";
   return slash == 0 ? "/" : path.substr(0, slash);
+}
+
+Result<HeldFile> hold(FileSystem& files, const std::string& path) {
+  auto file = files.openToRead(path);
+  if (!file) return file.error();
+  const auto identity = (*file)->identity();
+  if (!identity) return identity.error();
+  return HeldFile{std::move(*file), *identity};
 }
 
 Result<std::string> readFile(FileSystem& files, const std::string& path, std::size_t limit) {
@@ -65,6 +64,7 @@ Result<std::string> moveAside(FileSystem& files, const std::string& path) {
 Result<HeldFile> replaceFile(FileSystem& files, const std::string& path, std::string_view bytes) {
   const std::string temporary = path + ".new";
   const auto written = writeNew(files, temporary, bytes);
+  // Opened anew: to let go of one that was written to is an event for whoever watches the folder.
   auto made = written ? hold(files, temporary) : Result<HeldFile>(written.error());
   const auto renamed = made ? files.rename(temporary, path) : Result<void>(made.error());
   if (!renamed) {

@@ -80,6 +80,13 @@ class FileSystem {
 // The folder that `path` lies in.
 std::string folderOf(const std::string& path);
 
+// An open file, so that its identity stays its own.
+struct HeldFile {
+  std::unique_ptr<File> file;
+  FileIdentity identity;
+};
+Result<HeldFile> hold(FileSystem& files, const std::string& path);
+
 // The whole of a file.
 Result<std::string> readFile(FileSystem& files, const std::string& path, std::size_t limit);
 
@@ -92,13 +99,7 @@ Result<std::string> moveAside(FileSystem& files, const std::string& path);
 
 // Replaces `path`, durably and in one step: temporary file beside it, sync, rename, sync of the folder. On
 // failure the old file is as it was and the temporary one is gone; where the last sync alone fails, the new
-// one is there.
-//
-// The new file, held open, so that its identity stays its own.
-struct HeldFile {
-  std::unique_ptr<File> file;
-  FileIdentity identity;
-};
+// one is there. The new file, held.
 Result<HeldFile> replaceFile(FileSystem& files, const std::string& path, std::string_view bytes);
 
 }  // namespace platform::linux_

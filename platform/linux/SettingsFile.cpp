@@ -77,14 +77,12 @@ Result<void> SettingsFile::refresh() {
 }
 
 Result<void> SettingsFile::load() {
-  auto file = files.openToRead(path);
-  if (!file) return file.error();
-  const auto identity = (*file)->identity();
-  if (!identity) return identity.error();
+  auto there = linux_::hold(files, path);
+  if (!there) return there.error();
   std::string problem;
-  const auto loaded = readDocument(**file, problem);
+  const auto loaded = readDocument(*there->file, problem);
   if (!loaded && problem.empty()) return loaded.error();
-  hold({std::move(*file), *identity}, loaded ? *loaded : nullptr);
+  hold(std::move(*there), loaded ? *loaded : nullptr);
   damage = loaded ? "" : problem;
   return {};
 }
